@@ -1,0 +1,84 @@
+// Named serial work queues.
+//
+// A Queue is one named thread (pthread_setname_np) draining a list of tasks in submission order.
+// `async` queues a task; `sync` queues it and waits for it. A task must not `sync` onto the queue
+// it runs on: that would wait for itself forever, so it is a programming error and aborts with a
+// message. "Must run on queue X" is written `X->assertCurrent()`, which aborts elsewhere and tells
+// clang's thread-safety analysis that the queue's capability is held.
+//
+// A queue lives as long as someone holds its shared_ptr; destroying it drains the tasks already
+// queued, then ends the thread. Tasks should capture a weak or shared owner, never a raw `this`.
+//
+// Thread-safety: every member is safe to call from any thread.
+#pragma once
+
+#include <condition_variable>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <type_traits>
+
+#include "platform/dispatch/ThreadSafety.h"
+
+namespace corvane::dispatch {
+
+// Priority classes. Linux applies them as a nice value of the queue's thread where the process is
+// allowed to (raising priority needs CAP_SYS_NICE, so user-initiated work usually runs at the
+// process's own nice value); the class is stored either way.
+enum class QoS { Background, Utility, Default, UserInitiated, UserInteractive };
+
+class CAPABILITY("queue") Queue {
+public:
+    static std::shared_ptr<Queue> create(std::string label, QoS qos = QoS::Default);
+    ~Queue();
+    Queue(const Queue&) = delete;
+    Queue& operator=(const Queue&) = delete;
+
+    void async(std::function<void()> task);
+    // Runs the task on the queue and waits until it has run.
+    void sync(const std::function<void()>& task);
+    // Runs `fn` on the queue and returns its result.
+    template <class F>
+    auto syncResult(F&& fn) -> std::invoke_result_t<F> {
+        using R = std::invoke_result_t<F>;
+        if constexpr (std::is_void_v<R>) {
+            sync(std::function<void()>(std::forward<F>(fn)));
+        } else {
+            std::optional<R> result;
+            sync([&] { result.emplace(fn()); });
+            return std::move(*result);
+        }
+    }
+
+    bool isCurrent() const;
+    // Aborts with a message naming the queue unless called on it.
+    void assertCurrent() const ASSERT_CAPABILITY(this);
+    // Aborts unless called off the queue (entering it synchronously would deadlock).
+    void assertNotCurrent() const;
+
+    const std::string& label() const { return label_; }
+    QoS qos() const { return qos_; }
+
+    // The queue the calling thread is draining, or null on a thread that is no queue's.
+    static Queue* current();
+
+private:
+    Queue(std::string label, QoS qos);
+    void run();
+
+    const std::string label_;
+    const QoS qos_;
+    std::mutex mutex_;
+    std::condition_variable wake_;
+    std::deque<std::function<void()>> tasks_;
+    bool stopping_ = false;
+    std::thread thread_;
+};
+
+using QueuePtr = std::shared_ptr<Queue>;
+
+}  // namespace corvane::dispatch

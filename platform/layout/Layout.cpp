@@ -1,0 +1,83 @@
+#include "platform/layout/Layout.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+
+namespace corvane::layout {
+
+namespace {
+
+std::string env(const char* name) {
+    const char* v = std::getenv(name);
+    return v ? std::string(v) : std::string();
+}
+
+}  // namespace
+
+std::string root() {
+    std::string r = env("CORVANE_ROOT");
+    while (r.size() > 1 && r.back() == '/') r.pop_back();
+    if (r == "/") r.clear();
+    return r;
+}
+
+std::string underRoot(const std::string& absolutePath) { return root() + absolutePath; }
+
+std::string runtimeDir() {
+    std::string uid = std::to_string(getuid());
+    std::string r = root();
+    if (!r.empty()) return r + "/run/user/" + uid;
+    std::string xdg = env("XDG_RUNTIME_DIR");
+    return xdg.empty() ? "/run/user/" + uid : xdg;
+}
+
+std::string homeDir() {
+    std::string r = root();
+    if (!r.empty()) return r + "/home";
+    std::string home = env("HOME");
+    return home.empty() ? "/" : home;
+}
+
+std::string userDataDir() {
+    if (root().empty()) {
+        std::string xdg = env("XDG_DATA_HOME");
+        if (!xdg.empty()) return xdg + "/corvane";
+    }
+    return homeDir() + "/.local/share/corvane";
+}
+
+std::string userConfigDir() {
+    if (root().empty()) {
+        std::string xdg = env("XDG_CONFIG_HOME");
+        if (!xdg.empty()) return xdg + "/corvane";
+    }
+    return homeDir() + "/.config/corvane";
+}
+
+std::string stateDir() { return underRoot("/var/lib/corvane"); }
+std::string configDir() { return underRoot("/etc/corvane"); }
+std::string sharedDataDir() { return underRoot("/usr/share/corvane"); }
+std::string systemRoot() { return underRoot("/System"); }
+
+MaybeError makeDirectories(const std::string& path, mode_t mode) {
+    if (path.empty()) return Error::posix(ENOENT, path);
+    std::string partial;
+    size_t pos = 0;
+    while (pos != std::string::npos) {
+        size_t slash = path.find('/', pos + 1);
+        partial = path.substr(0, slash);
+        pos = slash;
+        if (partial.empty() || partial == "/") continue;
+        if (::mkdir(partial.c_str(), mode) != 0 && errno != EEXIST)
+            return Error::posix(errno, partial);
+    }
+    struct stat st {};
+    if (::stat(path.c_str(), &st) != 0) return Error::posix(errno, path);
+    if (!S_ISDIR(st.st_mode)) return Error::posix(ENOTDIR, path);
+    return std::nullopt;
+}
+
+}  // namespace corvane::layout

@@ -1,0 +1,47 @@
+// Where the platform keeps its files.
+//
+// Every platform path sits under one root. The environment variable CORVANE_ROOT moves that root,
+// so that tests, benchmarks and the demo each run a whole private platform in a directory of their
+// own; it is read on every call. Without it the ordinary places are used. docs/platform-layout.md
+// lists every path.
+//
+// Thread-safety: every function is safe to call from any thread (the environment must not be
+// changed while other threads run).
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+
+#include "platform/value/Value.h"
+
+namespace corvane::layout {
+
+// CORVANE_ROOT without a trailing slash, or "" when it is not set.
+std::string root();
+
+// The user's runtime directory: <root>/run/user/<uid>, or $XDG_RUNTIME_DIR, or /run/user/<uid>.
+std::string runtimeDir();
+// The user's home for platform data: <root>/home, or $HOME.
+std::string homeDir();
+// Per-user data: <root>/home/.local/share/corvane, or $XDG_DATA_HOME/corvane
+// (default ~/.local/share/corvane).
+std::string userDataDir();
+// Per-user configuration: <root>/home/.config/corvane, or $XDG_CONFIG_HOME/corvane.
+std::string userConfigDir();
+// System-wide state: <root>/var/lib/corvane.
+std::string stateDir();
+// System-wide configuration: <root>/etc/corvane.
+std::string configDir();
+// Read-only shared data: <root>/usr/share/corvane.
+std::string sharedDataDir();
+// The system volume: <root>/System. Bundles under it are system resident.
+std::string systemRoot();
+// Places a platform path (written as on a real system, "/var/db/...") under the root.
+std::string underRoot(const std::string& absolutePath);
+
+// Creates a directory and its missing parents with the given mode (existing ones are left as they
+// are). Returns the errno value on failure.
+MaybeError makeDirectories(const std::string& path, mode_t mode);
+
+}  // namespace corvane::layout

@@ -1,0 +1,49 @@
+// Property lists and whole-file atomic replacement.
+//
+// Reading accepts the XML and the binary forms (libplist). Writing produces the XML form, format
+// version 1.0. Integers read back as signed 64-bit values; a value past the signed range is read
+// as the negative number with the same 64 bits, as the binary form stores it. Writing keeps
+// signed and unsigned integers exact (libplist 2.2 has no signed integer node, so the XML writer
+// is our own). Dates are written to the whole second, as the XML form carries them.
+//
+// Values with no property-list form (null, UUID, file descriptor, strings with characters XML
+// cannot carry) make writing fail with an error of the domain kPlistErrorDomain; nothing is
+// written then.
+//
+// Thread-safety: every function here is safe to call from any thread.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <string_view>
+
+#include "platform/value/Value.h"
+
+namespace corvane::plist {
+
+inline constexpr const char* kPlistErrorDomain = "com.corvane.plist";
+inline constexpr int64_t kPlistReadCorrupt = 3840;
+inline constexpr int64_t kPlistWriteInvalid = 3851;
+
+// Parses bytes in either form.
+Result<Value> parse(std::string_view bytes);
+// Reads a whole file and parses it. A missing file is Error::file's kFileNoSuchFile.
+Result<Value> readFile(const std::string& path);
+
+// The XML form of a value.
+Result<std::string> toXML(const Value& value);
+
+// Reads a whole file.
+Result<std::string> readWholeFile(const std::string& path);
+
+// Replaces the file at `path` with `bytes` so that a reader sees the old contents or the new, never
+// a mix, also across a crash: a temporary file beside the target is written in full, fsynced,
+// renamed over the target, and the directory is fsynced. A failure leaves the old file as it was
+// and no temporary file behind. The new file gets `mode` (masked by the umask).
+MaybeError writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666);
+
+// toXML, then writeFileAtomically.
+MaybeError writeXMLFile(const std::string& path, const Value& value, mode_t mode = 0666);
+
+}  // namespace corvane::plist

@@ -1,0 +1,237 @@
+// Typed values: the in-memory form of messages, property lists, bundle metadata, plug-in forms and
+// stored annotations.
+//
+// A Value is one of: null, boolean, signed or unsigned 64-bit integer, double, string, data, date,
+// UUID, array, dictionary (string keys) or an open file descriptor (only messages carry those).
+// Values are immutable and cheap to copy: containers and byte strings are shared, never edited in
+// place. To change a dictionary, copy it out (`Dictionary d = *v.asDictionary();`), change the copy
+// and make a new Value from it.
+//
+// Equality is by content. Numbers compare by numeric value across their kinds, and a boolean
+// equals the number 1 (true) or 0 (false); strings, data, dates, arrays and dictionaries never
+// equal a boolean.
+//
+// Thread-safety: a Value may be read from any number of threads at once.
+#pragma once
+
+#include <array>
+#include <compare>
+#include <concepts>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+namespace corvane {
+
+// 16 bytes naming one thing; text form is 36 upper-case hexadecimal digits in groups 8-4-4-4-12.
+struct UUID {
+    std::array<uint8_t, 16> bytes{};
+
+    static UUID random();
+    // Accepts upper- or lower-case digits; anything but the 36-character grouped form fails.
+    static std::optional<UUID> parse(std::string_view text);
+    std::string string() const;
+
+    auto operator<=>(const UUID&) const = default;
+};
+
+struct UUIDHash {
+    size_t operator()(const UUID& uuid) const noexcept;
+};
+
+// A moment in time: microseconds since 1970-01-01 00:00:00 UTC.
+struct Date {
+    int64_t micros = 0;
+
+    static Date now();
+    static Date fromSeconds(double seconds);
+    double seconds() const { return static_cast<double>(micros) / 1e6; }
+    // Whole seconds, truncated toward zero.
+    int64_t wholeSeconds() const { return micros / 1000000; }
+
+    auto operator<=>(const Date&) const = default;
+};
+
+// Sole owner of an open file descriptor; closes it when the last Value holding it goes.
+class FileDescriptor {
+public:
+    explicit FileDescriptor(int fd) noexcept : fd_(fd) {}
+    ~FileDescriptor();
+    FileDescriptor(const FileDescriptor&) = delete;
+    FileDescriptor& operator=(const FileDescriptor&) = delete;
+
+    int get() const noexcept { return fd_; }
+    // Gives up ownership; the caller closes the descriptor.
+    int release() noexcept;
+
+private:
+    int fd_;
+};
+
+class Value;
+using Dictionary = std::map<std::string, Value, std::less<>>;
+using Array = std::vector<Value>;
+using Bytes = std::vector<uint8_t>;
+
+class Value {
+public:
+    enum class Kind : uint8_t {
+        Null,
+        Bool,
+        Int64,
+        UInt64,
+        Double,
+        String,
+        Data,
+        Date,
+        UUID,
+        Array,
+        Dictionary,
+        Fd,
+    };
+
+    Value() = default;
+    Value(std::nullptr_t) {}  // NOLINT(google-explicit-constructor)
+    template <class T>
+        requires std::same_as<T, bool>
+    Value(T b) : v_(b) {}  // NOLINT(google-explicit-constructor)
+    template <std::signed_integral T>
+    Value(T i) : v_(static_cast<int64_t>(i)) {}  // NOLINT(google-explicit-constructor)
+    template <std::unsigned_integral T>
+        requires(!std::same_as<T, bool>)
+    Value(T u) : v_(static_cast<uint64_t>(u)) {}  // NOLINT(google-explicit-constructor)
+    Value(double d) : v_(d) {}                      // NOLINT(google-explicit-constructor)
+    Value(std::string s) : v_(std::move(s)) {}      // NOLINT(google-explicit-constructor)
+    Value(std::string_view s) : v_(std::string(s)) {}  // NOLINT(google-explicit-constructor)
+    Value(const char* s) : v_(std::string(s)) {}    // NOLINT(google-explicit-constructor)
+    Value(Date d) : v_(d) {}                        // NOLINT(google-explicit-constructor)
+    Value(corvane::UUID u) : v_(u) {}               // NOLINT(google-explicit-constructor)
+    Value(Array a);                                 // NOLINT(google-explicit-constructor)
+    Value(Dictionary d);                            // NOLINT(google-explicit-constructor)
+    Value(std::shared_ptr<FileDescriptor> fd);      // NOLINT(google-explicit-constructor)
+    static Value data(Bytes bytes);
+    static Value data(const void* bytes, size_t size);
+
+    Kind kind() const { return static_cast<Kind>(v_.index()); }
+    static const char* kindName(Kind kind);
+
+    bool isNull() const { return kind() == Kind::Null; }
+    bool isBool() const { return kind() == Kind::Bool; }
+    bool isString() const { return kind() == Kind::String; }
+    bool isArray() const { return kind() == Kind::Array; }
+    bool isDictionary() const { return kind() == Kind::Dictionary; }
+    bool isData() const { return kind() == Kind::Data; }
+    bool isDate() const { return kind() == Kind::Date; }
+    bool isUUID() const { return kind() == Kind::UUID; }
+    bool isFd() const { return kind() == Kind::Fd; }
+    // A number in the wide sense: boolean, integer or double.
+    bool isNumber() const;
+    bool isInteger() const { return kind() == Kind::Int64 || kind() == Kind::UInt64; }
+
+    // Typed access: null when the value is of another kind.
+    const std::string* asString() const { return std::get_if<std::string>(&v_); }
+    const Dictionary* asDictionary() const;
+    const Array* asArray() const;
+    const Bytes* asData() const;
+    const Date* asDate() const { return std::get_if<Date>(&v_); }
+    const corvane::UUID* asUUID() const { return std::get_if<corvane::UUID>(&v_); }
+    const std::shared_ptr<FileDescriptor>* asFd() const;
+
+    // Numeric readings of a number (see isNumber); nullopt for anything else. Doubles truncate
+    // toward zero (and saturate); integers of the other signedness wrap like a C cast.
+    std::optional<int64_t> int64Value() const;
+    std::optional<uint64_t> uint64Value() const;
+    std::optional<double> doubleValue() const;
+    // The boolean itself, or a number compared with zero; nullopt for anything else.
+    std::optional<bool> boolValue() const;
+
+    // Dictionary lookup. `find` distinguishes an absent key (nullptr) from a stored value;
+    // operator[] answers a shared null for an absent key or a value that is no dictionary.
+    const Value* find(std::string_view key) const;
+    const Value& operator[](std::string_view key) const;
+    bool has(std::string_view key) const { return find(key) != nullptr; }
+
+    // True when this value equals the boolean true / false by the number-boolean rule.
+    bool isTrue() const { return *this == Value(true); }
+    bool isFalse() const { return *this == Value(false); }
+
+    // The text notation (docs/rpx-wire.md): round-trips through parse().
+    std::string description() const;
+    // Reads one value in the text notation; nullopt on anything malformed or trailing text.
+    static std::optional<Value> parse(std::string_view text);
+
+    friend bool operator==(const Value& a, const Value& b);
+
+    static const Value& null();
+
+private:
+    std::variant<std::monostate, bool, int64_t, uint64_t, double, std::string,
+                 std::shared_ptr<const Bytes>, Date, corvane::UUID, std::shared_ptr<const Array>,
+                 std::shared_ptr<const Dictionary>, std::shared_ptr<FileDescriptor>>
+        v_;
+};
+
+// Shorthand for building small dictionaries in code: dict({{"a", 1}, {"b", "x"}}).
+inline Value dict(std::initializer_list<Dictionary::value_type> entries) {
+    return Value(Dictionary(entries));
+}
+
+// True when the bytes are well-formed UTF-8 (no overlong forms, surrogates or values past U+10FFFF).
+bool isValidUtf8(std::string_view text);
+
+// An error value: a domain, an integer code and an optional description text.
+struct Error {
+    std::string domain;
+    int64_t code = 0;
+    std::optional<std::string> text;
+
+    // The text, or "Error Domain=<domain> Code=<code>" when there is none.
+    std::string description() const;
+
+    // Domain "POSIX" with the errno value and its strerror text, optionally prefixed by context.
+    static Error posix(int err, std::string_view context = {});
+    // The file error of a failed read or write of `path` with errno `err` (domain kFileDomain).
+    static Error file(int err, std::string_view path, bool writing);
+};
+
+inline constexpr const char* kPosixErrorDomain = "POSIX";
+// File errors: kFileNoSuchFile for a missing file, kFileNoPermission, kFileReadUnknown for any
+// other read failure and kFileWriteUnknown for any failed write.
+inline constexpr const char* kFileErrorDomain = "com.corvane.file";
+inline constexpr int64_t kFileReadUnknown = 256;
+inline constexpr int64_t kFileNoPermission = 257;
+inline constexpr int64_t kFileNoSuchFile = 260;
+inline constexpr int64_t kFileWriteUnknown = 512;
+
+// nullopt on success, else the error.
+using MaybeError = std::optional<Error>;
+
+// A value or the error that kept it from being made.
+template <class T>
+class Result {
+public:
+    Result(T value) : v_(std::move(value)) {}   // NOLINT(google-explicit-constructor)
+    Result(Error error) : v_(std::move(error)) {}  // NOLINT(google-explicit-constructor)
+
+    bool ok() const { return v_.index() == 0; }
+    explicit operator bool() const { return ok(); }
+    T& value() & { return std::get<0>(v_); }
+    const T& value() const& { return std::get<0>(v_); }
+    T&& value() && { return std::get<0>(std::move(v_)); }
+    const Error& error() const { return std::get<1>(v_); }
+    T* operator->() { return &value(); }
+    const T* operator->() const { return &value(); }
+    T& operator*() & { return value(); }
+    const T& operator*() const& { return value(); }
+
+private:
+    std::variant<T, Error> v_;
+};
+
+}  // namespace corvane

@@ -1,0 +1,183 @@
+#include "tests/support/TestSupport.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <stdexcept>
+#include <thread>
+
+extern char** environ;
+
+namespace axtest {
+
+TempDir::TempDir() {
+    char tmpl[] = "/tmp/axtest.XXXXXX";
+    if (!mkdtemp(tmpl)) throw std::runtime_error("mkdtemp failed");
+    path_ = tmpl;
+}
+
+TempDir::~TempDir() {
+    std::error_code ec;
+    std::filesystem::remove_all(path_, ec);
+}
+
+PlatformRoot::PlatformRoot() {
+    if (const char* prev = std::getenv("CORVANE_ROOT")) previous_ = prev;
+    setenv("CORVANE_ROOT", dir_.path().c_str(), 1);
+}
+
+PlatformRoot::~PlatformRoot() {
+    if (previous_) {
+        setenv("CORVANE_ROOT", previous_->c_str(), 1);
+    } else {
+        unsetenv("CORVANE_ROOT");
+    }
+}
+
+std::string binary(const std::string& name) {
+    const char* bin = std::getenv("AX_BUILD_BIN");
+    if (bin) return std::string(bin) + "/" + name;
+    // Tests run from build/tests or build/bin; fall back to the directory of this program.
+    char self[4096];
+    ssize_t n = readlink("/proc/self/exe", self, sizeof self - 1);
+    if (n <= 0) return name;
+    self[n] = 0;
+    return std::filesystem::path(self).parent_path().string() + "/" + name;
+}
+
+std::string sourceDir() {
+    const char* src = std::getenv("AX_SOURCE_DIR");
+    return src ? src : ".";
+}
+
+void writeFile(const std::string& path, const std::string& contents, int mode) {
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    std::ofstream f(path, std::ios::binary | std::ios::trunc);
+    f << contents;
+    f.close();
+    chmod(path.c_str(), static_cast<mode_t>(mode));
+}
+
+std::string readFile(const std::string& path) {
+    std::ifstream f(path, std::ios::binary);
+    std::stringstream ss;
+    ss << f.rdbuf();
+    return ss.str();
+}
+
+bool exists(const std::string& path) {
+    struct stat st {};
+    return lstat(path.c_str(), &st) == 0;
+}
+
+Process::Process(std::vector<std::string> argv, std::map<std::string, std::string> env) {
+    std::vector<std::string> envStrings;
+    for (char** e = environ; *e; ++e) {
+        std::string entry = *e;
+        std::string key = entry.substr(0, entry.find('='));
+        if (!env.count(key)) envStrings.push_back(entry);
+    }
+    for (auto& [k, v] : env) envStrings.push_back(k + "=" + v);
+    std::vector<char*> args;
+    for (auto& a : argv) args.push_back(a.data());
+    args.push_back(nullptr);
+    std::vector<char*> envp;
+    for (auto& e : envStrings) envp.push_back(e.data());
+    envp.push_back(nullptr);
+
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
+    std::string outPath = files_ / "out";
+    std::string errPath = files_ / "err";
+    posix_spawn_file_actions_addopen(&actions, 1, outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    posix_spawn_file_actions_addopen(&actions, 2, errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int rc = posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), envp.data());
+    posix_spawn_file_actions_destroy(&actions);
+    if (rc != 0) throw std::runtime_error("cannot start " + argv[0] + ": " + std::strerror(rc));
+}
+
+Process::~Process() {
+    if (!reaped_ && pid_ > 0) {
+        kill(pid_, SIGKILL);
+        int status = 0;
+        waitpid(pid_, &status, 0);
+    }
+}
+
+std::optional<int> Process::wait(std::chrono::milliseconds timeout) {
+    if (reaped_) return std::nullopt;
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        int status = 0;
+        pid_t r = waitpid(pid_, &status, WNOHANG);
+        if (r == pid_) {
+            reaped_ = true;
+            if (WIFEXITED(status)) return WEXITSTATUS(status);
+            return 128 + WTERMSIG(status);
+        }
+        if (std::chrono::steady_clock::now() > deadline) return std::nullopt;
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+}
+
+void Process::signal(int sig) {
+    if (!reaped_) kill(pid_, sig);
+}
+
+std::string Process::out() const { return readFile(files_ / "out"); }
+std::string Process::err() const { return readFile(files_ / "err"); }
+
+bool Process::waitForErr(const std::string& text, std::chrono::milliseconds timeout) const {
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+        if (err().find(text) != std::string::npos) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+}
+
+RunResult run(std::vector<std::string> argv, std::map<std::string, std::string> env,
+              const std::string& input) {
+    TempDir dir;
+    std::string inPath = dir / "in";
+    writeFile(inPath, input);
+    std::vector<std::string> envStrings;
+    for (char** e = environ; *e; ++e) {
+        std::string entry = *e;
+        if (!env.count(entry.substr(0, entry.find('=')))) envStrings.push_back(entry);
+    }
+    for (auto& [k, v] : env) envStrings.push_back(k + "=" + v);
+    std::vector<char*> args;
+    for (auto& a : argv) args.push_back(a.data());
+    args.push_back(nullptr);
+    std::vector<char*> envp;
+    for (auto& e : envStrings) envp.push_back(e.data());
+    envp.push_back(nullptr);
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_addopen(&actions, 0, inPath.c_str(), O_RDONLY, 0);
+    std::string outPath = dir / "out";
+    std::string errPath = dir / "err";
+    posix_spawn_file_actions_addopen(&actions, 1, outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    posix_spawn_file_actions_addopen(&actions, 2, errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    pid_t pid = -1;
+    int rc = posix_spawn(&pid, args[0], &actions, nullptr, args.data(), envp.data());
+    posix_spawn_file_actions_destroy(&actions);
+    if (rc != 0) return {127, "", std::string("cannot start: ") + std::strerror(rc)};
+    int status = 0;
+    waitpid(pid, &status, 0);
+    int code = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    return {code, readFile(outPath), readFile(errPath)};
+}
+
+}  // namespace axtest
