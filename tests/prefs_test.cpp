@@ -1,0 +1,42 @@
+#include <gtest/gtest.h>
+
+#include "platform/plist/Plist.h"
+#include "platform/prefs/Prefs.h"
+#include "tests/support/TestSupport.h"
+
+namespace prefs = corvane::prefs;
+using corvane::Value;
+
+TEST(Prefs, EveryReadSeesTheFileAsItIsNow) {
+    axtest::PlatformRoot root;
+    const std::string domain = "com.corvane.annexa.userprefs";
+    EXPECT_TRUE(prefs::copyValue("exclusions", domain).isNull());
+    Value exclusions(corvane::Array{corvane::dict({{"KSExtensionIdentifier", "com.example.a"}})});
+    ASSERT_FALSE(prefs::setValue("exclusions", exclusions, domain));
+    EXPECT_EQ(prefs::copyValue("exclusions", domain), exclusions);
+    // Another writer replaces the file behind our back: the next read sees it.
+    ASSERT_FALSE(corvane::plist::writeXMLFile(prefs::domainPath(domain),
+                                              corvane::dict({{"exclusions", "not an array"}})));
+    EXPECT_EQ(prefs::copyValue("exclusions", domain), Value("not an array"));
+    ASSERT_FALSE(prefs::setValue("exclusions", Value(), domain));
+    EXPECT_TRUE(prefs::copyValue("exclusions", domain).isNull());
+    // A file that is no property list reads as no values at all.
+    axtest::writeFile(prefs::domainPath(domain), "garbage");
+    EXPECT_TRUE(prefs::copyValue("exclusions", domain).isNull());
+    EXPECT_EQ(prefs::domainPath(domain).rfind(root.path(), 0), 0u);
+}
+
+TEST(Prefs, SearchListAndUnusableDomains) {
+    axtest::PlatformRoot root;
+    ASSERT_FALSE(prefs::setValue("k", 1, "a"));
+    ASSERT_FALSE(prefs::setValue("k", 2, "b"));
+    prefs::UserDefaults defaults;
+    defaults.addSuite("b");
+    defaults.addSuite("a");
+    EXPECT_EQ(defaults.objectForKey("k"), Value(2));
+    EXPECT_TRUE(defaults.objectForKey("missing").isNull());
+    for (const char* bad : {"", "../x", ".hidden", "a/b"}) {
+        EXPECT_TRUE(prefs::setValue("k", 1, bad)) << bad;
+        EXPECT_TRUE(prefs::copyValue("k", bad).isNull()) << bad;
+    }
+}
