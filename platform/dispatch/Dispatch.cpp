@@ -7,13 +7,26 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <condition_variable>
+#include <deque>
+#include <mutex>
 #include <optional>
 
 namespace corvane::dispatch {
 
+struct Queue::State {
+    State(std::string l, QoS q) : label(std::move(l)), qos(q) {}
+    const std::string label;
+    const QoS qos;
+    std::mutex mutex;
+    std::condition_variable wake;
+    std::deque<std::function<void()>> tasks;
+    bool stopping = false;
+};
+
 namespace {
 
-thread_local Queue* tCurrent = nullptr;
+thread_local const void* tCurrent = nullptr;
 
 int niceFor(QoS qos) {
     switch (qos) {
@@ -32,64 +45,69 @@ int niceFor(QoS qos) {
     std::abort();
 }
 
-}  // namespace
-
-std::shared_ptr<Queue> Queue::create(std::string label, QoS qos) {
-    return std::shared_ptr<Queue>(new Queue(std::move(label), qos));
-}
-
-Queue::Queue(std::string label, QoS qos) : label_(std::move(label)), qos_(qos) {
-    thread_ = std::thread([this] { run(); });
-}
-
-Queue::~Queue() {
-    {
-        std::lock_guard lock(mutex_);
-        stopping_ = true;
-    }
-    wake_.notify_all();
-    if (std::this_thread::get_id() == thread_.get_id()) {
-        // The last owner let go from a task of this very queue: the thread ends by itself once
-        // the current task returns.
-        thread_.detach();
-    } else {
-        thread_.join();
-    }
-}
-
-void Queue::run() {
+template <class State>
+void drain(const std::shared_ptr<State>& state) {
     // Thread names are at most 15 bytes.
-    pthread_setname_np(pthread_self(), label_.substr(0, 15).c_str());
-    int nice = niceFor(qos_);
+    pthread_setname_np(pthread_self(), state->label.substr(0, 15).c_str());
+    int nice = niceFor(state->qos);
     if (nice != 0) {
         // Per-thread nice value; raising priority fails without CAP_SYS_NICE, which is fine.
         (void)setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), nice);
     }
-    tCurrent = this;
+    tCurrent = state.get();
     for (;;) {
         std::function<void()> task;
         {
-            std::unique_lock lock(mutex_);
-            wake_.wait(lock, [this] { return stopping_ || !tasks_.empty(); });
-            if (tasks_.empty()) break;
-            task = std::move(tasks_.front());
-            tasks_.pop_front();
+            std::unique_lock lock(state->mutex);
+            state->wake.wait(lock, [&] { return state->stopping || !state->tasks.empty(); });
+            if (state->tasks.empty()) break;
+            task = std::move(state->tasks.front());
+            state->tasks.pop_front();
         }
         task();
     }
     tCurrent = nullptr;
 }
 
+}  // namespace
+
+std::shared_ptr<Queue> Queue::create(std::string label, QoS qos) {
+    return std::shared_ptr<Queue>(new Queue(std::move(label), qos));
+}
+
+Queue::Queue(std::string label, QoS qos)
+    : state_(std::make_shared<State>(std::move(label), qos)) {
+    thread_ = std::thread([state = state_] { drain(state); });
+}
+
+Queue::~Queue() {
+    {
+        std::lock_guard lock(state_->mutex);
+        state_->stopping = true;
+    }
+    state_->wake.notify_all();
+    if (std::this_thread::get_id() == thread_.get_id()) {
+        // The last owner let go from a task of this very queue: the thread drains what is left
+        // and ends by itself, keeping the shared state alive until then.
+        thread_.detach();
+    } else {
+        thread_.join();
+    }
+}
+
+const std::string& Queue::label() const { return state_->label; }
+QoS Queue::qos() const { return state_->qos; }
+
 void Queue::async(std::function<void()> task) {
     {
-        std::lock_guard lock(mutex_);
-        tasks_.push_back(std::move(task));
+        std::lock_guard lock(state_->mutex);
+        state_->tasks.push_back(std::move(task));
     }
-    wake_.notify_one();
+    state_->wake.notify_one();
 }
 
 void Queue::sync(const std::function<void()>& task) {
-    if (isCurrent()) fail("sync onto the current queue would deadlock", label_);
+    if (isCurrent()) fail("sync onto the current queue would deadlock", state_->label);
     std::mutex doneMutex;
     std::condition_variable doneCv;
     bool done = false;
@@ -103,16 +121,14 @@ void Queue::sync(const std::function<void()>& task) {
     doneCv.wait(lock, [&] { return done; });
 }
 
-bool Queue::isCurrent() const { return tCurrent == this; }
+bool Queue::isCurrent() const { return tCurrent == state_.get(); }
 
 void Queue::assertCurrent() const {
-    if (!isCurrent()) fail("must run on this queue", label_);
+    if (!isCurrent()) fail("must run on this queue", state_->label);
 }
 
 void Queue::assertNotCurrent() const {
-    if (isCurrent()) fail("must not run on this queue", label_);
+    if (isCurrent()) fail("must not run on this queue", state_->label);
 }
-
-Queue* Queue::current() { return tCurrent; }
 
 }  // namespace corvane::dispatch

@@ -12,8 +12,6 @@
 // Thread-safety: every member is safe to call from any thread.
 #pragma once
 
-#include <condition_variable>
-#include <deque>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -60,22 +58,16 @@ public:
     // Aborts unless called off the queue (entering it synchronously would deadlock).
     void assertNotCurrent() const;
 
-    const std::string& label() const { return label_; }
-    QoS qos() const { return qos_; }
-
-    // The queue the calling thread is draining, or null on a thread that is no queue's.
-    static Queue* current();
+    const std::string& label() const;
+    QoS qos() const;
 
 private:
+    struct State;
     Queue(std::string label, QoS qos);
-    void run();
 
-    const std::string label_;
-    const QoS qos_;
-    std::mutex mutex_;
-    std::condition_variable wake_;
-    std::deque<std::function<void()>> tasks_;
-    bool stopping_ = false;
+    // Shared with the queue's thread, which outlives the Queue object when the last owner lets go
+    // from one of the queue's own tasks.
+    std::shared_ptr<State> state_;
     std::thread thread_;
 };
 
