@@ -66,7 +66,21 @@ TEST(Plist, OtherReadersAgree) {
 TEST(Plist, MalformedInputIsAnErrorValue) {
     const std::string inputs[] = {
         "", "not a plist at all", "<?xml version=\"1.0\"?><plist><dict><key>a</key></plist>",
-        std::string("bplist00\xff\xff\xff\xff", 12), "<plist version=\"1.0\"><integer>1</plist>"};
+        std::string("bplist00\xff\xff\xff\xff", 12), "<plist version=\"1.0\"><integer>1</plist>",
+        "<plist><string>nul &#0; inside</string></plist>",
+        "<plist><dict><key>a&#0;</key><true/></dict></plist>",
+        "<plist><string>\xff\xfe</string></plist>",
+        "<plist><integer>99999999999999999999</integer></plist>",
+        "<plist><date>2026-13-01T00:00:00Z</date></plist>",
+        "<plist><data>AA=A</data></plist>",
+        "<plist><dict><string>no key</string></dict></plist>",
+        "<plist>" + std::string(3000, '[').replace(0, 3000, "") + std::string(600 * 7, ' ') + "</plist>",
+        [] {
+            std::string deep;
+            for (int i = 0; i < 600; ++i) deep += "<array>";
+            for (int i = 0; i < 600; ++i) deep += "</array>";
+            return "<plist>" + deep + "</plist>";
+        }()};
     for (const auto& in : inputs) {
         auto r = plist::parse(in);
         EXPECT_FALSE(r) << in;

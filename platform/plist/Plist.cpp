@@ -1,7 +1,8 @@
 #include "platform/plist/Plist.h"
 
+#include "platform/plist/PlistRead.h"
+
 #include <fcntl.h>
-#include <plist/plist.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -17,106 +18,11 @@ namespace corvane::plist {
 
 namespace {
 
-// Seconds between 1970-01-01 and 2001-01-01, the epoch of property-list dates.
-constexpr int64_t kPlistEpoch = 978307200;
 // Deeper nesting than any real property list; bounds the recursion of the conversion.
 constexpr int kMaxDepth = 512;
 
 Error plistError(int64_t code, std::string text) {
     return Error{kPlistErrorDomain, code, std::move(text)};
-}
-
-struct PlistFree {
-    void operator()(plist_t p) const { plist_free(p); }
-};
-
-std::optional<Value> convert(plist_t node, int depth) {
-    if (depth > kMaxDepth) return std::nullopt;
-    switch (plist_get_node_type(node)) {
-        case PLIST_BOOLEAN: {
-            uint8_t b = 0;
-            plist_get_bool_val(node, &b);
-            return Value(b != 0);
-        }
-        case PLIST_UINT: {
-            uint64_t u = 0;
-            plist_get_uint_val(node, &u);
-            return Value(static_cast<int64_t>(u));
-        }
-        case PLIST_UID: {
-            uint64_t u = 0;
-            plist_get_uid_val(node, &u);
-            return Value(u);
-        }
-        case PLIST_REAL: {
-            double d = 0;
-            plist_get_real_val(node, &d);
-            return Value(d);
-        }
-        case PLIST_STRING:
-        case PLIST_KEY: {
-            char* s = nullptr;
-            if (plist_get_node_type(node) == PLIST_STRING) {
-                plist_get_string_val(node, &s);
-            } else {
-                plist_get_key_val(node, &s);
-            }
-            std::string str = s ? s : "";
-            std::free(s);
-            if (!isValidUtf8(str)) return std::nullopt;
-            return Value(std::move(str));
-        }
-        case PLIST_DATA: {
-            char* bytes = nullptr;
-            uint64_t len = 0;
-            plist_get_data_val(node, &bytes, &len);
-            Value v = Value::data(bytes, bytes ? len : 0);
-            std::free(bytes);
-            return v;
-        }
-        case PLIST_DATE: {
-            int32_t sec = 0;
-            int32_t usec = 0;
-            plist_get_date_val(node, &sec, &usec);
-            return Value(Date{(kPlistEpoch + sec) * 1000000 + usec});
-        }
-        case PLIST_ARRAY: {
-            Array a;
-            uint32_t n = plist_array_get_size(node);
-            a.reserve(n);
-            for (uint32_t i = 0; i < n; ++i) {
-                auto v = convert(plist_array_get_item(node, i), depth + 1);
-                if (!v) return std::nullopt;
-                a.push_back(std::move(*v));
-            }
-            return Value(std::move(a));
-        }
-        case PLIST_DICT: {
-            Dictionary d;
-            plist_dict_iter it = nullptr;
-            plist_dict_new_iter(node, &it);
-            for (;;) {
-                char* key = nullptr;
-                plist_t item = nullptr;
-                plist_dict_next_item(node, it, &key, &item);
-                if (!item) {
-                    std::free(key);
-                    break;
-                }
-                std::string k = key ? key : "";
-                std::free(key);
-                auto v = convert(item, depth + 1);
-                if (!v || !isValidUtf8(k)) {
-                    std::free(it);
-                    return std::nullopt;
-                }
-                d.insert_or_assign(std::move(k), std::move(*v));
-            }
-            std::free(it);
-            return Value(std::move(d));
-        }
-        default: return std::nullopt;
-    }
 }
 
 // ---- XML writer
@@ -202,12 +108,18 @@ MaybeError writeNode(std::string& out, const Value& v, int depth) {
             out += "</data>\n";
             break;
         case K::Date: {
-            time_t secs = static_cast<time_t>(v.asDate()->micros >= 0
-                                                  ? v.asDate()->micros / 1000000
-                                                  : (v.asDate()->micros - 999999) / 1000000);
+            // The XML form writes four-digit years only.
+            constexpr int64_t kYear0 = -62167219200;     // 0000-01-01T00:00:00Z
+            constexpr int64_t kYear10000 = 253402300800;  // 10000-01-01T00:00:00Z
+            int64_t micros = v.asDate()->micros;
+            int64_t whole = micros / 1000000 - (micros % 1000000 < 0 ? 1 : 0);
+            if (whole < kYear0 || whole >= kYear10000)
+                return plistError(kPlistWriteInvalid, "date outside the years 0 to 9999");
+            auto secs = static_cast<time_t>(whole);
             struct tm tm {};
             gmtime_r(&secs, &tm);
-            std::strftime(buf, sizeof buf, "%Y-%m-%dT%H:%M:%SZ", &tm);
+            std::snprintf(buf, sizeof buf, "%04d-%02d-%02dT%02d:%02d:%02dZ", tm.tm_year + 1900,
+                          tm.tm_mon + 1, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec);
             out += indent + "<date>" + buf + "</date>\n";
             break;
         }
@@ -257,14 +169,9 @@ std::string directoryOf(const std::string& path) {
 }  // namespace
 
 Result<Value> parse(std::string_view bytes) {
-    if (bytes.size() < 8 || bytes.size() > UINT32_MAX)
-        return plistError(kPlistReadCorrupt, "not a property list");
-    plist_t root = nullptr;
-    plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &root);
-    if (!root) return plistError(kPlistReadCorrupt, "not a property list");
-    std::unique_ptr<void, PlistFree> owner(root);
-    auto v = convert(root, 0);
-    if (!v) return plistError(kPlistReadCorrupt, "property list with unreadable contents");
+    std::optional<Value> v = bytes.substr(0, 6) == "bplist" ? detail::readBinary(bytes)
+                                                            : detail::readXml(bytes);
+    if (!v) return plistError(kPlistReadCorrupt, "not a property list");
     return std::move(*v);
 }
 

@@ -1,10 +1,14 @@
 // Property lists and whole-file atomic replacement.
 //
-// Reading accepts the XML and the binary forms (libplist). Writing produces the XML form, format
-// version 1.0. Integers read back as signed 64-bit values; a value past the signed range is read
-// as the negative number with the same 64 bits, as the binary form stores it. Writing keeps
-// signed and unsigned integers exact (libplist 2.2 has no signed integer node, so the XML writer
-// is our own). Dates are written to the whole second, as the XML form carries them.
+// Reading accepts the XML and the binary forms; writing produces the XML form, format version 1.0.
+// Integers read back as signed 64-bit values, and as unsigned ones past the signed range; writing
+// keeps both exact. Dates are written to the whole second, as the XML form carries them. Readers
+// refuse strings and keys holding NUL bytes or invalid UTF-8, nesting deeper than 512 levels,
+// cycles and oversized expansions of shared objects, with an error value.
+//
+// The readers and the writer are our own, not libplist's: libplist 2.2 aborts the process on
+// strings and keys that hold a NUL byte and has no signed integers. plistutil (libplist-utils)
+// serves the tests as an independent reader.
 //
 // Values with no property-list form (null, UUID, file descriptor, strings with characters XML
 // cannot carry) make writing fail with an error of the domain kPlistErrorDomain; nothing is

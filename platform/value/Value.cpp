@@ -85,6 +85,11 @@ Date Date::now() {
 }
 
 Date Date::fromSeconds(double seconds) {
+    // About 292,000 years either way fit in 64 bits of microseconds; beyond that, saturate.
+    constexpr double kLimit = 9.2e12;
+    if (std::isnan(seconds)) return Date{0};
+    if (seconds > kLimit) seconds = kLimit;
+    if (seconds < -kLimit) seconds = -kLimit;
     return Date{static_cast<int64_t>(std::llround(seconds * 1e6))};
 }
 
