@@ -146,6 +146,15 @@ bool Process::waitForErr(const std::string& text, std::chrono::milliseconds time
     return false;
 }
 
+bool Process::waitForOut(const std::string& text, std::chrono::milliseconds timeout) const {
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+        if (out().find(text) != std::string::npos) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+}
+
 RunResult run(std::vector<std::string> argv, std::map<std::string, std::string> env,
               const std::string& input) {
     TempDir dir;

@@ -65,6 +65,9 @@ public:
     // Polls until the standard error contains `text`.
     bool waitForErr(const std::string& text,
                     std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
+    // Polls until the standard output contains `text`.
+    bool waitForOut(const std::string& text,
+                    std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
 
 private:
     pid_t pid_ = -1;

@@ -1,0 +1,397 @@
+#include <gtest/gtest.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstring>
+#include <thread>
+
+#include "platform/log/Log.h"
+#include "platform/rpx/Rpx.h"
+#include "platform/rpx/Wire.h"
+#include "tests/support/TestSupport.h"
+
+using namespace corvane;
+using namespace std::chrono_literals;
+namespace wire = rpx::wire;
+
+namespace {
+
+std::string frameBytes(wire::FrameKind kind, uint64_t id, const Value& body) {
+    std::vector<int> fds;
+    return *wire::encodeFrame(wire::Frame{kind, id, body}, fds, rpx::kMaxDepth);
+}
+
+// Collects events and lets a test wait for them.
+struct Recorder {
+    std::mutex m;
+    std::condition_variable cv;
+    std::vector<rpx::Event> events;
+
+    void add(const rpx::Event& ev) {
+        std::lock_guard lock(m);
+        events.push_back(ev);
+        cv.notify_all();
+    }
+    bool waitFor(std::function<bool(const std::vector<rpx::Event>&)> pred,
+                 std::chrono::milliseconds timeout = 5s) {
+        std::unique_lock lock(m);
+        return cv.wait_for(lock, timeout, [&] { return pred(events); });
+    }
+    size_t count(std::optional<rpx::ErrorKind> kind) {
+        std::lock_guard lock(m);
+        size_t n = 0;
+        for (auto& e : events)
+            if (e.error == kind) ++n;
+        return n;
+    }
+};
+
+// An in-process echo server: replies {"echo": request}; counts requests. Accepted connections
+// outlive the listener, so their handlers hold the server's state, not the fixture.
+struct EchoServer {
+    struct State {
+        std::atomic<int> requests{0};
+        std::atomic<size_t> replyPadding{0};
+        Recorder recorder;
+    };
+    dispatch::QueuePtr queue = dispatch::Queue::create("test.listener");
+    std::shared_ptr<rpx::Listener> listener;
+    std::shared_ptr<State> state = std::make_shared<State>();
+    std::atomic<int>& requests = state->requests;
+    std::atomic<size_t>& replyPadding = state->replyPadding;
+    Recorder& recorder = state->recorder;
+
+    explicit EchoServer(const std::string& name) {
+        auto l = rpx::Listener::create(name, queue);
+        EXPECT_TRUE(l) << l.error().description();
+        listener = *l;
+        listener->setConnectionHandler([state = state](rpx::ConnectionPtr c) {
+            std::weak_ptr<rpx::Connection> weak = c;
+            c->setEventHandler([state, weak](const rpx::Event& ev) {
+                state->recorder.add(ev);
+                auto conn = weak.lock();
+                if (ev.isError() || !ev.wantsReply || !conn) return;
+                ++state->requests;
+                Dictionary reply{{"echo", ev.message}};
+                if (size_t pad = state->replyPadding) reply.emplace("pad", Value(std::string(pad, 'x')));
+                conn->sendReply(ev.messageId, Value(std::move(reply)));
+            });
+            c->resume();
+        });
+        listener->resume();
+    }
+};
+
+int rawConnect(const std::string& name) {
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    struct sockaddr_un addr {};
+    addr.sun_family = AF_UNIX;
+    std::string path = rpx::endpointPath(name);
+    std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+    if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return -1;
+    return fd;
+}
+
+}  // namespace
+
+TEST(RpxWire, EveryKindSurvivesAStreamSplitIntoSingleBytes) {
+    Value body = dict({{"null", Value()}, {"t", true}, {"f", false}, {"i", int64_t{-1}},
+                       {"u", std::numeric_limits<uint64_t>::max()}, {"d", -0.25},
+                       {"s", "ünïcode"}, {"data", Value::data("\x00\xff", 2)},
+                       {"date", Value(Date{-5})}, {"uuid", Value(UUID::random())},
+                       {"a", Value(Array{Value(Array{Value(Array{})})})}, {"empty", dict({})}});
+    std::string bytes = frameBytes(wire::FrameKind::Request, 42, body) +
+                        frameBytes(wire::FrameKind::Reply, 43, Value("second"));
+    wire::FrameReader reader(1 << 20, rpx::kMaxDepth);
+    std::vector<wire::Frame> frames;
+    for (char c : bytes) {
+        reader.append(&c, 1);
+        wire::Frame f;
+        std::string error;
+        while (reader.next(f, error) == wire::FrameReader::Status::Frame) frames.push_back(f);
+        ASSERT_TRUE(error.empty()) << error;
+    }
+    ASSERT_EQ(frames.size(), 2u);
+    EXPECT_EQ(frames[0].kind, wire::FrameKind::Request);
+    EXPECT_EQ(frames[0].id, 42u);
+    EXPECT_EQ(frames[0].body, body);
+    EXPECT_EQ(frames[0].body["u"].kind(), Value::Kind::UInt64);
+    EXPECT_EQ(frames[0].body["i"].kind(), Value::Kind::Int64);
+    EXPECT_EQ(frames[1].body, Value("second"));
+    EXPECT_EQ(reader.buffered(), 0u);
+}
+
+TEST(RpxWire, MalformedFramesAreErrorsAndTruncatedOnesWait) {
+    auto header = [](uint32_t length, uint8_t kind, uint16_t fds) {
+        std::string h;
+        for (int i = 0; i < 4; ++i) h.push_back(static_cast<char>(length >> (8 * i)));
+        h.push_back(static_cast<char>(kind));
+        h.push_back(0);
+        h.push_back(static_cast<char>(fds & 0xff));
+        h.push_back(static_cast<char>(fds >> 8));
+        h += std::string(8, '\0');
+        return h;
+    };
+    auto withBody = [&](const std::string& body, uint8_t kind = 1, uint16_t fds = 0) {
+        return header(static_cast<uint32_t>(body.size()), kind, fds) + body;
+    };
+    std::string deep;
+    for (int i = 0; i < 200; ++i) deep += std::string("\x0a\x01\x00\x00\x00", 5);
+    deep.push_back(0);
+    struct Case {
+        const char* name;
+        std::string bytes;
+        wire::FrameReader::Status expected;
+    };
+    const Case cases[] = {
+        {"truncated header", header(10, 1, 0).substr(0, 7), wire::FrameReader::Status::NeedMore},
+        {"truncated body", header(10, 1, 0) + "abc", wire::FrameReader::Status::NeedMore},
+        {"length past the limit", header(2u << 20, 1, 0), wire::FrameReader::Status::Error},
+        {"unknown frame kind", withBody(std::string(1, '\0'), 9), wire::FrameReader::Status::Error},
+        {"array count that lies", withBody(std::string("\x0a\xff\xff\xff\x0f", 5)),
+         wire::FrameReader::Status::Error},
+        {"string length that lies", withBody(std::string("\x06\x10\x00\x00\x00" "ab", 7)),
+         wire::FrameReader::Status::Error},
+        {"depth bomb", withBody(deep), wire::FrameReader::Status::Error},
+        {"invalid UTF-8 key",
+         withBody(std::string("\x0b\x01\x00\x00\x00\x02\x00\x00\x00\xc3\x28\x00", 12)),
+         wire::FrameReader::Status::Error},
+        {"descriptor that did not arrive", withBody(std::string("\x0c\x00\x00\x00\x00", 5), 1, 1),
+         wire::FrameReader::Status::Error},
+        {"trailing bytes after the value", withBody(std::string("\x00\x00", 2)),
+         wire::FrameReader::Status::Error},
+        {"unknown tag", withBody(std::string("\x63", 1)), wire::FrameReader::Status::Error},
+    };
+    for (const auto& c : cases) {
+        wire::FrameReader reader(1 << 20, rpx::kMaxDepth);
+        reader.append(c.bytes.data(), c.bytes.size());
+        wire::Frame f;
+        std::string error;
+        EXPECT_EQ(reader.next(f, error), c.expected) << c.name;
+    }
+}
+
+TEST(Rpx, TwoProcessesExchangeEveryKindIncludingDescriptors) {
+    axtest::PlatformRoot root;
+    axtest::Process server({axtest::binary("rpx_peer"), "server", "com.test.echo"});
+    ASSERT_TRUE(server.waitForOut("ready")) << server.err();
+    std::string file = root / "payload.txt";
+    axtest::writeFile(file, "through the descriptor");
+    auto client = axtest::run({axtest::binary("rpx_peer"), "client", "com.test.echo", file});
+    EXPECT_EQ(client.status, 0) << client.err;
+    EXPECT_EQ(client.out, "through the descriptor");
+}
+
+TEST(Rpx, RepliesAreBoundToTheirRequestsAndArriveOnTheChosenQueue) {
+    axtest::PlatformRoot root;
+    EchoServer server("com.test.bound");
+    auto events = dispatch::Queue::create("test.events");
+    auto replies = dispatch::Queue::create("test.replies");
+    auto c = rpx::Connection::connect("com.test.bound", events);
+    c->setEventHandler([](const rpx::Event&) {});
+    c->resume();
+    EXPECT_GT(c->pid(), 0);
+    EXPECT_EQ(c->peer().pid, getpid());  // the server is this process
+    constexpr int kCount = 200;
+    std::atomic<int> good{0};
+    std::atomic<int> calls{0};
+    for (int i = 0; i < kCount; ++i) {
+        c->sendWithReply(dict({{"n", i}}), replies, [&, i](const rpx::Reply& r) {
+            ++calls;
+            if (r.ok() && r.value["echo"]["n"] == Value(i) && replies->isCurrent()) ++good;
+        });
+    }
+    for (int i = 0; i < 500 && calls < kCount; ++i) std::this_thread::sleep_for(10ms);
+    EXPECT_EQ(calls.load(), kCount);
+    EXPECT_EQ(good.load(), kCount);
+    // A large reply fits what a client accepts.
+    server.replyPadding = 256 * 1024;
+    auto big = c->sendWithReplySync(dict({{"big", true}}));
+    ASSERT_TRUE(big.ok()) << big.description();
+    EXPECT_EQ(big.value["pad"].asString()->size(), 256u * 1024);
+}
+
+TEST(Rpx, AnUnreachableEndpointIsAnInvalidConnection) {
+    axtest::PlatformRoot root;
+    auto q = dispatch::Queue::create("test");
+    Recorder rec;
+    auto c = rpx::Connection::connect("com.test.nobody", q);
+    c->setEventHandler([&](const rpx::Event& e) { rec.add(e); });
+    c->resume();
+    EXPECT_TRUE(rec.waitFor([](auto& ev) { return !ev.empty(); }));
+    EXPECT_EQ(rec.count(rpx::ErrorKind::ConnectionInvalid), 1u);
+    auto r = c->sendWithReplySync(dict({{"request", "add"}}));
+    EXPECT_FALSE(r.ok());
+    EXPECT_EQ(r.description(), "Connection invalid");
+}
+
+TEST(Rpx, ListenerReplacesAStaleSocketAndRefusesALiveOne) {
+    axtest::PlatformRoot root;
+    auto q = dispatch::Queue::create("test");
+    {
+        auto first = rpx::Listener::create("com.test.name", q);
+        ASSERT_TRUE(first);
+        auto second = rpx::Listener::create("com.test.name", q);
+        ASSERT_FALSE(second);
+        EXPECT_NE(second.error().description().find("already served by another process"), std::string::npos);
+    }
+    // A socket file nobody listens on (its owner died without cleaning up).
+    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+    struct sockaddr_un addr {};
+    addr.sun_family = AF_UNIX;
+    std::string path = rpx::endpointPath("com.test.stale");
+    std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+    ASSERT_EQ(bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    close(fd);
+    EXPECT_TRUE(axtest::exists(path));
+    EXPECT_TRUE(rpx::Listener::create("com.test.stale", q));
+    struct stat st {};
+    stat((root.path() + "/run/user/" + std::to_string(getuid()) + "/rpx").c_str(), &st);
+    EXPECT_EQ(st.st_mode & 0777, 0700u);
+    EXPECT_FALSE(rpx::Listener::create("../escape", q));
+}
+
+TEST(Rpx, PeerDeathReachesTheListenerAsConnectionInvalid) {
+    axtest::PlatformRoot root;
+    EchoServer server("com.test.death");
+    axtest::Process peer({axtest::binary("rpx_peer"), "hang", "com.test.death"});
+    ASSERT_TRUE(server.recorder.waitFor([](auto& ev) { return !ev.empty(); }));
+    auto killed = std::chrono::steady_clock::now();
+    peer.signal(SIGKILL);
+    ASSERT_TRUE(server.recorder.waitFor([](auto& ev) {
+        return !ev.empty() && ev.back().error == rpx::ErrorKind::ConnectionInvalid;
+    }));
+    auto ms = std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - killed);
+    RecordProperty("invalid_after_ms", static_cast<int>(ms.count()));
+    EXPECT_EQ(server.recorder.count(rpx::ErrorKind::ConnectionInvalid), 1u);
+    // The peer's identity was taken from the kernel.
+}
+
+TEST(Rpx, SigtermDeliversTerminationImminentThenTheProcessExits) {
+    axtest::PlatformRoot root;
+    axtest::Process server({axtest::binary("rpx_peer"), "server", "com.test.term"});
+    ASSERT_TRUE(server.waitForOut("ready"));
+    auto q = dispatch::Queue::create("test");
+    Recorder rec;
+    auto c = rpx::Connection::connect("com.test.term", q);
+    c->setEventHandler([&](const rpx::Event& e) { rec.add(e); });
+    c->resume();
+    ASSERT_TRUE(c->sendWithReplySync(dict({{"hi", 1}})).ok());
+    server.signal(SIGTERM);
+    EXPECT_EQ(server.wait(5s), 0);
+    EXPECT_NE(server.out().find("termination imminent"), std::string::npos);
+    EXPECT_TRUE(rec.waitFor([](auto& ev) { return !ev.empty(); }));
+    EXPECT_EQ(rec.count(rpx::ErrorKind::ConnectionInvalid), 1u);
+}
+
+TEST(Rpx, BadPeersEndOnlyTheirOwnConnection) {
+    axtest::PlatformRoot root;
+    log::CaptureSink capture;
+    EchoServer server("com.test.bad");
+    auto q = dispatch::Queue::create("test");
+    auto good = rpx::Connection::connect("com.test.bad", q);
+    good->setEventHandler([](const rpx::Event&) {});
+    good->resume();
+
+    std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
+    struct Case {
+        const char* name;
+        std::string bytes;
+    };
+    const Case cases[] = {
+        {"garbage", std::string(64, '\x7f')},
+        {"half a frame, then gone", request.substr(0, request.size() / 2)},
+        {"a frame past the listener's limit", frameBytes(wire::FrameKind::Request, 2,
+                                                         Value(std::string(5u << 20, 'x')))},
+    };
+    for (const auto& c : cases) {
+        int fd = rawConnect("com.test.bad");
+        ASSERT_GE(fd, 0);
+        (void)!write(fd, c.bytes.data(), c.bytes.size());
+        close(fd);
+        auto r = good->sendWithReplySync(dict({{"still", c.name}}));
+        ASSERT_TRUE(r.ok()) << c.name;
+        EXPECT_EQ(r.value["echo"]["still"], Value(c.name));
+    }
+    EXPECT_TRUE(server.recorder.waitFor([](auto& ev) {
+        size_t n = 0;
+        for (auto& e : ev)
+            if (e.error == rpx::ErrorKind::ConnectionInvalid) ++n;
+        return n == 3;
+    }));
+    EXPECT_GE(capture.count("rpx: closing connection to pid"), 2u);
+
+    // A request written one byte at a time is still one request.
+    int fd = rawConnect("com.test.bad");
+    for (char b : request) {
+        (void)!write(fd, &b, 1);
+        std::this_thread::sleep_for(200us);
+    }
+    char header[wire::kHeaderSize];
+    EXPECT_EQ(read(fd, header, sizeof header), static_cast<ssize_t>(sizeof header));
+    EXPECT_EQ(header[4], static_cast<char>(wire::FrameKind::Reply));
+    close(fd);
+}
+
+TEST(Rpx, APeerThatNeverReadsIsNotServedFurther) {
+    axtest::PlatformRoot root;
+    EchoServer server("com.test.slow");
+    server.replyPadding = 64 * 1024;
+    int fd = rawConnect("com.test.slow");
+    ASSERT_GE(fd, 0);
+    std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
+    std::string burst;
+    for (int i = 0; i < 2000; ++i) burst += request;
+    // Write without reading a single reply; the socket fills up and writes would block.
+    int flags = fcntl(fd, F_GETFL);
+    fcntl(fd, F_SETFL, flags | O_NONBLOCK);
+    size_t written = 0;
+    for (int i = 0; i < 200 && written < burst.size(); ++i) {
+        ssize_t n = write(fd, burst.data() + written, burst.size() - written);
+        if (n > 0) written += static_cast<size_t>(n);
+        std::this_thread::sleep_for(2ms);
+    }
+    std::this_thread::sleep_for(200ms);
+    int served = server.requests.load();
+    // 64 KiB replies: reading stops after a few megabytes of unsent replies.
+    EXPECT_LT(served, 400) << "served " << served;
+    // Another client is served meanwhile.
+    auto q = dispatch::Queue::create("test");
+    auto other = rpx::Connection::connect("com.test.slow", q);
+    other->setEventHandler([](const rpx::Event&) {});
+    other->resume();
+    EXPECT_TRUE(other->sendWithReplySync(dict({{"y", 2}})).ok());
+    close(fd);
+}
+
+TEST(Rpx, OutstandingWorkIsCounted) {
+    uint64_t before = rpx::outstandingWork();
+    rpx::beginWork();
+    rpx::beginWork();
+    EXPECT_EQ(rpx::outstandingWork(), before + 2);
+    rpx::endWork();
+    rpx::endWork();
+    EXPECT_EQ(rpx::outstandingWork(), before);
+}
+
+TEST(Rpx, ContextFinalizerRunsWhenTheConnectionGoes) {
+    axtest::PlatformRoot root;
+    EchoServer server("com.test.ctx");
+    auto q = dispatch::Queue::create("test");
+    std::atomic<int> finalized{0};
+    {
+        auto c = rpx::Connection::connect("com.test.ctx", q);
+        c->setContext(std::make_shared<int>(5), [&](std::shared_ptr<void> ctx) {
+            if (ctx && *static_cast<int*>(ctx.get()) == 5) ++finalized;
+        });
+        c->resume();
+    }
+    EXPECT_EQ(finalized.load(), 1);
+}
