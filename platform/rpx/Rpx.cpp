@@ -208,9 +208,19 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         size_t offset = 0;
         std::vector<std::shared_ptr<FileDescriptor>> fds;  // sent with the first byte
     };
+    // A completion without a queue is internal (a synchronous wait) and runs right where the
+    // reply is read, saving a thread hop.
     struct Pending {
         dispatch::QueuePtr queue;
         std::function<void(const Reply&)> completion;
+
+        void complete(Reply reply) {
+            if (!queue) {
+                completion(reply);
+                return;
+            }
+            queue->async([c = std::move(completion), r = std::move(reply)] { c(r); });
+        }
     };
 
     Impl(int socket, dispatch::QueuePtr deliveryQueue, size_t maxFrame)
@@ -396,11 +406,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         out.clear();
         outBytes = 0;
-        for (auto& [id, p] : pending) {
-            p.queue->async([completion = std::move(p.completion)] {
-                completion(Reply{ErrorKind::ConnectionInvalid, Value()});
-            });
-        }
+        for (auto& [id, p] : pending) p.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
         pending.clear();
         {
             std::lock_guard lock(gLiveMutex);
@@ -455,10 +461,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         if (frame.kind == wire::FrameKind::Reply) {
             auto it = pending.find(frame.id);
             if (it == pending.end()) return;  // a reply nobody waits for any more
-            it->second.queue->async([completion = std::move(it->second.completion),
-                                     value = std::move(frame.body)] {
-                completion(Reply{std::nullopt, value});
-            });
+            it->second.complete(Reply{std::nullopt, std::move(frame.body)});
             pending.erase(it);
             return;
         }
@@ -602,31 +605,20 @@ void Connection::sendWithReply(const Value& message, dispatch::QueuePtr queue,
                                std::function<void(const Reply&)> completion) {
     std::lock_guard lock(impl_->mutex);
     uint64_t id = impl_->nextId++;
-    if (impl_->invalid || !impl_->sendFrame(wire::FrameKind::Request, id, message)) {
-        queue->async([completion = std::move(completion)] {
-            completion(Reply{ErrorKind::ConnectionInvalid, Value()});
-        });
+    Impl::Pending pending{std::move(queue), std::move(completion)};
+    // The frame may also fail the connection while being written; then no reply will come.
+    if (impl_->invalid || !impl_->sendFrame(wire::FrameKind::Request, id, message) || impl_->invalid) {
+        pending.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
         return;
     }
-    // The frame may have failed the connection while being written; then closeLocked already
-    // ran and the reply will never come.
-    if (impl_->invalid) {
-        queue->async([completion = std::move(completion)] {
-            completion(Reply{ErrorKind::ConnectionInvalid, Value()});
-        });
-        return;
-    }
-    impl_->pending.emplace(id, Impl::Pending{std::move(queue), std::move(completion)});
+    impl_->pending.emplace(id, std::move(pending));
 }
 
 Reply Connection::sendWithReplySync(const Value& message) {
     std::mutex m;
     std::condition_variable cv;
     std::optional<Reply> result;
-    // The completion runs on a private queue, so waiting here cannot block the delivery of the
-    // reply, whatever queue the caller is on.
-    static dispatch::QueuePtr waiter = dispatch::Queue::create("rpx.sync");
-    sendWithReply(message, waiter, [&](const Reply& r) {
+    sendWithReply(message, nullptr, [&](const Reply& r) {
         std::lock_guard lock(m);
         result = r;
         cv.notify_one();

@@ -1,0 +1,32 @@
+// axbench: one program, one subcommand per measurement. A subcommand registers itself from its own
+// file with AX_BENCH_SUBCOMMAND(name, "one line of help", function). Every subcommand prints its
+// figures and, as its last line, "RESULT <name> key=value ...".
+#pragma once
+
+#include <algorithm>
+#include <chrono>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace axbench {
+
+using Run = int (*)(int argc, char** argv);
+bool registerSubcommand(const char* name, const char* help, Run run);
+
+// Percentile (0..100) of a list of samples; sorts them.
+inline double percentile(std::vector<double>& samples, double p) {
+    if (samples.empty()) return 0;
+    std::sort(samples.begin(), samples.end());
+    size_t i = static_cast<size_t>(p / 100.0 * static_cast<double>(samples.size() - 1) + 0.5);
+    return samples[std::min(i, samples.size() - 1)];
+}
+
+inline double microsSince(std::chrono::steady_clock::time_point start) {
+    return std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count();
+}
+
+}  // namespace axbench
+
+#define AX_BENCH_SUBCOMMAND(name, help, fn) \
+    static const bool axbench_registered_##fn = axbench::registerSubcommand(name, help, fn)
