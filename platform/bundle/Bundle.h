@@ -1,0 +1,58 @@
+// The bundle reader: bundles as they lie on disk (docs/bundle-format.md).
+//
+// A bundle is a directory holding Info.plist, the executable named by its "KFBundleExecutable"
+// beside it, plug-ins under PlugIns/, a signature under _CodeSignature/ and a receipt at
+// _Receipt/receipt. Its support directory (the one that holds PlugIns/) is the bundle directory
+// itself.
+//
+// Thread-safe: a Bundle caches its Info.plist under a lock until flush().
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "platform/value/Value.h"
+
+namespace corvane::bundle {
+
+// Numbered properties, as text.
+inline constexpr int kPropertyBundlePath = 2;
+inline constexpr int kPropertyExecutablePath = 3;
+inline constexpr int kPropertySupportPath = 9;
+
+class Bundle {
+public:
+    // Mode 1: `path` is the bundle directory. Null when there is no directory there.
+    static std::shared_ptr<Bundle> openPath(const std::string& path);
+    // Mode 2: `path` names an executable; the bundle is the nearest enclosing directory whose
+    // Info.plist's "KFBundleExecutable" names that very file. When there is none, the result has no
+    // bundle path (property 2 is absent).
+    static std::shared_ptr<Bundle> openExecutable(const std::string& path);
+    // The running program's own bundle (mode 2 on /proc/self/exe).
+    static std::shared_ptr<Bundle> mainBundle();
+
+    // Property 2, 3 or 9 as text; nullopt when the bundle has none (or another number is asked).
+    std::optional<std::string> property(int number) const;
+    // The Info.plist as a Value; null when there is none or it is no dictionary.
+    Value infoDictionary() const;
+    // <bundle>/_Receipt/receipt when that file exists.
+    std::optional<std::string> receiptPath() const;
+    // Forgets cached data, so the next read looks at the disk again.
+    void flush();
+
+    std::string description() const;
+
+private:
+    explicit Bundle(std::string path) : path_(std::move(path)) {}
+
+    const std::string path_;  // canonical; empty for a mode-2 open that found nothing
+    mutable std::mutex mutex_;
+    mutable std::optional<Value> info_;
+};
+
+// Reads the Info.plist of the bundle directory `path` without caching anything.
+Value readInfoPlist(const std::string& path);
+
+}  // namespace corvane::bundle
