@@ -1,0 +1,346 @@
+#include "platform/codesign/CodeSign.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sodium.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <tuple>
+
+#include "platform/bundle/Bundle.h"
+#include "platform/layout/Layout.h"
+#include "platform/log/Log.h"
+#include "platform/plist/Plist.h"
+
+namespace corvane::codesign {
+
+namespace {
+
+constexpr int64_t kFormat = 1;
+constexpr const char* kDomain = "com.corvane.codesign";
+constexpr size_t kCacheLimit = 4096;
+
+const log::Handle& signLog() {
+    static const log::Handle h(kDomain, "codesign");
+    return h;
+}
+
+bool sodiumReady() {
+    static const bool ready = sodium_init() >= 0;
+    return ready;
+}
+
+std::string hex(const Bytes& bytes) {
+    static const char* digits = "0123456789abcdef";
+    std::string s;
+    for (uint8_t b : bytes) {
+        s.push_back(digits[b >> 4]);
+        s.push_back(digits[b & 15]);
+    }
+    return s;
+}
+
+std::optional<Bytes> unhex(std::string_view text) {
+    while (!text.empty() && (text.back() == '\n' || text.back() == ' ' || text.back() == '\r'))
+        text.remove_suffix(1);
+    if (text.size() % 2) return std::nullopt;
+    Bytes out;
+    for (size_t i = 0; i < text.size(); i += 2) {
+        auto digit = [](char c) {
+            return c >= '0' && c <= '9' ? c - '0' : c >= 'a' && c <= 'f' ? c - 'a' + 10 : c >= 'A' && c <= 'F' ? c - 'A' + 10 : -1;
+        };
+        int hi = digit(text[i]);
+        int lo = digit(text[i + 1]);
+        if (hi < 0 || lo < 0) return std::nullopt;
+        out.push_back(static_cast<uint8_t>(hi << 4 | lo));
+    }
+    return out;
+}
+
+Error signError(std::string text) { return Error{kDomain, 1, std::move(text)}; }
+
+// The bytes a signature covers.
+Bytes signedMessage(const std::string& identifier, const Bytes& executableHash, const Bytes& entitlements) {
+    Bytes entHash(crypto_hash_sha256_BYTES);
+    crypto_hash_sha256(entHash.data(), entitlements.data(), entitlements.size());
+    std::string prefix = "corvane code signature 1\n" + identifier + "\n";
+    Bytes m(prefix.begin(), prefix.end());
+    m.insert(m.end(), executableHash.begin(), executableHash.end());
+    m.insert(m.end(), entHash.begin(), entHash.end());
+    return m;
+}
+
+std::optional<Bytes> hashFd(int fd) {
+    crypto_hash_sha256_state state;
+    crypto_hash_sha256_init(&state);
+    unsigned char buf[65536];
+    off_t offset = 0;
+    for (;;) {
+        ssize_t n = pread(fd, buf, sizeof buf, offset);
+        if (n < 0) {
+            if (errno == EINTR) continue;
+            return std::nullopt;
+        }
+        if (n == 0) break;
+        crypto_hash_sha256_update(&state, buf, static_cast<unsigned long long>(n));
+        offset += n;
+    }
+    Bytes out(crypto_hash_sha256_BYTES);
+    crypto_hash_sha256_final(&state, out.data());
+    return out;
+}
+
+bool trusted(const Bytes& signer) {
+    DIR* d = opendir(trustDirectory().c_str());
+    if (!d) return false;
+    bool found = false;
+    while (struct dirent* e = readdir(d)) {
+        std::string name = e->d_name;
+        if (name.size() < 5 || name.substr(name.size() - 4) != ".pub") continue;
+        auto key = readPublicKey(trustDirectory() + "/" + name);
+        if (key && *key == signer) {
+            found = true;
+            break;
+        }
+    }
+    closedir(d);
+    return found;
+}
+
+using FileId = std::tuple<dev_t, ino_t, off_t, int64_t>;
+FileId idOf(const struct stat& st) {
+    return {st.st_dev, st.st_ino, st.st_size, int64_t{st.st_mtim.tv_sec} * 1000000000 + st.st_mtim.tv_nsec};
+}
+
+std::mutex gCacheMutex;
+std::map<std::pair<FileId, FileId>, Verification>& cache() {
+    static auto* c = new std::map<std::pair<FileId, FileId>, Verification>();
+    return *c;
+}
+
+Verification invalid(const std::string& path, std::string reason) {
+    log::notice(signLog(), "no entitlements for %{public}s: %{public}s", path, reason);
+    Verification v;
+    v.entitlements = Value(Dictionary{});
+    v.reason = std::move(reason);
+    return v;
+}
+
+// Verifies the open executable `exeFd` (named `path`) against its signature file.
+Verification verifyOpened(int exeFd, const std::string& path) {
+    if (!sodiumReady()) return invalid(path, "no crypto library");
+    struct stat exeStat {};
+    if (fstat(exeFd, &exeStat) != 0 || !S_ISREG(exeStat.st_mode)) return invalid(path, "not a file");
+    std::string sigPath = signaturePath(path);
+    int sigFd = ::open(sigPath.c_str(), O_RDONLY | O_CLOEXEC);
+    if (sigFd < 0) return invalid(path, "unsigned");
+    struct stat sigStat {};
+    fstat(sigFd, &sigStat);
+    auto key = std::make_pair(idOf(exeStat), idOf(sigStat));
+    {
+        std::lock_guard lock(gCacheMutex);
+        auto it = cache().find(key);
+        if (it != cache().end()) {
+            ::close(sigFd);
+            return it->second;
+        }
+    }
+    std::string bytes;
+    char buf[65536];
+    ssize_t n;
+    while ((n = read(sigFd, buf, sizeof buf)) > 0 && bytes.size() < (1u << 20)) bytes.append(buf, static_cast<size_t>(n));
+    ::close(sigFd);
+
+    Verification v;
+    auto file = parseSignature(bytes);
+    if (!file) {
+        v = invalid(path, "signature unreadable");
+    } else if (!signatureVerifies(*file)) {
+        v = invalid(path, "signature does not verify");
+    } else if (!trusted(file->signer)) {
+        v = invalid(path, "signed by an untrusted key " + hex(file->signer));
+    } else if (auto h = hashFd(exeFd); !h || *h != file->executableHash) {
+        v = invalid(path, "executable changed since it was signed");
+    } else {
+        auto ents = plist::parse(std::string_view(reinterpret_cast<const char*>(file->entitlementsBytes.data()),
+                                                  file->entitlementsBytes.size()));
+        if (!ents || !ents->isDictionary()) {
+            v = invalid(path, "entitlements unreadable");
+        } else {
+            v.valid = true;
+            v.identifier = file->identifier;
+            v.signer = hex(file->signer);
+            v.entitlements = *ents;
+        }
+    }
+    std::lock_guard lock(gCacheMutex);
+    if (cache().size() >= kCacheLimit) cache().clear();
+    cache().emplace(key, v);
+    return v;
+}
+
+}  // namespace
+
+std::string signaturePath(const std::string& path) {
+    struct stat st {};
+    if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path + "/_CodeSignature/signature.plist";
+    auto b = bundle::Bundle::openExecutable(path);
+    if (auto dir = b->property(bundle::kPropertyBundlePath)) return *dir + "/_CodeSignature/signature.plist";
+    return path + ".axsig";
+}
+
+Verification verifyExecutable(const std::string& path) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return invalid(path, std::string("cannot open: ") + std::strerror(errno));
+    Verification v = verifyOpened(fd, path);
+    ::close(fd);
+    return v;
+}
+
+Verification verifyBundle(const std::string& bundlePath) {
+    auto b = bundle::Bundle::openPath(bundlePath);
+    auto exe = b ? b->property(bundle::kPropertyExecutablePath) : std::nullopt;
+    if (!exe) return invalid(bundlePath, "bundle without executable");
+    return verifyExecutable(*exe);
+}
+
+Value entitlementsOfExecutable(const std::string& path) { return verifyExecutable(path).entitlements; }
+Value entitlementsOfBundle(const std::string& bundlePath) { return verifyBundle(bundlePath).entitlements; }
+
+std::shared_ptr<Handle> Handle::fromAuditToken(const rpx::AuditToken& token) {
+    std::string proc = "/proc/" + std::to_string(token.pid);
+    auto refuse = [&](const std::string& why) {
+        return std::shared_ptr<Handle>(new Handle(invalid(proc + "/exe", why)));
+    };
+    // The pid must still name the process the token was taken from.
+    if (token.pidfd && syscall(SYS_pidfd_send_signal, token.pidfd->get(), 0, nullptr, 0) != 0)
+        return refuse("the process is gone");
+    int fd = ::open((proc + "/exe").c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return refuse("the process is gone");
+    struct stat st {};
+    fstat(fd, &st);
+    rpx::PeerIdentity now = rpx::identityOfProcess(token.pid, token.uid, token.gid, nullptr);
+    if (now.auditToken.startTime != token.startTime || st.st_dev != token.exeDevice ||
+        st.st_ino != token.exeInode) {
+        ::close(fd);
+        return refuse("the process is not the one that connected");
+    }
+    Verification v = verifyOpened(fd, now.executablePath.empty() ? proc + "/exe" : now.executablePath);
+    ::close(fd);
+    return std::shared_ptr<Handle>(new Handle(std::move(v)));
+}
+
+Value Handle::valueForEntitlement(const std::string& name) const {
+    return verification_.entitlements[name];
+}
+
+// ---- keys and signing
+
+KeyPair generateKey() {
+    sodiumReady();
+    KeyPair k{Bytes(crypto_sign_PUBLICKEYBYTES), Bytes(crypto_sign_SECRETKEYBYTES)};
+    crypto_sign_keypair(k.publicKey.data(), k.secretKey.data());
+    return k;
+}
+
+MaybeError writeKeyPair(const std::string& path, const KeyPair& keys) {
+    if (auto err = plist::writeFileAtomically(path, hex(keys.secretKey) + "\n", 0600)) return err;
+    return plist::writeFileAtomically(path + ".pub", hex(keys.publicKey) + "\n", 0644);
+}
+
+Result<KeyPair> readSecretKey(const std::string& path) {
+    auto text = plist::readWholeFile(path);
+    if (!text) return text.error();
+    auto secret = unhex(*text);
+    if (!secret || secret->size() != crypto_sign_SECRETKEYBYTES) return signError(path + " is not a secret key");
+    KeyPair k{Bytes(crypto_sign_PUBLICKEYBYTES), *secret};
+    crypto_sign_ed25519_sk_to_pk(k.publicKey.data(), k.secretKey.data());
+    return k;
+}
+
+Result<Bytes> readPublicKey(const std::string& path) {
+    auto text = plist::readWholeFile(path);
+    if (!text) return text.error();
+    auto key = unhex(*text);
+    if (!key || key->size() != crypto_sign_PUBLICKEYBYTES) return signError(path + " is not a public key");
+    return *key;
+}
+
+std::string trustDirectory() { return layout::configDir() + "/trust.d"; }
+
+MaybeError trustKey(const std::string& publicKeyPath) {
+    auto key = readPublicKey(publicKeyPath);
+    if (!key) return key.error();
+    if (auto err = layout::makeDirectories(trustDirectory(), 0755)) return err;
+    return plist::writeFileAtomically(trustDirectory() + "/" + hex(*key).substr(0, 16) + ".pub",
+                                      hex(*key) + "\n", 0644);
+}
+
+MaybeError sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
+                const Value& entitlements) {
+    if (!sodiumReady()) return signError("no crypto library");
+    std::string exe = path;
+    struct stat st {};
+    if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
+        auto b = bundle::Bundle::openPath(path);
+        auto named = b ? b->property(bundle::kPropertyExecutablePath) : std::nullopt;
+        if (!named) return signError(path + ": bundle without executable");
+        exe = *named;
+        if (!identifier) {
+            if (const std::string* id = b->infoDictionary()["KFBundleIdentifier"].asString()) identifier = *id;
+        }
+    }
+    if (!identifier) identifier = exe.substr(exe.rfind('/') + 1);
+    if (!entitlements.isDictionary()) return signError("entitlements must be a dictionary");
+    int fd = ::open(exe.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return Error::posix(errno, exe);
+    auto hash = hashFd(fd);
+    ::close(fd);
+    if (!hash) return Error::posix(EIO, exe);
+    auto xml = plist::toXML(entitlements);
+    if (!xml) return xml.error();
+    Bytes entBytes(xml->begin(), xml->end());
+    Bytes message = signedMessage(*identifier, *hash, entBytes);
+    Bytes signature(crypto_sign_BYTES);
+    crypto_sign_detached(signature.data(), nullptr, message.data(), message.size(), keys.secretKey.data());
+    Value file = dict({{"format", kFormat},
+                       {"identifier", *identifier},
+                       {"executable-sha256", Value::data(*hash)},
+                       {"entitlements", Value::data(entBytes)},
+                       {"signer", Value::data(keys.publicKey)},
+                       {"signature", Value::data(signature)}});
+    std::string target = signaturePath(path);
+    if (auto err = layout::makeDirectories(target.substr(0, target.rfind('/')), 0755)) return err;
+    return plist::writeXMLFile(target, file, 0644);
+}
+
+std::optional<SignatureFile> parseSignature(std::string_view bytes) {
+    auto v = plist::parse(bytes);
+    if (!v || !v->isDictionary() || !((*v)["format"] == Value(kFormat))) return std::nullopt;
+    const std::string* identifier = (*v)["identifier"].asString();
+    const Bytes* hash = (*v)["executable-sha256"].asData();
+    const Bytes* ents = (*v)["entitlements"].asData();
+    const Bytes* signer = (*v)["signer"].asData();
+    const Bytes* signature = (*v)["signature"].asData();
+    if (!identifier || !hash || !ents || !signer || !signature) return std::nullopt;
+    if (hash->size() != crypto_hash_sha256_BYTES || signer->size() != crypto_sign_PUBLICKEYBYTES ||
+        signature->size() != crypto_sign_BYTES)
+        return std::nullopt;
+    return SignatureFile{*identifier, *hash, *ents, *signer, *signature};
+}
+
+bool signatureVerifies(const SignatureFile& file) {
+    if (!sodiumReady()) return false;
+    Bytes message = signedMessage(file.identifier, file.executableHash, file.entitlementsBytes);
+    return crypto_sign_verify_detached(file.signature.data(), message.data(), message.size(),
+                                       file.signer.data()) == 0;
+}
+
+}  // namespace corvane::codesign

@@ -1,0 +1,97 @@
+// Code signatures and the entitlements they carry (docs/code-signing.md).
+//
+// A signature binds one executable (its SHA-256) to an identifier and an entitlements dictionary,
+// signed with an ed25519 key. A bundle keeps its executable's signature in
+// _CodeSignature/signature.plist; an executable outside any bundle keeps a detached one beside
+// it, "<executable>.axsig". Only keys installed in the trust directory (<root>/etc/corvane/trust.d,
+// root-owned on a real system) are trusted.
+//
+// Entitlements come only from a signature that verifies against a trusted key and matches the
+// executable as it is now: unsigned code, an untrusted signer, a changed executable or changed
+// entitlements all give none, with one log line saying why. Results are cached by the identity of
+// the executable and its signature file (device, inode, size, modification time), so a second look
+// at unchanged files costs no hashing.
+//
+// Thread-safety: every function and class here is safe to use from any thread.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/rpx/Rpx.h"
+#include "platform/value/Value.h"
+
+namespace corvane::codesign {
+
+struct Verification {
+    bool valid = false;
+    std::string identifier;
+    std::string signer;  // the signing key, hexadecimal
+    Value entitlements;  // a dictionary; empty unless valid
+    std::string reason;  // why not valid
+};
+
+// The verification of an executable: its bundle's signature when a bundle names it as its
+// executable, else its detached signature.
+Verification verifyExecutable(const std::string& path);
+// The verification of a bundle's executable.
+Verification verifyBundle(const std::string& bundlePath);
+// The verified entitlements (a dictionary, empty when there are none).
+Value entitlementsOfExecutable(const std::string& path);
+Value entitlementsOfBundle(const std::string& bundlePath);
+
+// The code-signing identity of a process, made from the audit token of a connection. The process
+// must still be the one the token names (its pidfd, start time and executable file), or it has no
+// entitlements.
+class Handle {
+public:
+    static std::shared_ptr<Handle> fromAuditToken(const rpx::AuditToken& token);
+    // The value of one entitlement, or null.
+    Value valueForEntitlement(const std::string& name) const;
+    const Verification& verification() const { return verification_; }
+
+private:
+    explicit Handle(Verification v) : verification_(std::move(v)) {}
+    const Verification verification_;
+};
+
+// ---- keys and signing (the axsign tool)
+
+struct KeyPair {
+    Bytes publicKey;  // 32 bytes
+    Bytes secretKey;  // 64 bytes
+};
+
+KeyPair generateKey();
+// Writes KEY (secret, mode 0600) and KEY.pub.
+MaybeError writeKeyPair(const std::string& path, const KeyPair& keys);
+Result<KeyPair> readSecretKey(const std::string& path);
+Result<Bytes> readPublicKey(const std::string& path);
+std::string trustDirectory();
+// Installs a public key file in the trust directory.
+MaybeError trustKey(const std::string& publicKeyPath);
+
+// Signs a bundle (its executable) or a bare executable. Without an identifier, the bundle's
+// KFBundleIdentifier or the executable's file name is used.
+MaybeError sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
+                const Value& entitlements);
+
+// Where the signature of `path` (a bundle or an executable) lives.
+std::string signaturePath(const std::string& path);
+
+// ---- the signature file, for the fuzz target and tools
+
+struct SignatureFile {
+    std::string identifier;
+    Bytes executableHash;  // SHA-256
+    Bytes entitlementsBytes;  // an XML property list
+    Bytes signer;             // ed25519 public key
+    Bytes signature;          // ed25519 signature
+};
+std::optional<SignatureFile> parseSignature(std::string_view bytes);
+// Whether the signature is the signer's over the rest (trust is not looked at).
+bool signatureVerifies(const SignatureFile& file);
+
+}  // namespace corvane::codesign
