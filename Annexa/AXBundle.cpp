@@ -66,7 +66,8 @@ Value AXBundle::infoDictionary() const {
 
 std::optional<std::string> AXBundle::bundleIdentifier() const {
     if (!bundle_) return std::nullopt;
-    if (const std::string* id = bundle_->infoDictionary()["KFBundleIdentifier"].asString()) return *id;
+    Value info = bundle_->infoDictionary();
+    if (const std::string* id = info["KFBundleIdentifier"].asString()) return *id;
     return std::nullopt;
 }
 

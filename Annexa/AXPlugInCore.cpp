@@ -190,8 +190,8 @@ Value AXPlugInCore::mergeSharedResourcesInto(const Value& sdkList, const Value& 
 
 void AXPlugInCore::canonicalize() {
     // Through the lookups, so that a subclass's answers are what gets canonical form.
-    Dictionary plugin = plugInDictionary().isDictionary() ? *plugInDictionary().asDictionary()
-                                                          : Dictionary{};
+    Value current = plugInDictionary();
+    Dictionary plugin = current.isDictionary() ? *current.asDictionary() : Dictionary{};
     plugin.insert_or_assign(keys::kAttributes, attributes());
     Dictionary info;
     Value shortVersion = infoKey(keys::kShortVersion);

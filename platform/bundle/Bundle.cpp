@@ -50,7 +50,8 @@ std::shared_ptr<Bundle> Bundle::openExecutable(const std::string& path) {
         std::string exeName = real->substr(real->rfind('/') + 1);
         std::string dir = parentOf(*real);
         for (;;) {
-            const std::string* named = readInfoPlist(dir)["KFBundleExecutable"].asString();
+            Value info = readInfoPlist(dir);
+            const std::string* named = info["KFBundleExecutable"].asString();
             if (named && dir + "/" + *named == *real) return std::shared_ptr<Bundle>(new Bundle(dir));
             if (dir == "/") break;
             dir = parentOf(dir);
@@ -67,7 +68,8 @@ std::optional<std::string> Bundle::property(int number) const {
         case kPropertyBundlePath:
         case kPropertySupportPath: return path_;
         case kPropertyExecutablePath: {
-            const std::string* named = infoDictionary()["KFBundleExecutable"].asString();
+            Value info = infoDictionary();
+            const std::string* named = info["KFBundleExecutable"].asString();
             if (!named || named->empty() || named->find('/') != std::string::npos) return std::nullopt;
             return path_ + "/" + *named;
         }

@@ -294,7 +294,8 @@ MaybeError sign(const std::string& path, const KeyPair& keys, std::optional<std:
         if (!named) return signError(path + ": bundle without executable");
         exe = *named;
         if (!identifier) {
-            if (const std::string* id = b->infoDictionary()["KFBundleIdentifier"].asString()) identifier = *id;
+            Value info = b->infoDictionary();
+            if (const std::string* id = info["KFBundleIdentifier"].asString()) identifier = *id;
         }
     }
     if (!identifier) identifier = exe.substr(exe.rfind('/') + 1);

@@ -48,7 +48,8 @@ MaybeError setValue(const std::string& key, const Value& value, const std::strin
     if (!usableDomain(domain)) return Error::posix(EINVAL, "preference domain " + domain);
     std::string path = domainPath(domain);
     if (auto err = layout::makeDirectories(path.substr(0, path.rfind('/')), 0700)) return err;
-    Dictionary d = *readDomain(domain).asDictionary();
+    Value current = readDomain(domain);
+    Dictionary d = *current.asDictionary();
     if (value.isNull()) {
         d.erase(key);
     } else {

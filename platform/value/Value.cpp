@@ -152,22 +152,22 @@ bool Value::isNumber() const {
     }
 }
 
-const Dictionary* Value::asDictionary() const {
+const Dictionary* Value::asDictionary() const& {
     const auto* p = std::get_if<std::shared_ptr<const Dictionary>>(&v_);
     return p ? p->get() : nullptr;
 }
 
-const Array* Value::asArray() const {
+const Array* Value::asArray() const& {
     const auto* p = std::get_if<std::shared_ptr<const Array>>(&v_);
     return p ? p->get() : nullptr;
 }
 
-const Bytes* Value::asData() const {
+const Bytes* Value::asData() const& {
     const auto* p = std::get_if<std::shared_ptr<const Bytes>>(&v_);
     return p ? p->get() : nullptr;
 }
 
-const std::shared_ptr<FileDescriptor>* Value::asFd() const {
+const std::shared_ptr<FileDescriptor>* Value::asFd() const& {
     return std::get_if<std::shared_ptr<FileDescriptor>>(&v_);
 }
 
@@ -221,16 +221,21 @@ std::optional<bool> Value::boolValue() const {
     return *d != 0;
 }
 
-const Value* Value::find(std::string_view key) const {
+const Value* Value::find(std::string_view key) const& {
     const Dictionary* d = asDictionary();
     if (!d) return nullptr;
     auto it = d->find(key);
     return it == d->end() ? nullptr : &it->second;
 }
 
-const Value& Value::operator[](std::string_view key) const {
+const Value& Value::operator[](std::string_view key) const& {
     const Value* v = find(key);
     return v ? *v : null();
+}
+
+Value Value::operator[](std::string_view key) && {
+    const Value* v = find(key);
+    return v ? *v : Value();
 }
 
 const Value& Value::null() {

@@ -134,14 +134,23 @@ public:
     bool isNumber() const;
     bool isInteger() const { return kind() == Kind::Int64 || kind() == Kind::UInt64; }
 
-    // Typed access: null when the value is of another kind.
-    const std::string* asString() const { return std::get_if<std::string>(&v_); }
-    const Dictionary* asDictionary() const;
-    const Array* asArray() const;
-    const Bytes* asData() const;
-    const Date* asDate() const { return std::get_if<Date>(&v_); }
-    const corvane::UUID* asUUID() const { return std::get_if<corvane::UUID>(&v_); }
-    const std::shared_ptr<FileDescriptor>* asFd() const;
+    // Typed access: null when the value is of another kind. The pointers point into this value,
+    // so they are only offered on values that outlive the expression (not on temporaries, where
+    // they would dangle at once).
+    const std::string* asString() const& { return std::get_if<std::string>(&v_); }
+    const Dictionary* asDictionary() const&;
+    const Array* asArray() const&;
+    const Bytes* asData() const&;
+    const Date* asDate() const& { return std::get_if<Date>(&v_); }
+    const corvane::UUID* asUUID() const& { return std::get_if<corvane::UUID>(&v_); }
+    const std::shared_ptr<FileDescriptor>* asFd() const&;
+    const std::string* asString() const&& = delete;
+    const Dictionary* asDictionary() const&& = delete;
+    const Array* asArray() const&& = delete;
+    const Bytes* asData() const&& = delete;
+    const Date* asDate() const&& = delete;
+    const corvane::UUID* asUUID() const&& = delete;
+    const std::shared_ptr<FileDescriptor>* asFd() const&& = delete;
 
     // Numeric readings of a number (see isNumber); nullopt for anything else. Doubles truncate
     // toward zero (and saturate); integers of the other signedness wrap like a C cast.
@@ -153,8 +162,11 @@ public:
 
     // Dictionary lookup. `find` distinguishes an absent key (nullptr) from a stored value;
     // operator[] answers a shared null for an absent key or a value that is no dictionary.
-    const Value* find(std::string_view key) const;
-    const Value& operator[](std::string_view key) const;
+    const Value* find(std::string_view key) const&;
+    const Value* find(std::string_view key) const&& = delete;
+    const Value& operator[](std::string_view key) const&;
+    // On a temporary, the entry is returned by value (a cheap copy) so that it outlives it.
+    Value operator[](std::string_view key) &&;
     bool has(std::string_view key) const { return find(key) != nullptr; }
 
     // True when this value equals the boolean true / false by the number-boolean rule.
