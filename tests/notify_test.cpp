@@ -15,16 +15,23 @@ using corvane::dispatch::Queue;
 TEST(Notify, PostsFromAnotherProcessReachAnObserver) {
     axtest::PlatformRoot root;
     const std::string name = "com.corvane.annexa.annotation-change";
+    // The poster is forked before this process starts any thread, and posts when told to.
+    int go[2];
+    ASSERT_EQ(pipe(go), 0);
+    pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+        char c;
+        if (read(go[0], &c, 1) != 1) _exit(2);
+        _exit(notify::post(name) ? 1 : 0);
+    }
     auto queue = Queue::create("observer");
     std::atomic<int> calls{0};
     auto observer = notify::Observer::observe(name, queue, [&] { ++calls; });
     ASSERT_TRUE(observer) << observer.error().description();
     auto other = notify::Observer::observe("other.name", queue, [&] { calls += 100; });
     ASSERT_TRUE(other);
-
-    pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) _exit(notify::post(name) ? 1 : 0);
+    ASSERT_EQ(write(go[1], "g", 1), 1);
     int status = 0;
     waitpid(pid, &status, 0);
     ASSERT_EQ(WEXITSTATUS(status), 0);
