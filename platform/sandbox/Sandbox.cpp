@@ -1,0 +1,219 @@
+#include "platform/sandbox/Sandbox.h"
+
+#include <fcntl.h>
+#include <sodium.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <mutex>
+#include <sstream>
+
+#include "platform/layout/Layout.h"
+#include "platform/log/Log.h"
+#include "platform/plist/Plist.h"
+
+namespace corvane::sandbox {
+
+namespace {
+
+const log::Handle& sandboxLog() {
+    static const log::Handle h("com.corvane.sandbox", "sandbox");
+    return h;
+}
+
+std::string keyPath() { return layout::userDataDir() + "/sandbox/token.key"; }
+
+// The user's secret key, made on first use. Two processes making it at once agree: the file is
+// created exclusively and the loser reads the winner's.
+std::optional<Bytes> secretKey() {
+    if (sodium_init() < 0) return std::nullopt;
+    std::string path = keyPath();
+    for (int attempt = 0; attempt < 2; ++attempt) {
+        int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+        if (fd >= 0) {
+            Bytes key(crypto_auth_KEYBYTES);
+            ssize_t n = ::read(fd, key.data(), key.size());
+            ::close(fd);
+            if (n == static_cast<ssize_t>(key.size())) return key;
+            return std::nullopt;
+        }
+        if (layout::makeDirectories(path.substr(0, path.rfind('/')), 0700)) return std::nullopt;
+        Bytes key(crypto_auth_KEYBYTES);
+        crypto_auth_keygen(key.data());
+        std::string tmp = path + ".new." + std::to_string(getpid());
+        fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+        if (fd < 0) return std::nullopt;
+        bool ok = ::write(fd, key.data(), key.size()) == static_cast<ssize_t>(key.size()) && fsync(fd) == 0;
+        ::close(fd);
+        // link() fails if another process got there first; then its key is the key.
+        if (ok && ::link(tmp.c_str(), path.c_str()) == 0) {
+            ::unlink(tmp.c_str());
+            return key;
+        }
+        ::unlink(tmp.c_str());
+    }
+    return std::nullopt;
+}
+
+std::string hex(const void* data, size_t size) {
+    static const char* digits = "0123456789abcdef";
+    const auto* p = static_cast<const uint8_t*>(data);
+    std::string s;
+    for (size_t i = 0; i < size; ++i) {
+        s.push_back(digits[p[i] >> 4]);
+        s.push_back(digits[p[i] & 15]);
+    }
+    return s;
+}
+
+std::optional<std::string> unhex(std::string_view text) {
+    if (text.size() % 2) return std::nullopt;
+    std::string out;
+    for (size_t i = 0; i < text.size(); i += 2) {
+        auto digit = [](char c) { return c >= '0' && c <= '9' ? c - '0' : c >= 'a' && c <= 'f' ? c - 'a' + 10 : -1; };
+        int hi = digit(text[i]);
+        int lo = digit(text[i + 1]);
+        if (hi < 0 || lo < 0) return std::nullopt;
+        out.push_back(static_cast<char>(hi << 4 | lo));
+    }
+    return out;
+}
+
+Bytes macOf(const Bytes& key, const std::string& extensionClass, const std::string& path) {
+    std::string message = extensionClass + ";" + path;
+    Bytes mac(crypto_auth_BYTES);
+    crypto_auth(mac.data(), reinterpret_cast<const unsigned char*>(message.data()), message.size(), key.data());
+    return mac;
+}
+
+std::string nsLink(const std::string& proc, const char* ns) {
+    char buf[128];
+    ssize_t n = readlink((proc + "/ns/" + ns).c_str(), buf, sizeof buf - 1);
+    if (n <= 0) return {};
+    return std::string(buf, static_cast<size_t>(n));
+}
+
+}  // namespace
+
+std::optional<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path,
+                                                  unsigned flags) {
+    if (!extensionClass || std::strcmp(extensionClass, kReadOnlyClass) != 0) {
+        errno = EINVAL;
+        return std::nullopt;
+    }
+    std::string target = path;
+    if (flags & kCanonicalPath) {
+        char buf[PATH_MAX];
+        if (!realpath(path.c_str(), buf)) return std::nullopt;  // errno from realpath
+        target = buf;
+    } else {
+        struct stat st {};
+        if (::stat(path.c_str(), &st) != 0) return std::nullopt;
+    }
+    auto key = secretKey();
+    if (!key) {
+        errno = EACCES;
+        return std::nullopt;
+    }
+    Bytes mac = macOf(*key, extensionClass, target);
+    return std::string(extensionClass) + ";" + hex(target.data(), target.size()) + ";" +
+           hex(mac.data(), mac.size());
+}
+
+std::optional<Token> parseToken(std::string_view text) {
+    size_t a = text.find(';');
+    if (a == std::string_view::npos) return std::nullopt;
+    size_t b = text.find(';', a + 1);
+    if (b == std::string_view::npos || text.find(';', b + 1) != std::string_view::npos) return std::nullopt;
+    auto path = unhex(text.substr(a + 1, b - a - 1));
+    auto mac = unhex(text.substr(b + 1));
+    if (!path || !mac || path->empty() || (*path)[0] != '/' || path->find('\0') != std::string::npos ||
+        mac->size() != crypto_auth_BYTES)
+        return std::nullopt;
+    return Token{std::string(text.substr(0, a)), *path, Bytes(mac->begin(), mac->end())};
+}
+
+bool verifyToken(const Token& token) {
+    if (token.extensionClass != kReadOnlyClass) return false;
+    auto key = secretKey();
+    if (!key) return false;
+    std::string message = token.extensionClass + ";" + token.path;
+    return crypto_auth_verify(token.mac.data(), reinterpret_cast<const unsigned char*>(message.data()),
+                              message.size(), key->data()) == 0;
+}
+
+int64_t consumeExtension(const std::string& token) {
+    static dispatch::QueuePtr queue = dispatch::Queue::create("sandbox.consume");
+    auto broker = rpx::Connection::connect(kBrokerEndpoint, queue);
+    broker->setEventHandler([](const rpx::Event&) {});
+    broker->resume();
+    rpx::Reply reply = broker->sendWithReplySync(dict({{"token", token}}));
+    broker->cancel();
+    const auto* fd = reply.ok() ? reply.value["fd"].asFd() : nullptr;
+    if (!fd) return -1;
+    return (*fd)->release();
+}
+
+int releaseExtension(int64_t handle) {
+    if (handle < 0 || handle > INT_MAX) return -1;
+    return ::close(static_cast<int>(handle));
+}
+
+bool isSandboxed(pid_t pid) {
+    std::string proc = "/proc/" + std::to_string(pid);
+    std::ifstream status(proc + "/status");
+    if (!status) return true;
+    std::string line;
+    bool seen = false;
+    while (std::getline(status, line)) {
+        if (line.rfind("Seccomp:", 0) == 0) {
+            seen = true;
+            if (std::atoi(line.c_str() + 8) != 0) return true;
+        }
+    }
+    if (!seen) return true;
+    for (const char* ns : {"mnt", "user"}) {
+        std::string theirs = nsLink(proc, ns);
+        if (theirs.empty() || theirs != nsLink("/proc/self", ns)) return true;
+    }
+    struct stat st {};
+    if (::lstat((proc + "/root/.corvane-sandbox").c_str(), &st) == 0) return true;
+    return errno != ENOENT;
+}
+
+Result<std::unique_ptr<Broker>> Broker::start(dispatch::QueuePtr queue) {
+    auto listener = rpx::Listener::create(kBrokerEndpoint, std::move(queue));
+    if (!listener) return listener.error();
+    (*listener)->setConnectionHandler([](rpx::ConnectionPtr c) {
+        std::weak_ptr<rpx::Connection> weak = c;
+        c->setEventHandler([weak](const rpx::Event& ev) {
+            auto conn = weak.lock();
+            if (!conn || ev.isError() || !ev.wantsReply) return;
+            auto answer = [&](Value reply) { conn->sendReply(ev.messageId, reply); };
+            const std::string* text = ev.message["token"].asString();
+            auto token = text ? parseToken(*text) : std::nullopt;
+            if (!token || !verifyToken(*token)) {
+                log::notice(sandboxLog(), "refused a sandbox token from pid %d", conn->pid());
+                return answer(dict({{"error", "invalid token"}}));
+            }
+            // The path was canonical when the token was issued: refuse to follow a symbolic link
+            // put in its place since.
+            int fd = ::open(token->path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+            if (fd < 0) return answer(dict({{"error", std::string(std::strerror(errno))}}));
+            answer(dict({{"fd", Value(std::make_shared<FileDescriptor>(fd))}}));
+        });
+        c->resume();
+    });
+    (*listener)->resume();
+    return std::unique_ptr<Broker>(new Broker(*listener));
+}
+
+Broker::~Broker() { listener_->cancel(); }
+
+}  // namespace corvane::sandbox
