@@ -13,6 +13,7 @@
 #pragma once
 
 #define _SDT_HAS_SEMAPHORES 1
+#define SDT_USE_VARIADIC 1
 #include <sys/sdt.h>
 
 #define AXD_PROBES(X)    \
