@@ -1,0 +1,68 @@
+// The user's annotations of plug-ins, kept across restarts of the daemon.
+//
+// The whole table (annotation key -> annotation dictionary) lives in memory; the file is read once,
+// at construction, and rewritten whole and atomically after every change. The file is an XML
+// property list {"version": 16, "data": {key: annotation, ...}} that any property-list reader
+// opens. Where it lives: the -d path when the daemon got one, else
+// <data container 10 "com.corvane.axd">/com.corvane.annexa/Annotations; a file of earlier
+// releases, <root>/var/db/Annexa-Annotations, is migrated when the primary file cannot be loaded.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Annexa/AXUtilities.h"
+
+namespace annexa {
+
+// Lives on: the database queue. The store has no lock of its own; the database serialises every
+// use of it.
+class AXDAnnotationStore {
+public:
+    static constexpr int64_t kVersion = 16;
+    static constexpr int kContainerClass = 10;
+    static constexpr const char* kContainerIdentifier = "com.corvane.axd";
+    static constexpr const char* kEarlierReleasesFile = "/var/db/Annexa-Annotations";
+
+    // Locates and loads the table (resetting or migrating as needed). `path` is the -d argument,
+    // passed unchanged, or null for the default location. Ends the process only when the default
+    // location's container or directory cannot be had.
+    explicit AXDAnnotationStore(const char* path);
+
+    const std::string& annotationsURL() const { return annotationsURL_; }
+    const Dictionary& annotations() const { return annotations_; }
+
+    // The stored annotation dictionary for an annotation key, or null.
+    Value annotationForIdentifier(const std::string& key) const;
+    // Merges the entries of `annotation` into the key's annotation (each entry replaces the entry
+    // of the same key whole), or removes the key's annotation when `annotation` is null; then saves.
+    // A failed save is logged; the change stays in memory.
+    void setAnnotationForIdentifier(const Value& annotation, const std::string& key);
+
+    // Plug-in forms of the two operations: the key is the plug-in's annotationKey().
+    template <class PlugIn>
+    Value annotationForPlugIn(const PlugIn& plugIn) const {
+        return annotationForIdentifier(plugIn.annotationKey());
+    }
+    template <class PlugIn>
+    void setAnnotationForPlugIn(const Value& annotation, const PlugIn& plugIn) {
+        setAnnotationForIdentifier(annotation, plugIn.annotationKey());
+    }
+
+    // Reads the file at `path` and installs its table. False with the error otherwise.
+    bool loadDb(const std::string& path, Error* error);
+    // Writes the whole table to annotationsURL(). False with the error otherwise.
+    bool saveDb(Error* error);
+
+    // The default file location, creating its directory (fatal when that fails).
+    static std::string defaultDatabaseURL();
+    // The daemon's data container directory (fatal when there is none).
+    static std::string containerURL();
+
+private:
+    std::string annotationsURL_;
+    Dictionary annotations_;
+};
+
+}  // namespace annexa
