@@ -1,0 +1,154 @@
+// Vantry: the application registry (docs/registry.md).
+//
+// One SQLite database (WAL mode) under the platform root holds every registered application and
+// plug-in; every process that uses the registry opens it: the daemon, installers, the vantry tool.
+// Registering scans a bundle on disk once: an application with every plug-in under its PlugIns/,
+// or a stand-alone plug-in. Reading a record never touches the bundle again.
+//
+// Install and uninstall events reach observers in every process, in order and each once, through a
+// journal table and an inotify wake-up; an observer gets only events after it was added.
+//
+// Records are immutable snapshots shared by reference. Thread-safe: a Registry may be used from
+// any thread.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/value/Value.h"
+
+namespace corvane::vantry {
+
+class ApplicationRecord;
+class PlugInRecord;
+using ApplicationRecordPtr = std::shared_ptr<const ApplicationRecord>;
+using PlugInRecordPtr = std::shared_ptr<const PlugInRecord>;
+
+enum class Scope { Attributes, PlugIn, InfoPlist };
+
+// Immutable.
+class PlugInRecord {
+public:
+    UUID uuid() const { return uuid_; }
+    const std::string& bundlePath() const { return bundlePath_; }
+    // "KSExtensionIdentifier" of the plug-in dictionary when it is a string, else
+    // "KFBundleIdentifier".
+    const std::string& identifier() const { return identifier_; }
+    const std::string& bundleIdentifier() const { return bundleIdentifier_; }
+    const std::string& originalIdentifier() const { return originalIdentifier_; }
+    const std::string& bundleVersion() const { return bundleVersion_; }
+    // The plug-in dictionary merged with its extension point's SDK and in canonical form.
+    const Value& pluginDictionary() const { return plugin_; }
+    // The Info.plist merged with its extension point's SDK.
+    const Value& infoDictionary() const { return info_; }
+    // Verified entitlements of the executable; an empty dictionary when there are none.
+    const Value& entitlements() const { return entitlements_; }
+    Date registrationDate() const { return registered_; }
+    bool onSystemVolume() const { return system_; }
+    const ApplicationRecordPtr& containingApplication() const { return application_; }
+    const std::optional<std::string>& dataContainerPath() const { return container_; }
+    const std::optional<std::string>& localizedName() const { return localizedName_; }
+    const std::optional<std::string>& localizedShortName() const { return localizedShortName_; }
+    // The value of a key in the attributes, the plug-in dictionary, or the whole Info.plist.
+    Value lookup(Scope scope, std::string_view key) const;
+
+    // All of the record as one dictionary (the journal keeps uninstalled records this way).
+    Value serialize() const;
+    static PlugInRecordPtr deserialize(const Value& v, ApplicationRecordPtr application);
+    std::string description() const;
+
+private:
+    friend class Registry;
+    friend class Store;
+    UUID uuid_;
+    std::string bundlePath_, identifier_, bundleIdentifier_, originalIdentifier_, bundleVersion_;
+    Value plugin_, info_, entitlements_;
+    Date registered_;
+    bool system_ = false;
+    ApplicationRecordPtr application_;
+    std::optional<std::string> container_, localizedName_, localizedShortName_;
+};
+
+// Immutable.
+class ApplicationRecord {
+public:
+    const std::string& bundlePath() const { return bundlePath_; }
+    const std::string& identifier() const { return identifier_; }
+    const std::optional<std::string>& localizedName() const { return localizedName_; }
+    bool isPlaceholder() const { return placeholder_; }
+    // <bundle>/_Receipt/receipt when it existed at registration.
+    const std::optional<std::string>& receiptPath() const { return receipt_; }
+    // The application's plug-ins, ordered by bundle path. Filled by the registry's lookups.
+    std::vector<PlugInRecordPtr> plugIns() const;
+
+    Value serialize() const;
+    std::string description() const;
+
+private:
+    friend class Registry;
+    friend class Store;
+    friend class PlugInRecord;
+    std::string bundlePath_, identifier_;
+    std::optional<std::string> localizedName_, receipt_;
+    bool placeholder_ = false;
+    std::function<std::vector<PlugInRecordPtr>()> plugIns_;
+};
+
+class Observer {
+public:
+    virtual ~Observer() = default;
+    virtual void pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) = 0;
+    virtual void pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) = 0;
+};
+
+class Store;
+
+class Registry {
+public:
+    // The registry of the current platform root, opened once per process.
+    static Registry& shared();
+    // A registry over the database at `path` (created when missing).
+    static Result<std::unique_ptr<Registry>> open(const std::string& path);
+    // <root>/var/lib/corvane/vantry/registry.db
+    static std::string defaultPath();
+    ~Registry();
+
+    PlugInRecordPtr plugInForUUID(const UUID& uuid);
+    PlugInRecordPtr plugInForPath(const std::string& bundlePath);
+    ApplicationRecordPtr applicationForPath(const std::string& bundlePath);
+    std::vector<PlugInRecordPtr> installedPlugIns();
+    // The plug-ins that may fit `pattern` and that `filter` accepts. The registry drops a plug-in
+    // only when the pattern's exact test would certainly fail; the filter is called with the
+    // plug-in's identifier and entitlements before its record is built.
+    std::vector<PlugInRecordPtr> query(
+        const Value& pattern, const std::function<bool(const std::string&, const Value&)>& filter);
+
+    // Registers an application (with its plug-ins) or a stand-alone plug-in. An unchanged bundle
+    // changes nothing; a changed one replaces its records. Refused with the reason when the bundle
+    // cannot be read; the database is then unchanged.
+    MaybeError registerBundle(const std::string& path, bool placeholder = false);
+    MaybeError unregisterBundle(const std::string& path);
+    // The paths registered so far, for rebuilding a damaged database.
+    std::vector<std::string> registeredPaths();
+
+    void addObserver(std::shared_ptr<Observer> observer);
+    void dropCaches();
+
+    // Moves the database at `path` aside (damaged or not) and registers again every path that was
+    // registered in it and can still be read. Returns the paths that could not be registered.
+    static Result<std::vector<std::string>> rebuild(const std::string& path);
+
+    const std::string& path() const;
+
+private:
+    explicit Registry(std::shared_ptr<Store> store);
+    std::shared_ptr<Store> store_;
+};
+
+}  // namespace corvane::vantry

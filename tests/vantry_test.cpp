@@ -1,0 +1,271 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <chrono>
+#include <filesystem>
+#include <thread>
+
+#include "platform/codesign/CodeSign.h"
+#include "platform/layout/Layout.h"
+#include "platform/plist/Plist.h"
+#include "platform/vantry/Vantry.h"
+#include "tests/support/Bundles.h"
+#include "tests/support/TestSupport.h"
+
+using namespace corvane;
+namespace fs = std::filesystem;
+using vantry::Registry;
+using vantry::Scope;
+
+namespace {
+
+size_t countOf(const std::string& text, const std::string& what) {
+    size_t n = 0;
+    for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+    return n;
+}
+
+// A signed application with three plug-ins: one with its own extension identifier and a
+// registered SDK, one data-only, one unsigned.
+struct Fixture {
+    axtest::PlatformRoot root;
+    std::string app;
+    codesign::KeyPair key = codesign::generateKey();
+    Value shareEntitlements = dict({{"com.corvane.developer.auto-elect-plugin", true}});
+
+    Fixture() {
+        setenv("LANG", "de_DE.UTF-8", 1);
+        codesign::writeKeyPair(root / "key", key);
+        codesign::trustKey(root / "key.pub");
+        layout::makeDirectories(layout::sharedDataDir() + "/sdk", 0755);
+        plist::writeXMLFile(layout::sharedDataDir() + "/sdk/com.corvane.share.plist",
+                            dict({{"KSExtension", dict({{"KSExtensionProtocol", "ShareProtocol"},
+                                                        {"KSExtensionAttributes",
+                                                         dict({{"KSExtensionPointName", "Share"}})}})}}));
+        Value appInfo = axtest::appInfo("com.example.app");
+        Dictionary appDict = *appInfo.asDictionary();
+        appDict["KFBundleDisplayName"] = Value("Example");
+        app = axtest::makeBundle(root.path(), "Example.app", Value(appDict), "/bin/true");
+        axtest::writeFile(app + "/de.lproj/InfoPlist.strings",
+                          *plist::toXML(dict({{"KFBundleDisplayName", "Beispiel"}})));
+        axtest::writeFile(app + "/_Receipt/receipt", "receipt");
+        std::string plugins = app + "/PlugIns";
+        std::string share = axtest::makeBundle(
+            plugins, "Share.appex",
+            axtest::plugInInfo("com.example.app.share",
+                               dict({{"KSExtensionPointIdentifier", "com.corvane.share"},
+                                     {"KSExtensionIdentifier", "com.example.share"}})),
+            "/bin/true");
+        codesign::sign(share, key, std::nullopt, shareEntitlements);
+        std::string data = axtest::makeBundle(
+            plugins, "Data.appex",
+            axtest::plugInInfo("com.example.app.data",
+                               dict({{"KSExtensionProtocol", "#Data"}, {"KSExtensionAttributes", dict({})}})),
+            "/bin/true");
+        codesign::sign(data, key, std::nullopt, dict({}));
+        axtest::makeBundle(plugins, "Plain.appex",
+                           axtest::plugInInfo("com.example.app.plain",
+                                              dict({{"KSExtensionAttributes",
+                                                     dict({{"KSExtensionPointName", Value(corvane::Array{Value("A"), Value("B")})},
+                                                           {"KSExtensionVersion", "v01"}})}})),
+                           "/bin/true");
+    }
+    ~Fixture() { unsetenv("LANG"); }
+
+    axtest::RunResult vantry(std::vector<std::string> args) {
+        args.insert(args.begin(), axtest::binary("vantry"));
+        return axtest::run(args);
+    }
+};
+
+}  // namespace
+
+TEST(Vantry, RegisterReadBackUnregisterWithAnObserverInAnotherProcess) {
+    Fixture f;
+    axtest::Process watch({axtest::binary("vantry"), "watch"});
+    ASSERT_TRUE(watch.waitForOut("watching")) << watch.err();
+
+    auto reg = f.vantry({"register", f.app});
+    ASSERT_EQ(reg.status, 0) << reg.err;
+    ASSERT_TRUE(watch.waitForOut("install event: 3 plug-in(s)"));
+
+    auto registry = Registry::open(Registry::defaultPath());
+    ASSERT_TRUE(registry) << registry.error().description();
+    auto& r = **registry;
+    auto share = r.plugInForPath(f.app + "/PlugIns/Share.appex");
+    ASSERT_TRUE(share);
+    EXPECT_EQ(r.plugInForUUID(share->uuid()), share);
+    EXPECT_EQ(share->identifier(), "com.example.share");
+    EXPECT_EQ(share->bundleIdentifier(), "com.example.app.share");
+    EXPECT_EQ(share->originalIdentifier(), "com.example.app.share");
+    EXPECT_EQ(share->bundleVersion(), "1");
+    EXPECT_EQ(share->lookup(Scope::PlugIn, "KSExtensionProtocol"), Value("ShareProtocol"));  // from the SDK
+    EXPECT_EQ(share->lookup(Scope::Attributes, "KSExtensionPointName"), Value("Share"));
+    EXPECT_EQ(share->lookup(Scope::Attributes, "KSExtensionVersion"), Value("1.0"));  // canonical
+    EXPECT_EQ(share->lookup(Scope::InfoPlist, "KFBundleExecutable"), Value("plugin"));
+    EXPECT_EQ(share->entitlements(), f.shareEntitlements);
+    EXPECT_LT(std::abs(share->registrationDate().wholeSeconds() - Date::now().wholeSeconds()), 60);
+    EXPECT_FALSE(share->onSystemVolume());
+    ASSERT_TRUE(share->dataContainerPath());
+    struct stat st {};
+    ASSERT_EQ(stat(share->dataContainerPath()->c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0700u);
+    auto app = share->containingApplication();
+    ASSERT_TRUE(app);
+    EXPECT_EQ(app->bundlePath(), f.app);
+    EXPECT_EQ(app->identifier(), "com.example.app");
+    EXPECT_EQ(app->localizedName(), std::optional<std::string>("Beispiel"));
+    EXPECT_EQ(app->receiptPath(), f.app + "/_Receipt/receipt");
+    EXPECT_FALSE(app->isPlaceholder());
+    auto plugins = r.applicationForPath(f.app)->plugIns();
+    ASSERT_EQ(plugins.size(), 3u);
+    EXPECT_EQ(plugins[0]->bundlePath(), f.app + "/PlugIns/Data.appex");
+    EXPECT_EQ(plugins[1]->bundlePath(), f.app + "/PlugIns/Plain.appex");
+    EXPECT_FALSE(plugins[0]->dataContainerPath());  // data-only plug-ins have none
+    EXPECT_EQ(plugins[1]->entitlements(), dict({}));  // unsigned
+    EXPECT_EQ(r.installedPlugIns().size(), 3u);
+
+    // Unchanged: nothing happens, UUIDs stay.
+    ASSERT_EQ(f.vantry({"register", f.app}).status, 0);
+    EXPECT_EQ(r.plugInForPath(f.app + "/PlugIns/Share.appex")->uuid(), share->uuid());
+
+    ASSERT_EQ(f.vantry({"unregister", f.app}).status, 0);
+    ASSERT_TRUE(watch.waitForOut("uninstall event: 3 plug-in(s)"));
+    std::string out = watch.out();
+    EXPECT_EQ(countOf(out, "install event"), 2u) << out;  // "install" and "uninstall", once each
+    EXPECT_EQ(countOf(out, share->uuid().string()), 2u) << out;
+    EXPECT_FALSE(r.plugInForUUID(share->uuid()));
+    EXPECT_TRUE(r.installedPlugIns().empty());
+}
+
+TEST(Vantry, QueriesDropOnlyWhatCannotFitAndFilterBeforeBuilding) {
+    Fixture f;
+    auto registry = Registry::open(Registry::defaultPath());
+    auto& r = **registry;
+    ASSERT_FALSE(r.registerBundle(f.app));
+    struct Case {
+        Value pattern;
+        std::vector<std::string> identifiers;
+    };
+    const Case cases[] = {
+        {dict({{"KSExtensionIdentifier", "com.example.share"}}), {"com.example.share"}},
+        {dict({{"KSExtensionIdentifier", "=com.example.share"}}), {"com.example.share"}},
+        {dict({{"KSExtensionPointName", "Share"}}), {"com.example.app.plain", "com.example.share"}},  // array subject kept
+        {dict({{"KSExtensionPointName", "Nothing"}}), {"com.example.app.plain"}},
+        {dict({{"KSExtensionIdentifier", Value(corvane::Array{Value("com.example.app.data"), Value("x")})}}),
+         {"com.example.app.data"}},
+        {dict({{"KSExtensionIdentifier", ">a"}}), {"com.example.app.data", "com.example.app.plain", "com.example.share"}},
+        {dict({}), {"com.example.app.data", "com.example.app.plain", "com.example.share"}},
+    };
+    for (const auto& c : cases) {
+        std::vector<std::string> got;
+        for (const auto& p : r.query(c.pattern, nullptr)) got.push_back(p->identifier());
+        std::sort(got.begin(), got.end());
+        EXPECT_EQ(got, c.identifiers) << c.pattern.description();
+    }
+    // Numeric-aware equality: "v1" equals the stored "v01".
+    Value versioned = dict({{"KSExtensionVersion", "v1"}});
+    // (The version key is not indexed; an indexed key with digits behaves the same.)
+    EXPECT_EQ(r.query(versioned, nullptr).size(), 3u);
+    // The filter sees identifier and entitlements; what it refuses is left out.
+    std::vector<std::string> asked;
+    auto kept = r.query(dict({}), [&](const std::string& id, const Value& ents) {
+        asked.push_back(id);
+        return ents.has("com.corvane.developer.auto-elect-plugin");
+    });
+    ASSERT_EQ(kept.size(), 1u);
+    EXPECT_EQ(kept[0]->identifier(), "com.example.share");
+    EXPECT_EQ(asked.size(), 3u);
+}
+
+TEST(Vantry, UnreadableBundlesAreRefusedAndChangeNothing) {
+    Fixture f;
+    ASSERT_EQ(f.vantry({"register", f.app}).status, 0);
+    auto before = f.vantry({"list"}).out;
+    struct Case {
+        const char* name;
+        std::function<std::string()> make;
+        const char* reason;
+    };
+    const Case cases[] = {
+        {"not a bundle", [&] { axtest::writeFile(f.root / "file", "x"); return f.root / "file"; }, "not a bundle"},
+        {"missing Info.plist", [&] { fs::create_directories(f.root / "Empty.app"); return f.root / "Empty.app"; },
+         "Info.plist"},
+        {"malformed Info.plist", [&] { axtest::writeFile(f.root / "Bad.app/Info.plist", "<plist><dict>"); return f.root / "Bad.app"; },
+         "Info.plist"},
+        {"plug-in without identifier",
+         [&] {
+             std::string a = axtest::makeBundle(f.root.path(), "NoId.app", axtest::appInfo("com.example.noid"));
+             axtest::makeBundle(a + "/PlugIns", "X.appex", dict({{"KSExtension", dict({})}}));
+             return a;
+         },
+         "without identifier"},
+        {"symbolic link loop under PlugIns",
+         [&] {
+             std::string a = axtest::makeBundle(f.root.path(), "Loop.app", axtest::appInfo("com.example.loop"));
+             fs::create_directories(a + "/PlugIns");
+             fs::create_symlink(a + "/PlugIns/B.appex", a + "/PlugIns/A.appex");
+             fs::create_symlink(a + "/PlugIns/A.appex", a + "/PlugIns/B.appex");
+             return a;
+         },
+         "symbolic link loop"},
+        {"a changed plug-in that became unreadable inside a registered application",
+         [&] {
+             axtest::writeFile(f.app + "/PlugIns/Plain.appex/Info.plist", "garbage");
+             return f.app;
+         },
+         "Info.plist"},
+    };
+    for (const auto& c : cases) {
+        auto result = f.vantry({"register", c.make()});
+        EXPECT_NE(result.status, 0) << c.name;
+        EXPECT_NE(result.err.find(c.reason), std::string::npos) << c.name << ": " << result.err;
+        EXPECT_EQ(f.vantry({"list"}).out, before) << c.name;
+    }
+    EXPECT_NE(f.vantry({"unregister", f.root / "never"}).status, 0);
+}
+
+TEST(Vantry, AChangedPlugInIsReplacedAndOthersKeepTheirIdentity) {
+    Fixture f;
+    auto registry = Registry::open(Registry::defaultPath());
+    auto& r = **registry;
+    ASSERT_FALSE(r.registerBundle(f.app));
+    auto share = r.plugInForPath(f.app + "/PlugIns/Share.appex");
+    auto data = r.plugInForPath(f.app + "/PlugIns/Data.appex");
+    Value info = *plist::readFile(f.app + "/PlugIns/Data.appex/Info.plist");
+    Dictionary changed = *info.asDictionary();
+    changed["KFBundleVersion"] = Value("2");
+    plist::writeXMLFile(f.app + "/PlugIns/Data.appex/Info.plist", Value(changed));
+    ASSERT_FALSE(r.registerBundle(f.app));
+    EXPECT_EQ(r.plugInForPath(f.app + "/PlugIns/Share.appex")->uuid(), share->uuid());
+    auto newData = r.plugInForPath(f.app + "/PlugIns/Data.appex");
+    EXPECT_NE(newData->uuid(), data->uuid());
+    EXPECT_EQ(newData->bundleVersion(), "2");
+    EXPECT_FALSE(r.plugInForUUID(data->uuid()));
+    // Placeholders and stand-alone plug-ins.
+    ASSERT_FALSE(r.registerBundle(f.app, true));
+    EXPECT_TRUE(r.applicationForPath(f.app)->isPlaceholder());
+    std::string alone = axtest::makeBundle(layout::systemRoot(), "Alone.appex",
+                                           axtest::plugInInfo("com.corvane.alone", dict({})), "/bin/true");
+    ASSERT_FALSE(r.registerBundle(alone));
+    auto a = r.plugInForPath(alone);
+    ASSERT_TRUE(a);
+    EXPECT_TRUE(a->onSystemVolume());
+    EXPECT_FALSE(a->containingApplication());
+}
+
+TEST(Vantry, ADamagedDatabaseIsReportedAndRebuilt) {
+    Fixture f;
+    ASSERT_EQ(f.vantry({"register", f.app}).status, 0);
+    std::string db = Registry::defaultPath();
+    for (const char* suffix : {"-wal", "-shm"}) fs::remove(db + suffix);
+    axtest::writeFile(db, std::string(8192, 'x'));
+    auto broken = f.vantry({"list"});
+    EXPECT_NE(broken.status, 0);
+    EXPECT_NE(broken.err.find("vantry rebuild"), std::string::npos) << broken.err;
+    auto rebuilt = f.vantry({"rebuild"});
+    EXPECT_EQ(rebuilt.status, 0) << rebuilt.err;
+    auto list = f.vantry({"list", "--json"});
+    EXPECT_EQ(list.status, 0);
+    EXPECT_NE(list.out.find("com.example.share"), std::string::npos) << list.out;
+}
