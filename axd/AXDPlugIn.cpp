@@ -1,0 +1,144 @@
+#include "axd/AXDPlugIn.h"
+
+#include <cerrno>
+#include <cstring>
+
+#include "Annexa/AXSandboxExtension.h"
+#include "platform/layout/Layout.h"
+
+namespace annexa {
+
+namespace log = corvane::log;
+using corvane::vantry::Scope;
+
+std::shared_ptr<AXDPlugIn> AXDPlugIn::initWithVTData(const corvane::vantry::PlugInRecordPtr& r) {
+    if (!r || r->bundlePath().empty()) return nullptr;
+    auto p = std::make_shared<AXDPlugIn>();
+    // The registry record answers every lookup, so it is in place before anything asks.
+    p->setVtproxy(r);
+    std::optional<std::string> name;
+    if (!r->identifier().empty()) name = r->identifier();
+    if (!p->setupWithNameUrlBundleInfoInfoUuid(name, r->bundlePath(), Value(), r->pluginDictionary(), r->uuid()))
+        return nullptr;
+    p->setPlugInDictionary(r->pluginDictionary());
+    p->setEntitlements(r->entitlements());
+    p->setOriginalIdentifier(r->originalIdentifier());
+    p->setLastModified(static_cast<int32_t>(r->registrationDate().wholeSeconds()));
+    p->setOnSystemVolume(r->onSystemVolume());
+    const Value& hub = r->pluginDictionary()[keys::kHubProtocolVersion];
+    if (hub.isNumber()) {
+        p->setHubProtocolVersion(static_cast<uint32_t>(*hub.uint64Value()));
+    } else {
+        p->setHubProtocolVersion(p->infoKey(keys::kOldStyle).isNull() ? 2 : 1);
+    }
+    if (const auto& app = r->containingApplication()) p->setContainingUrl(app->bundlePath());
+    if (auto err = p->diagnose()) {
+        log::info(logOps(), "ignoring mis-configured plug-in at %@: %{public}@", r->bundlePath(), err->description());
+        return nullptr;
+    }
+    return p;
+}
+
+Value AXDPlugIn::infoKey(std::string_view key) const {
+    return vtproxy_ ? vtproxy_->lookup(Scope::InfoPlist, key) : Value();
+}
+Value AXDPlugIn::pluginKey(std::string_view key) const {
+    return vtproxy_ ? vtproxy_->lookup(Scope::PlugIn, key) : Value();
+}
+Value AXDPlugIn::attribute(std::string_view key) const {
+    return vtproxy_ ? vtproxy_->lookup(Scope::Attributes, key) : Value();
+}
+Value AXDPlugIn::bundleInfoDictionary() const { return vtproxy_ ? vtproxy_->infoDictionary() : Value(); }
+
+// The caches fill on the first read that gets an answer; a missing answer is asked again next time.
+std::optional<std::string> AXDPlugIn::localizedName() const {
+    std::lock_guard lock(namesMutex_);
+    if (!localizedName_ && vtproxy_) localizedName_ = vtproxy_->localizedName();
+    return localizedName_;
+}
+void AXDPlugIn::setLocalizedName(const std::optional<std::string>& v) {
+    std::lock_guard lock(namesMutex_);
+    localizedName_ = v;
+}
+std::optional<std::string> AXDPlugIn::localizedShortName() const {
+    std::lock_guard lock(namesMutex_);
+    if (!localizedShortName_ && vtproxy_) localizedShortName_ = vtproxy_->localizedShortName();
+    return localizedShortName_;
+}
+void AXDPlugIn::setLocalizedShortName(const std::optional<std::string>& v) {
+    std::lock_guard lock(namesMutex_);
+    localizedShortName_ = v;
+}
+std::optional<std::string> AXDPlugIn::localizedContainingName() const {
+    std::lock_guard lock(namesMutex_);
+    if (!localizedContainingName_ && vtproxy_ && vtproxy_->containingApplication())
+        localizedContainingName_ = vtproxy_->containingApplication()->localizedName();
+    return localizedContainingName_;
+}
+void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) {
+    std::lock_guard lock(namesMutex_);
+    localizedContainingName_ = v;
+}
+
+std::optional<Error> AXDPlugIn::diagnose() const {
+    if (auto err = AXPlugInCore::diagnose()) return err;
+    if (!isData() && !(vtproxy_ && vtproxy_->dataContainerPath()))
+        return makeError(12, "this plug-in has no sandbox data container");
+    // Stand-alone plug-ins belong to the system volume (under the platform root when it moves).
+    if (!containingUrl() && path().rfind(corvane::layout::systemRoot() + "/", 0) != 0)
+        return makeError(12, "plug-ins outside containing apps must be in /System");
+    return std::nullopt;
+}
+
+Value AXDPlugIn::valueForEntitlement(const std::string& key) const { return entitlements()[key]; }
+
+bool AXDPlugIn::hasEntitlement(const std::string& key) const {
+    Value v = valueForEntitlement(key);
+    return !v.isNull() && !v.isFalse();
+}
+
+std::string AXDPlugIn::annotationKey() const {
+    Value replaced = valueForEntitlement(keys::kReplaceEntitlement);
+    if (const std::string* s = replaced.asString()) return *s;
+    return identifier().value_or("");
+}
+
+void AXDPlugIn::augmentForm(Dictionary& form) const {
+    Value resources = pluginKey(keys::kShared);
+    if (isAppExtension()) resources = Value(Array{Value(".")});
+    // Only a name or a list of names is a resource list; anything else is none.
+    if (!resources.isString() && !resources.isArray()) return;
+    form.insert_or_assign(form::kExtensions, Value(issueResourceExtensions(resources)));
+}
+
+Dictionary AXDPlugIn::issueResourceExtensions(const Value& resources) const {
+    Array list;
+    if (resources.isString()) {
+        list.push_back(resources);
+    } else if (const Array* a = resources.asArray()) {
+        list = *a;
+    }
+    Dictionary result;
+    for (const Value& entry : list) {
+        const std::string* name = entry.asString();
+        if (!name) continue;
+        std::string resource = *name == "." ? path() : path() + "/" + *name;
+        if (auto token = issueReadExtensionForURL(resource)) {
+            result.insert_or_assign(*name, Value(*token));
+        } else {
+            log::info(logOps(), "failed to make extension for %@ in plug-in at %@: %{public}s", resource, path(),
+                      std::strerror(errno));
+        }
+    }
+    return result;
+}
+
+Dictionary AXDPlugIn::prunedInfoDictionaryFor(const Value& dictionary) {
+    Dictionary out;
+    if (const Dictionary* d = dictionary.asDictionary())
+        for (const auto& [k, v] : *d)
+            if (k.rfind("DT", 0) != 0) out.emplace(k, v);
+    return out;
+}
+
+}  // namespace annexa

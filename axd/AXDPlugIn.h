@@ -1,0 +1,63 @@
+// The daemon's plug-in record: an AXPlugInCore built from the application registry's record of one
+// plug-in, answering its metadata lookups from that record instead of from stored dictionaries.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "Annexa/AXPlugInCore.h"
+#include "platform/vantry/Vantry.h"
+
+namespace annexa {
+
+// Thread-safe: the registry record is set once, before the record is published; the three name
+// caches are replaced whole under a lock.
+class AXDPlugIn : public AXPlugInCore {
+public:
+    // A record for the registry's record, or null: no bundle location, no identifier, or a
+    // misconfigured plug-in (logged).
+    static std::shared_ptr<AXDPlugIn> initWithVTData(const corvane::vantry::PlugInRecordPtr& record);
+
+    Value infoKey(std::string_view key) const override;
+    Value pluginKey(std::string_view key) const override;
+    Value attribute(std::string_view key) const override;
+    Value bundleInfoDictionary() const override;
+    std::optional<std::string> localizedName() const override;
+    void setLocalizedName(const std::optional<std::string>& v) override;
+    std::optional<std::string> localizedShortName() const override;
+    void setLocalizedShortName(const std::optional<std::string>& v) override;
+    std::optional<std::string> localizedContainingName() const override;
+    void setLocalizedContainingName(const std::optional<std::string>& v) override;
+    std::optional<Error> diagnose() const override;
+
+    // The plug-in's own entitlement, or null.
+    Value valueForEntitlement(const std::string& key) const;
+    // Present and not equal to false (a number 0 counts as false).
+    bool hasEntitlement(const std::string& key) const;
+    // The key of the plug-in's annotations: the identifier named by its replace-plugin entitlement
+    // when that is a string, else its own identifier.
+    std::string annotationKey() const;
+    // Adds "extensions": read tokens for the plug-in's shared resources (the bundle itself for an
+    // application extension).
+    void augmentForm(Dictionary& form) const;
+    // Resource name -> read token, for a name or a list of names ("." is the bundle itself).
+    Dictionary issueResourceExtensions(const Value& resources) const;
+    // The entries whose keys do not begin with "DT".
+    static Dictionary prunedInfoDictionaryFor(const Value& dictionary);
+
+    const corvane::vantry::PlugInRecordPtr& vtproxy() const { return vtproxy_; }
+    void setVtproxy(corvane::vantry::PlugInRecordPtr record) { vtproxy_ = std::move(record); }
+
+private:
+    corvane::vantry::PlugInRecordPtr vtproxy_;
+    mutable std::mutex namesMutex_;
+    mutable std::optional<std::string> localizedName_;
+    mutable std::optional<std::string> localizedShortName_;
+    mutable std::optional<std::string> localizedContainingName_;
+};
+
+using AXDPlugInPtr = std::shared_ptr<AXDPlugIn>;
+
+}  // namespace annexa

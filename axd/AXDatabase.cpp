@@ -1,0 +1,187 @@
+#include "axd/AXDatabase.h"
+
+#include "platform/notify/Notify.h"
+
+namespace annexa {
+
+namespace log = corvane::log;
+using corvane::vantry::PlugInRecordPtr;
+
+// Forwards the registry's events while the database lives.
+class AXDatabase::RegistryObserver : public corvane::vantry::Observer {
+public:
+    explicit RegistryObserver(AXDatabase* db) : db_(db) {}
+    void detach() {
+        std::lock_guard lock(mutex_);
+        db_ = nullptr;
+    }
+    void pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) override {
+        std::lock_guard lock(mutex_);
+        if (db_) db_->pluginsDidInstall(records);
+    }
+    void pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) override {
+        std::lock_guard lock(mutex_);
+        if (db_) db_->pluginsWillUninstall(records);
+    }
+
+private:
+    std::mutex mutex_;
+    AXDatabase* db_;
+};
+
+AXDatabase::AXDatabase(const char* database, corvane::vantry::Registry& workspace)
+    : workspace_(workspace),
+      sync_(corvane::dispatch::Queue::create("AXDatabase")),
+      syncQueue_(*sync_),
+      observer_(std::make_shared<RegistryObserver>(this)) {
+    // Made before the queue serves anything; nothing else can see it yet.
+    auto store = std::make_unique<AXDAnnotationStore>(database);
+    syncQueue_.sync([&] {
+        syncQueue_.assertCurrent();
+        annotations_ = std::move(store);
+    });
+    workspace_.addObserver(observer_);
+}
+
+AXDatabase::~AXDatabase() { observer_->detach(); }
+
+AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
+    syncQueue_.assertNotCurrent();
+    AXDPlugInPtr result;
+    syncQueue_.sync([&] {
+        syncQueue_.assertCurrent();
+        auto it = cache_.find(record->uuid());
+        result = it != cache_.end() ? it->second : createPlugInForProxy(record);
+    });
+    return result;
+}
+
+AXDPlugInPtr AXDatabase::createPlugInForProxy(const PlugInRecordPtr& record) {
+    syncQueue_.assertCurrent();
+    AXDPlugInPtr plugIn = AXDPlugIn::initWithVTData(record);
+    if (!plugIn) return nullptr;
+    // The record is stored only once built, and elected first when it asks for that.
+    if (plugIn->hasEntitlement(keys::kAutoElectEntitlement)) autoElect(*plugIn);
+    purgeCachesToLimit(static_cast<int32_t>(cacheLimit()));
+    cache_[*plugIn->uuid()] = plugIn;
+    return plugIn;
+}
+
+void AXDatabase::purgeCachesToLimit(int32_t limit) {
+    syncQueue_.assertCurrent();
+    if (cache_.size() <= static_cast<uint32_t>(limit)) return;
+    log::info(logOps(), "purging cache for %d > %d", static_cast<int>(cache_.size()), limit);
+    cache_.clear();
+    workspace_.dropCaches();
+}
+
+AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) {
+    syncQueue_.assertNotCurrent();
+    AXDPlugInPtr result;
+    syncQueue_.sync([&] {
+        syncQueue_.assertCurrent();
+        auto it = cache_.find(uuid);
+        if (it != cache_.end()) {
+            result = it->second;
+            return;
+        }
+        if (auto record = workspace_.plugInForUUID(uuid)) {
+            result = createPlugInForProxy(record);
+        } else {
+            log::info(logOps(), "Vantry cannot find plug-in with UUID:%{public}@", uuid.string());
+        }
+    });
+    return result;
+}
+
+AXDPlugInPtr AXDatabase::findPlugInAtPath(const std::string& path) {
+    auto record = workspace_.plugInForPath(path);
+    if (!record) {
+        log::info(logOps(), "Vantry cannot find plug-in at path:%@", path);
+        return nullptr;
+    }
+    return findPlugIn(record->uuid());
+}
+
+std::optional<std::vector<AXDPlugInPtr>> AXDatabase::plugInsWithinApplication(const std::string& path) {
+    auto app = workspace_.applicationForPath(path);
+    auto records = app ? app->plugIns() : std::vector<PlugInRecordPtr>{};
+    if (records.empty()) return std::nullopt;
+    std::vector<AXDPlugInPtr> result;
+    for (const auto& r : records)
+        if (auto p = plugInForProxy(r)) result.push_back(std::move(p));
+    return result;
+}
+
+MaybeError AXDatabase::addPlugIn(const std::string& path) {
+    if (workspace_.registerBundle(path)) return makeError(2, "Vantry failed to register the plug-in");
+    return std::nullopt;
+}
+
+MaybeError AXDatabase::removePlugIn(const std::string& path) {
+    if (workspace_.unregisterBundle(path)) return makeError(2, "Vantry failed to deregister the plug-in");
+    return std::nullopt;
+}
+
+Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {
+    syncQueue_.assertNotCurrent();
+    return syncQueue_.syncResult([&] {
+        syncQueue_.assertCurrent();
+        return annotations_->annotationForPlugIn(plugIn);
+    });
+}
+
+void AXDatabase::setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn) {
+    syncQueue_.assertNotCurrent();
+    syncQueue_.sync([&] {
+        syncQueue_.assertCurrent();
+        annotations_->setAnnotationForPlugIn(annotation, plugIn);
+    });
+}
+
+void AXDatabase::notifyAnnotationChange() { (void)corvane::notify::post(kAnnotationChangeNotification); }
+
+void AXDatabase::autoElect(const AXDPlugIn& plugIn) {
+    syncQueue_.assertCurrent();
+    Value current = annotations_->annotationForPlugIn(plugIn);
+    const Value* election = current.find(keys::kElection);
+    // An election already made is never overridden.
+    if (election && election->int64Value().value_or(0) != 0) return;
+    annotations_->setAnnotationForPlugIn(Value(dictionaryChanging(current, keys::kElection, Value(1))), plugIn);
+}
+
+void AXDatabase::pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) {
+    for (const auto& r : records) {
+        log::notice(logOps(), "plug-in INSTALLED:%@ %@(%@) %{public}@ %@", r->bundleIdentifier(), r->identifier(),
+                    r->bundleVersion(), r->uuid().string(), r->bundlePath());
+    }
+}
+
+void AXDatabase::pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) {
+    syncQueue_.assertNotCurrent();
+    syncQueue_.sync([&] {
+        syncQueue_.assertCurrent();
+        for (const auto& r : records) {
+            log::notice(logOps(), "plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", r->bundleIdentifier(),
+                        r->identifier(), r->bundleVersion(), r->uuid().string(), r->bundlePath());
+            cache_.erase(r->uuid());
+        }
+    });
+    if (AXDatabaseDelegate* d = delegate()) d->removedPlugIns(records);
+}
+
+size_t AXDatabase::cacheCount() {
+    return syncQueue_.syncResult([&] {
+        syncQueue_.assertCurrent();
+        return cache_.size();
+    });
+}
+
+std::string AXDatabase::annotationsURL() {
+    return syncQueue_.syncResult([&] {
+        syncQueue_.assertCurrent();
+        return annotations_->annotationsURL();
+    });
+}
+
+}  // namespace annexa

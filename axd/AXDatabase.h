@@ -1,0 +1,88 @@
+// The daemon's plug-in database: a cache of daemon plug-in records built on demand from the
+// application registry's records, the lookups the request handlers use, registration through the
+// registry, the annotations (with auto-election) and the registry's install and uninstall events.
+//
+// The registry (Vantry) is the source of truth; the database never enumerates bundles. A cached
+// record is returned for as long as its entry lives, however its bundle changed since; entries
+// leave only when the registry announces an uninstall, or all at once when an insertion finds the
+// cache over its limit.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <optional>
+#include <unordered_map>
+#include <vector>
+
+#include "axd/AXDAnnotationStore.h"
+#include "axd/AXDPlugIn.h"
+#include "platform/dispatch/Dispatch.h"
+#include "platform/vantry/Vantry.h"
+
+namespace annexa {
+
+// Told when plug-ins are being uninstalled, after the database dropped them; called on the
+// registry's thread.
+class AXDatabaseDelegate {
+public:
+    virtual ~AXDatabaseDelegate() = default;
+    virtual void removedPlugIns(const std::vector<corvane::vantry::PlugInRecordPtr>& records) = 0;
+};
+
+inline constexpr const char* kAnnotationChangeNotification = "com.corvane.annexa.annotation-change";
+
+// Lives on: the database queue "AXDatabase" for the cache and the annotation store; the registry
+// and the delegate are used from the calling thread. The queue is entered synchronously and never
+// re-entered.
+class AXDatabase {
+public:
+    // Opens the annotation store (`database`: the -d path, or null for its default location),
+    // makes the queue and subscribes to the registry's events.
+    AXDatabase(const char* database, corvane::vantry::Registry& workspace);
+    virtual ~AXDatabase();
+    AXDatabase(const AXDatabase&) = delete;
+    AXDatabase& operator=(const AXDatabase&) = delete;
+
+    AXDPlugInPtr plugInForProxy(const corvane::vantry::PlugInRecordPtr& record);
+    AXDPlugInPtr createPlugInForProxy(const corvane::vantry::PlugInRecordPtr& record) REQUIRES(syncQueue_);
+    void purgeCachesToLimit(int32_t limit) REQUIRES(syncQueue_);
+    AXDPlugInPtr findPlugIn(const UUID& uuid);
+    AXDPlugInPtr findPlugInAtPath(const std::string& path);
+    // Null (not empty) when the application has no plug-ins or is not known.
+    std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& path);
+    MaybeError addPlugIn(const std::string& path);
+    MaybeError removePlugIn(const std::string& path);
+
+    Value annotationForPlugIn(const AXDPlugIn& plugIn);
+    void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
+    void notifyAnnotationChange();
+    void autoElect(const AXDPlugIn& plugIn) REQUIRES(syncQueue_);
+    void pluginsDidInstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records);
+    void pluginsWillUninstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records);
+
+    AXDatabaseDelegate* delegate() const { return delegate_.load(); }
+    // Not owned.
+    void setDelegate(AXDatabaseDelegate* delegate) { delegate_.store(delegate); }
+    uint32_t cacheLimit() const { return cacheLimit_.load(); }
+    void setCacheLimit(uint32_t limit) { cacheLimit_.store(limit); }
+    corvane::vantry::Registry& workspace() const { return workspace_; }
+    corvane::dispatch::Queue& syncQueue() const RETURN_CAPABILITY(syncQueue_) { return syncQueue_; }
+    // The number of cached records (read on the database queue).
+    size_t cacheCount();
+    // The annotation file's location.
+    std::string annotationsURL();
+
+private:
+    class RegistryObserver;
+
+    std::atomic<AXDatabaseDelegate*> delegate_{nullptr};
+    std::atomic<uint32_t> cacheLimit_{0};
+    corvane::vantry::Registry& workspace_;
+    corvane::dispatch::QueuePtr sync_;
+    corvane::dispatch::Queue& syncQueue_;
+    std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(syncQueue_);
+    std::unordered_map<UUID, AXDPlugInPtr, corvane::UUIDHash> cache_ GUARDED_BY(syncQueue_);
+    std::shared_ptr<RegistryObserver> observer_;
+};
+
+}  // namespace annexa
