@@ -66,7 +66,7 @@ public:
     uint32_t cacheLimit() const { return cacheLimit_.load(); }
     void setCacheLimit(uint32_t limit) { cacheLimit_.store(limit); }
     corvane::vantry::Registry& workspace() const { return workspace_; }
-    corvane::dispatch::Queue& syncQueue() const RETURN_CAPABILITY(syncQueue_) { return syncQueue_; }
+    corvane::dispatch::Queue& databaseQueue() const RETURN_CAPABILITY(syncQueue_) { return syncQueue_; }
     // The number of cached records (read on the database queue).
     size_t cacheCount();
     // The annotation file's location.
