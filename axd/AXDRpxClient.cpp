@@ -1,0 +1,88 @@
+#include "axd/AXDRpxClient.h"
+
+#include <cstdio>
+
+#include "axd/AXDServer.h"
+#include "axd/Transaction.h"
+#include "platform/trace/Trace.h"
+
+namespace annexa {
+
+namespace log = corvane::log;
+
+AXDRpxClient::AXDRpxClient(const corvane::rpx::ConnectionPtr& connection, AXDServer* server)
+    : connection_(connection), server_(server), pid_(connection->pid()) {}
+
+std::shared_ptr<AXDRpxClient> AXDRpxClient::initWithConnectionServer(const corvane::rpx::ConnectionPtr& connection,
+                                                                     AXDServer* server) {
+    auto client = std::shared_ptr<AXDRpxClient>(new AXDRpxClient(connection, server));
+    const auto& peer = connection->peer();
+    if (!peer.executablePath.empty()) client->bundle_ = AXBundle::initWithExecutableURL(peer.executablePath);
+    client->path_ = peer.executablePath;
+    log::debug(logOps(), "new client %d %s", client->pid_, client->path_);
+    AXD_TRACE(client__new, client->pid_);
+    client->task_ = corvane::codesign::Handle::fromAuditToken(peer.auditToken);
+    connection->setContext(client, [](std::shared_ptr<void> context) { context.reset(); });
+    connection->setEventHandler([client](const corvane::rpx::Event& event) { client->handleEvent(event); });
+    connection->resume();
+    return client;
+}
+
+void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
+    if (event.error == corvane::rpx::ErrorKind::TerminationImminent) return dying();
+    if (event.error == corvane::rpx::ErrorKind::ConnectionInvalid) return dead();
+    if (!event.message.isDictionary()) {
+        log::error(logOps(), "unexpected message: %{public}@ from: %d", event.message, pid());
+        // A sender that waits for an answer gets one rather than waiting for ever.
+        if (auto conn = connection(); conn && event.wantsReply)
+            conn->sendReply(event.messageId, Value(Dictionary{{"errorcode", Value(uint64_t{4})},
+                                                              {"error", Value("invalid request format")}}));
+        return;
+    }
+    if (AXD_TRACE_ENABLED(request__input)) {
+        std::string text = event.message.description();
+        AXD_TRACE(request__input, pid(), text.c_str());
+    }
+    auto transaction = std::make_shared<Transaction>(event, shared_from_this());
+    server_->submitWork([transaction] {
+        AXDRpxClient& client = *transaction->client();
+        uint32_t count = client.countRequest();
+        if (count % 1000 == 0) log::debug(logOps(), "client %d used %u requests so far", client.pid(), count);
+        transaction->dispatch();
+    });
+}
+
+int AXDRpxClient::pid() const { return connection_.expired() ? 0 : pid_; }
+
+Value AXDRpxClient::entitlementValueForKey(const std::string& key) const {
+    if (!task_) {
+        log::error(logOps(), "error retrieving entitlements for client %d", pid());
+        return Value();
+    }
+    return task_->valueForEntitlement(key);
+}
+
+bool AXDRpxClient::hasEntitlement(const std::string& key) const {
+    Value v = entitlementValueForKey(key);
+    return !v.isNull() && !v.isFalse();
+}
+
+void AXDRpxClient::dying() { log::debug(logOps(), "client %d termination imminent", pid_); }
+
+void AXDRpxClient::dead() {
+    server_->unholdClient(this);
+    log::debug(logOps(), "client %d is dead", pid_);
+    acceptWork_.store(false);
+    AXD_TRACE(client__done, pid_);
+}
+
+std::string AXDRpxClient::description() const {
+    char addr[32];
+    std::snprintf(addr, sizeof addr, "%p", static_cast<const void*>(this));
+    auto conn = connection();
+    if (!conn) return std::string("<AXDRpxClient ") + addr + " NO CONNECTION>";
+    return std::string("<AXDRpxClient ") + addr + " con=" + conn->description() + " pid=" + std::to_string(pid()) +
+           " path=" + path_ + ">";
+}
+
+}  // namespace annexa

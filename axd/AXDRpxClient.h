@@ -1,0 +1,59 @@
+// One connected client of the daemon: who the peer is (process id, executable, bundle, code-signing
+// identity for entitlements), the wrapping of its requests into transactions on the service
+// queue, and its end.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <string>
+
+#include "Annexa/AXBundle.h"
+#include "Annexa/AXUtilities.h"
+#include "platform/codesign/CodeSign.h"
+#include "platform/rpx/Rpx.h"
+
+namespace annexa {
+
+class AXDServer;
+
+// Owned by its connection (as the connection's context, and held by its event handler); refers back
+// to the connection weakly. Thread-safe: acceptWork only goes from true to false; requestCount
+// lives on the service queue.
+class AXDRpxClient : public std::enable_shared_from_this<AXDRpxClient> {
+public:
+    static std::shared_ptr<AXDRpxClient> initWithConnectionServer(const corvane::rpx::ConnectionPtr& connection,
+                                                                  AXDServer* server);
+
+    // The peer's process id; 0 once the connection is gone.
+    int pid() const;
+    const std::string& path() const { return path_; }
+    const std::shared_ptr<AXBundle>& bundle() const { return bundle_; }
+    AXDServer* server() const { return server_; }
+    corvane::rpx::ConnectionPtr connection() const { return connection_.lock(); }
+    bool acceptWork() const { return acceptWork_.load(); }
+    uint32_t requestCount() const { return requestCount_; }
+    // Counts one request; called on the service queue.
+    uint32_t countRequest() { return ++requestCount_; }
+
+    Value entitlementValueForKey(const std::string& key) const;
+    bool hasEntitlement(const std::string& key) const;
+
+    void dying();
+    void dead();
+    std::string description() const;
+
+private:
+    AXDRpxClient(const corvane::rpx::ConnectionPtr& connection, AXDServer* server);
+    void handleEvent(const corvane::rpx::Event& event);
+
+    std::atomic<bool> acceptWork_{true};
+    std::weak_ptr<corvane::rpx::Connection> connection_;
+    AXDServer* const server_;
+    const int pid_;
+    std::string path_;
+    std::shared_ptr<AXBundle> bundle_;
+    std::shared_ptr<corvane::codesign::Handle> task_;
+    uint32_t requestCount_ = 0;  // on the service queue
+};
+
+}  // namespace annexa

@@ -1,0 +1,127 @@
+#include "axd/AXDServer.h"
+
+#include <unistd.h>
+
+#include "axd/AXDRpxClient.h"
+#include "platform/notify/Notify.h"
+
+namespace annexa {
+
+namespace log = corvane::log;
+using corvane::dispatch::Queue;
+
+namespace {
+std::shared_ptr<AXDServer> gServer;  // set once during construction, never cleared
+}  // namespace
+
+// ---- holds
+
+AXDPlugInHold::AXDPlugInHold(const std::vector<AXDPlugInPtr>& plugIns, const std::shared_ptr<AXDRpxClient>& client)
+    : uuid_(UUID::random()), client_(client), clientIdentity_(client.get()), created_(Date::now()) {
+    for (const auto& p : plugIns) blocked_.insert(*p->uuid());
+    corvane::rpx::beginWork();
+}
+
+AXDPlugInHold::~AXDPlugInHold() { corvane::rpx::endWork(); }
+
+bool AXDPlugInHold::blocks(const AXDPlugIn& plugIn) const { return blocked_.count(*plugIn.uuid()) > 0; }
+
+bool AXDPlugInHold::heldBy(const AXDRpxClient* client) const { return clientIdentity_ == client && !client_.expired(); }
+
+// ---- server
+
+AXDServer::AXDServer(const char* database)
+    : AXDatabase(database, corvane::vantry::Registry::shared()),
+      rpxQueue_(Queue::create("rpx")),
+      mainQueue_(Queue::create("service", corvane::dispatch::QoS::UserInitiated)),
+      syncQueue_(Queue::create("serverSync")),
+      holdQueue_(*syncQueue_) {}
+
+std::shared_ptr<AXDServer> AXDServer::initForService(const std::string& serviceName, const char* database) {
+    auto server = std::shared_ptr<AXDServer>(new AXDServer(database));
+    auto listener = corvane::rpx::Listener::create(serviceName, server->rpxQueue_);
+    if (!listener) {
+        log::error(logOps(), "cannot listen on %{public}@: %{public}@", serviceName, listener.error().description());
+        return nullptr;
+    }
+    server->service_ = *listener;
+    gServer = server;
+    server->setDelegate(server.get());
+    AXDServer* raw = server.get();
+    server->service_->setConnectionHandler([raw](corvane::rpx::ConnectionPtr connection) {
+        // The client lives on through its connection.
+        AXDRpxClient::initWithConnectionServer(connection, raw);
+    });
+    server->userPrefs_ = std::make_unique<AXDUserPrefs>();
+    return server;
+}
+
+AXDServer* AXDServer::server() { return gServer.get(); }
+
+void AXDServer::run() {
+    service_->resume();
+    for (;;) pause();
+}
+
+void AXDServer::submitWork(std::function<void()> work) { mainQueue_->async(std::move(work)); }
+
+void AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
+    holdQueue_.sync([&] {
+        holdQueue_.assertCurrent();
+        holds_.push_back(std::move(hold));
+    });
+    (void)corvane::notify::post(kAnnotationChangeNotification);
+}
+
+void AXDServer::unholdToken(const UUID& token) {
+    holdQueue_.sync([&] {
+        holdQueue_.assertCurrent();
+        for (auto it = holds_.begin(); it != holds_.end(); ++it) {
+            if ((*it)->uuid() != token) continue;
+            log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token.string());
+            holds_.erase(it);
+            (void)corvane::notify::post(kAnnotationChangeNotification);
+            return;
+        }
+    });
+}
+
+void AXDServer::unholdClient(const AXDRpxClient* client) {
+    holdQueue_.sync([&] {
+        holdQueue_.assertCurrent();
+        for (;;) {
+            auto it = std::find_if(holds_.begin(), holds_.end(),
+                                   [&](const auto& h) { return h->heldBy(client); });
+            if (it == holds_.end()) break;
+            log::debug(logOps(), "releasing plug-in hold %{public}@ for dead client pid %d", (*it)->uuid().string(),
+                       client->pid());
+            holds_.erase(it);
+            (void)corvane::notify::post(kAnnotationChangeNotification);
+        }
+    });
+}
+
+bool AXDServer::holdOnPlugIn(const AXDPlugIn& plugIn) {
+    return holdQueue_.syncResult([&] {
+        holdQueue_.assertCurrent();
+        return std::any_of(holds_.begin(), holds_.end(), [&](const auto& h) { return h->blocks(plugIn); });
+    });
+}
+
+size_t AXDServer::holdCount() {
+    return holdQueue_.syncResult([&] {
+        holdQueue_.assertCurrent();
+        return holds_.size();
+    });
+}
+
+void AXDServer::removedPlugIns(const std::vector<corvane::vantry::PlugInRecordPtr>& records) {
+    // Ending the processes of uninstalled plug-ins is the service manager's work; until the
+    // daemon talks to one, it records what it would ask.
+    for (const auto& r : records) {
+        log::debug(logOps(), "requesting spawnd termination of plug-in: %s(%s) %{public}@", r->bundleIdentifier(),
+                   r->bundleVersion(), r->uuid().string());
+    }
+}
+
+}  // namespace annexa

@@ -1,0 +1,84 @@
+// The daemon's server: the plug-in database (it is one), the service endpoint on which clients
+// connect, the queues all daemon work runs on, the list of plug-in holds and the preference domain.
+#pragma once
+
+#include <memory>
+#include <set>
+#include <vector>
+
+#include "axd/AXDUserPrefs.h"
+#include "axd/AXDatabase.h"
+#include "platform/dispatch/Dispatch.h"
+#include "platform/rpx/Rpx.h"
+
+namespace annexa {
+
+class AXDRpxClient;
+
+// A hold blocks a set of plug-ins on behalf of one client; while any hold exists the process has
+// outstanding work. Immutable after construction.
+class AXDPlugInHold {
+public:
+    AXDPlugInHold(const std::vector<AXDPlugInPtr>& plugIns, const std::shared_ptr<AXDRpxClient>& client);
+    ~AXDPlugInHold();
+    AXDPlugInHold(const AXDPlugInHold&) = delete;
+    AXDPlugInHold& operator=(const AXDPlugInHold&) = delete;
+
+    const UUID& uuid() const { return uuid_; }
+    bool blocks(const AXDPlugIn& plugIn) const;
+    const AXDRpxClient* client() const { return client_.lock().get(); }
+    bool heldBy(const AXDRpxClient* client) const;
+    Date created() const { return created_; }
+
+private:
+    const UUID uuid_;
+    std::set<UUID> blocked_;
+    std::weak_ptr<AXDRpxClient> client_;
+    const AXDRpxClient* clientIdentity_;
+    const Date created_;
+};
+
+// The database part lives on its queue; the holds on "serverSync"; requests run on "service".
+class AXDServer : public AXDatabase, public AXDatabaseDelegate {
+public:
+    static constexpr const char* kDefaultServiceName = "com.corvane.annexa.axd";
+
+    // The server, or null when its endpoint cannot be served.
+    static std::shared_ptr<AXDServer> initForService(const std::string& serviceName, const char* database);
+    // The process's server; null before the first construction.
+    static AXDServer* server();
+
+    // Resumes the listener and serves for the life of the process.
+    [[noreturn]] void run();
+    void submitWork(std::function<void()> work);
+
+    void addHold(std::shared_ptr<AXDPlugInHold> hold);
+    void unholdToken(const UUID& token);
+    void unholdClient(const AXDRpxClient* client);
+    bool holdOnPlugIn(const AXDPlugIn& plugIn);
+    size_t holdCount();
+
+    void removedPlugIns(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;
+
+    uint32_t verbose() const { return verbose_; }
+    void setVerbose(uint32_t v) { verbose_ = v; }
+    const corvane::dispatch::QueuePtr& rpxQueue() const { return rpxQueue_; }
+    const corvane::dispatch::QueuePtr& mainQueue() const { return mainQueue_; }
+    const corvane::dispatch::QueuePtr& syncQueue() const { return syncQueue_; }
+    const std::shared_ptr<corvane::rpx::Listener>& service() const { return service_; }
+    const AXDUserPrefs& userPrefs() const { return *userPrefs_; }
+
+private:
+    explicit AXDServer(const char* database);
+
+    uint32_t verbose_ = 0;
+    corvane::dispatch::QueuePtr rpxQueue_;
+    corvane::dispatch::QueuePtr mainQueue_;
+    std::shared_ptr<corvane::rpx::Listener> service_;
+    std::unique_ptr<AXDUserPrefs> userPrefs_;
+    corvane::dispatch::QueuePtr syncQueue_;
+    corvane::dispatch::Queue& holdQueue_;
+    std::vector<std::shared_ptr<AXDPlugInHold>> holds_ GUARDED_BY(holdQueue_);
+};
+
+}  // namespace annexa

@@ -1,0 +1,266 @@
+#include "axd/Transaction.h"
+
+#include <climits>
+#include <cstdlib>
+#include <cstring>
+
+#include "Annexa/AXMessage.h"
+#include "axd/AXDRpxClient.h"
+#include "axd/AXDServer.h"
+#include "platform/trace/Trace.h"
+
+namespace annexa {
+
+namespace log = corvane::log;
+
+namespace {
+
+using Handler = void (Transaction::*)();
+
+// Tested in this order, by exact, case-sensitive comparison. Requests whose handlers are not part
+// of this daemon yet ("match", "ready", "access", "lock", "receipt") are not in the table.
+const std::pair<const char*, Handler> kRequests[] = {
+    {"add", &Transaction::addPlugIns},
+    {"remove", &Transaction::removePlugIns},
+    {"bulk", &Transaction::bulkPlugIns},
+    {"annotate", &Transaction::annotatePlugIns},
+    {"bulk-annotate", &Transaction::bulkAnnotatePlugIns},
+};
+
+}  // namespace
+
+Transaction::Transaction(corvane::rpx::Event request, std::shared_ptr<AXDRpxClient> client)
+    : client_(std::move(client)), request_(std::move(request)) {}
+
+AXDServer& Transaction::server() const { return *client_->server(); }
+corvane::rpx::ConnectionPtr Transaction::connection() const { return client_->connection(); }
+
+void Transaction::dispatch() {
+    const std::string* name = request()["request"].asString();
+    const Value& version = request()["version"];
+    version_ = version.kind() == Value::Kind::UInt64 ? *version.uint64Value() : 0;
+    if (version_ != 2 && version_ != 3) {
+        failMessage(7, log::formatText("unsupported protocol version %d (current %d)", static_cast<int32_t>(version_),
+                                       static_cast<int>(kCurrentProtocolVersion)));
+        return;
+    }
+    // The client's connection is already gone: nobody would read a reply.
+    if (!client_->acceptWork()) return;
+    const char* text = name ? name->c_str() : nullptr;
+    log::debug(logOps(), "client %d requested %{public}s", client_->pid(), text);
+    AXD_TRACE(request, client_->pid(), text ? text : "");
+    if (!name) {
+        failMessage(4, "invalid request format (missing type)");
+        return;
+    }
+    for (const auto& [requestName, handler] : kRequests) {
+        if (*name == requestName) {
+            (this->*handler)();
+            return;
+        }
+    }
+    failMessage(4, "unrecognized request");
+}
+
+void Transaction::done() {
+    if (answered_) return;
+    answered_ = true;
+    Value reply(reply_);
+    if (AXD_TRACE_ENABLED(request__output)) {
+        std::string text = reply.description();
+        AXD_TRACE(request__output, client_->pid(), text.c_str());
+    }
+    auto conn = connection();
+    if (conn && request_.wantsReply) conn->sendReply(request_.messageId, reply);
+}
+
+void Transaction::failMessage(int64_t code, const std::string& message) {
+    reply_["errorcode"] = Value(static_cast<uint64_t>(code));
+    reply_["error"] = Value(message);
+    done();
+}
+
+void Transaction::failError(int64_t fallback, const Error& error) {
+    if (error.domain == kAnnexaErrorDomain) {
+        failMessage(error.code, error.text.value_or(""));
+    } else {
+        failMessage(fallback, error.description());
+    }
+}
+
+bool Transaction::marshalPaths(const std::function<Walk(const std::string&, bool)>& handler) {
+    const Value* paths = rpx_dictionary_get_array(request(), "paths");
+    if (!paths) {
+        failMessage(4, "invalid request format");
+        return false;
+    }
+    for (const Value& element : *paths->asArray()) {
+        const std::string* path = element.asString();
+        if (!path) {
+            failMessage(4, "invalid request format");
+            return false;
+        }
+        if (path->empty() || (*path)[0] != '/') {
+            failMessage(9, log::formatText("absolute path required: %s", *path));
+            return false;
+        }
+        char resolved[PATH_MAX];
+        bool ok = realpath(path->c_str(), resolved) != nullptr && std::strlen(resolved) < 1024;
+        if (handler(ok ? std::string(resolved) : *path, ok) == Walk::Stop) return false;
+    }
+    return true;
+}
+
+void Transaction::processPaths(const std::function<Walk(const std::string&, bool)>& handler) {
+    if (marshalPaths(handler)) done();
+}
+
+bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>& handler) {
+    const Value* uuids = rpx_dictionary_get_array(request(), "uuids");
+    if (!uuids) {
+        failMessage(4, "invalid request format (uuid)");
+        return false;
+    }
+    for (const Value& element : *uuids->asArray()) {
+        const UUID* uuid = element.asUUID();
+        if (!uuid) {
+            failMessage(4, "invalid request (bad uuid array)");
+            return false;
+        }
+        AXDPlugInPtr plugIn = server().findPlugIn(*uuid);
+        if (!plugIn) {
+            failMessage(4, "no such plugin (uuid not found)");
+            return false;
+        }
+        if (handler(plugIn) == Walk::Stop) return false;
+    }
+    return true;
+}
+
+void Transaction::addAnnotationForPlugIn(const AXDPlugIn& plugIn, Dictionary& form) {
+    Value annotation = server().annotationForPlugIn(plugIn);
+    form["annotations"] = annotation.isNull() ? Value(Dictionary{}) : annotation;
+}
+
+// ---- registration
+
+void Transaction::addPlugIns() {
+    processPaths([this](const std::string& path, bool resolved) {
+        if (!resolved) {
+            failMessage(9, log::formatText("invalid plugin path: %@", path));
+            return Walk::Stop;
+        }
+        AXD_TRACE(plugin__add, path.c_str());
+        if (server().addPlugIn(path)) {
+            log::notice(logOps(), "failed to register plug-in at %@", path);
+            failMessage(2, log::formatText("unable to register plug-in at %@", path));
+            return Walk::Stop;
+        }
+        return Walk::Continue;
+    });
+}
+
+void Transaction::removePlugIns() {
+    processPaths([this](const std::string& path, bool resolved) {
+        AXD_TRACE(plugin__remove, path.c_str(), resolved);
+        if (!client_->hasEntitlement(keys::kManagerEntitlement)) {
+            log::notice(log::defaultLog(),
+                        "refused request from pid=%d to remove plug-in at %@ - client lacks required entitlement",
+                        client_->pid(), path);
+            failMessage(11, "caller lacks entitlement for this operation");
+            return Walk::Stop;
+        }
+        if (server().removePlugIn(path)) {
+            failMessage(9, log::formatText("no plugin at %@", path));
+            return Walk::Stop;
+        }
+        return Walk::Continue;
+    });
+}
+
+void Transaction::bulkPlugIns() {
+    uint64_t flags = request()["flags"].uint64Value().value_or(0);
+    log::info(logOps(), "bulk options 0x%lx not supported", static_cast<unsigned long>(flags & 0xffffffffu));
+    done();
+}
+
+// ---- annotations
+
+void Transaction::annotatePlugIns() {
+    const Value* annotations = rpx_dictionary_get_dictionary(request(), "annotations");
+    if (!annotations) {
+        failMessage(4, "invalid request format (bad annotations dictionary)");
+        return;
+    }
+    Value d = convertMessageToValue(*annotations);
+    Dictionary changes;
+    if (const Value* election = d.find(keys::kElection)) {
+        if (!election->isNumber()) {
+            failMessage(4, "invalid request format (annotation election)");
+            return;
+        }
+        changes.emplace(keys::kElection, *election);
+    }
+    if (const Value* extension = d.find(keys::kAnnotationExtension)) {
+        if (!extension->isDictionary()) {
+            failMessage(4, "invalid request format (annotation extension)");
+            return;
+        }
+        changes.emplace(keys::kAnnotationExtension, *extension);
+    }
+    if (changes.empty()) {
+        done();
+        return;
+    }
+    Value c(changes);
+    bool walked = processUuidList([&](const AXDPlugInPtr& p) {
+        log::debug(logOps(), "client %d plug-in %@(%{public}@) annotation change: %@", client_->pid(), p->identifier(),
+                   p->uuid()->string(), c);
+        if (changes.count(keys::kElection)) {
+            log::info(logOps(), "client %d plug-in %@(%{public}@) election := %@", client_->pid(), p->identifier(),
+                      p->uuid()->string(), changes.at(keys::kElection));
+        }
+        server().setAnnotationForPlugIn(c, *p);
+        return Walk::Continue;
+    });
+    if (!walked) return;
+    server().notifyAnnotationChange();
+    done();
+}
+
+void Transaction::bulkAnnotatePlugIns() {
+    const Value* annotations = rpx_dictionary_get_dictionary(request(), "annotations");
+    if (!annotations) {
+        failMessage(4, "invalid request format (bad annotations dictionary)");
+        return;
+    }
+    Value d = convertMessageToValue(*annotations);
+    const Dictionary* entries = d.asDictionary();
+    size_t count = entries ? entries->size() : 0;
+    log::debug(logOps(), "bulk change requested for %u plug-ins", static_cast<unsigned>(count));
+    if (entries) {
+        for (const auto& [key, value] : *entries) {
+            if (!value.isDictionary()) {
+                failMessage(18, "annotations values must be dictionaries");
+                return;
+            }
+            auto uuid = UUID::parse(key);
+            if (!uuid) {
+                failMessage(18, "invalid plug-in UUID value");
+                return;
+            }
+            AXDPlugInPtr p = server().findPlugIn(*uuid);
+            if (!p) {
+                failMessage(2, "no plug-in with the requested uuid");
+                return;
+            }
+            log::debug(logOps(), "client %d plug-in %@(%{public}@) extension := %@", client_->pid(), p->identifier(),
+                       p->uuid()->string(), value);
+            server().setAnnotationForPlugIn(corvane::dict({{keys::kAnnotationExtension, value}}), *p);
+        }
+    }
+    server().notifyAnnotationChange();
+    done();
+}
+
+}  // namespace annexa

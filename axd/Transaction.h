@@ -1,0 +1,64 @@
+// One request of one client, served on the service queue: the version check, the dispatch on the
+// request name, the common walks over paths and UUIDs, the handlers, and the one reply.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "Annexa/AXUtilities.h"
+#include "axd/AXDPlugIn.h"
+#include "platform/rpx/Rpx.h"
+
+namespace annexa {
+
+class AXDRpxClient;
+class AXDServer;
+
+inline constexpr uint64_t kCurrentProtocolVersion = 3;
+
+// Lives on: the service queue, for the length of its handler.
+class Transaction {
+public:
+    enum class Walk { Continue, Stop };
+
+    Transaction(corvane::rpx::Event request, std::shared_ptr<AXDRpxClient> client);
+
+    void dispatch();
+    // Sends the reply (dropped when the connection is gone or no reply is expected).
+    void done();
+    void failMessage(int64_t code, const std::string& message);
+    // An error of the domain "Annexa" answers with its own code and text; any other with
+    // `fallback` and its description.
+    void failError(int64_t fallback, const Error& error);
+    // Walks "paths": each absolute path, canonical when it resolves. False when the walk stopped
+    // (the reply was sent then).
+    bool marshalPaths(const std::function<Walk(const std::string& path, bool resolved)>& handler);
+    void processPaths(const std::function<Walk(const std::string& path, bool resolved)>& handler);
+    // Walks "uuids", looking each plug-in up. False when the walk stopped (the reply was sent).
+    bool processUuidList(const std::function<Walk(const AXDPlugInPtr& plugIn)>& handler);
+    void addAnnotationForPlugIn(const AXDPlugIn& plugIn, Dictionary& form);
+
+    // The request handlers.
+    void addPlugIns();
+    void removePlugIns();
+    void bulkPlugIns();
+    void annotatePlugIns();
+    void bulkAnnotatePlugIns();
+
+    const std::shared_ptr<AXDRpxClient>& client() const { return client_; }
+    const Value& request() const { return request_.message; }
+    Dictionary& reply() { return reply_; }
+    uint64_t version() const { return version_; }
+    AXDServer& server() const;
+    corvane::rpx::ConnectionPtr connection() const;
+
+private:
+    std::shared_ptr<AXDRpxClient> client_;
+    corvane::rpx::Event request_;
+    Dictionary reply_;
+    uint64_t version_ = 0;
+    bool answered_ = false;
+};
+
+}  // namespace annexa

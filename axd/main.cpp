@@ -1,0 +1,59 @@
+// axd: the per-user daemon that keeps the registry of application plug-ins.
+#include <getopt.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+
+#include "axd/AXDServer.h"
+
+namespace log = corvane::log;
+
+namespace {
+
+[[noreturn]] void usage() {
+    std::fputs("Usage: axd [-S servicename] [-v]\n", stderr);
+    std::exit(2);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    // Before any thread starts: SIGTERM becomes "termination imminent" for every client.
+    corvane::rpx::handleTermination();
+    log::info(annexa::logOps(), "axd is launching");
+
+    std::string serviceName = annexa::AXDServer::kDefaultServiceName;
+    uint32_t cacheLimit = 1000000;
+    const char* database = nullptr;
+    uint32_t verbose = 0;
+    int opt;
+    while ((opt = getopt(argc, argv, "c:d:S:v")) != -1) {
+        switch (opt) {
+            case 'c':
+                // The leading digits, as a decimal number; text without them gives 0.
+                cacheLimit = static_cast<uint32_t>(std::strtoul(optarg, nullptr, 10));
+                if (optarg[0] < '0' || optarg[0] > '9') cacheLimit = 0;
+                break;
+            case 'd': database = optarg; break;
+            case 'S': serviceName = optarg; break;
+            case 'v':
+                ++verbose;
+                log::error(log::defaultLog(),
+                           "verbose option -v is ineffective; use log config --subsystem com.corvane.annexa");
+                break;
+            default: usage();
+        }
+    }
+    if (optind < argc) usage();
+
+    auto server = annexa::AXDServer::initForService(serviceName, database);
+    if (!server) {
+        log::error(annexa::logOps(), "unable to construct server");
+        return 1;
+    }
+    server->setVerbose(verbose);
+    server->setCacheLimit(cacheLimit);
+    server->run();
+}

@@ -1,0 +1,290 @@
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <fcntl.h>
+
+#include <atomic>
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <thread>
+
+#include "Annexa/AXDaemonClient.h"
+#include "platform/codesign/CodeSign.h"
+#include "platform/layout/Layout.h"
+#include "platform/notify/Notify.h"
+#include "platform/plist/Plist.h"
+#include "platform/rpx/Rpx.h"
+#include "platform/vantry/Vantry.h"
+#include "tests/support/Bundles.h"
+#include "tests/support/TestSupport.h"
+
+using namespace corvane;
+using namespace std::chrono_literals;
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr const char* kChange = "com.corvane.annexa.annotation-change";
+
+// The real daemon on a private platform root, with its log on standard error.
+struct Daemon {
+    axtest::PlatformRoot root;
+    std::unique_ptr<axtest::Process> axd;
+    dispatch::QueuePtr queue = dispatch::Queue::create("test.client");
+
+    explicit Daemon(std::vector<std::string> args = {}) {
+        args.insert(args.begin(), axtest::binary("axd"));
+        axd = std::make_unique<axtest::Process>(args, std::map<std::string, std::string>{
+                                                          {"CORVANE_LOG", "debug"}, {"CORVANE_LOG_SINK", "stderr"}, {"CORVANE_LOG_PRIVATE", "1"}});
+        for (int i = 0; i < 500 && !axtest::exists(rpx::endpointPath("com.corvane.annexa.axd")); ++i)
+            std::this_thread::sleep_for(10ms);
+    }
+    ~Daemon() {
+        axd->signal(SIGTERM);
+        axd->wait(5s);
+    }
+    std::shared_ptr<rpx::Connection> connect() {
+        auto c = rpx::Connection::connect("com.corvane.annexa.axd", queue);
+        c->setEventHandler([](const rpx::Event&) {});
+        c->resume();
+        return c;
+    }
+    Value send(const Value& message) {
+        auto c = connect();
+        auto r = c->sendWithReplySync(message);
+        EXPECT_TRUE(r.ok()) << r.description();
+        return r.value;
+    }
+    axtest::RunResult axctl(std::vector<std::string> args, const std::string& input = {},
+                            const std::string& program = "") {
+        args.insert(args.begin(), program.empty() ? axtest::binary("axctl") : program);
+        return axtest::run(args, {}, input);
+    }
+};
+
+Value request(const char* name, Dictionary extra = {}) {
+    extra["request"] = Value(name);
+    extra["version"] = Value(uint64_t{3});
+    return Value(std::move(extra));
+}
+
+Value error(uint64_t code, const std::string& text) {
+    return dict({{"errorcode", Value(code)}, {"error", Value(text)}});
+}
+
+// An application with two plug-ins.
+std::string makeApp(const std::string& root) {
+    std::string app = axtest::makeBundle(root, "Example.app", axtest::appInfo("com.example.app"), "/bin/true");
+    for (const char* name : {"One", "Two"}) {
+        axtest::makeBundle(app + "/PlugIns", std::string(name) + ".appex",
+                           axtest::plugInInfo(std::string("com.example.") + name,
+                                              dict({{"KSExtensionProtocol", "P"},
+                                                    {"KSExtensionAttributes", dict({{"KSExtensionVersion", "1"}})}})),
+                           "/bin/true");
+    }
+    return app;
+}
+
+}  // namespace
+
+TEST(Axd, MalformedRequestsGetTheirErrorReplies) {
+    Daemon d;
+    UUID unknown = UUID::random();
+    struct Case {
+        const char* name;
+        Value message;
+        Value reply;
+    };
+    const Case cases[] = {
+        {"no version", dict({{"request", "bulk"}}), error(7, "unsupported protocol version 0 (current 3)")},
+        {"version 1", dict({{"request", "bulk"}, {"version", uint64_t{1}}}), error(7, "unsupported protocol version 1 (current 3)")},
+        {"version 4", dict({{"request", "bulk"}, {"version", uint64_t{4}}}), error(7, "unsupported protocol version 4 (current 3)")},
+        {"version of another type", dict({{"request", "bulk"}, {"version", int64_t{3}}}),
+         error(7, "unsupported protocol version 0 (current 3)")},
+        {"version 2 is served", dict({{"request", "bulk"}, {"version", uint64_t{2}}}), dict({})},
+        {"no request name", dict({{"version", uint64_t{3}}}), error(4, "invalid request format (missing type)")},
+        {"case-changed name", request("Add"), error(4, "unrecognized request")},
+        {"unknown name", request("frobnicate"), error(4, "unrecognized request")},
+        {"relative path", request("add", {{"paths", Value(Array{Value("rel/x")})}}), error(9, "absolute path required: rel/x")},
+        {"non-string path", request("add", {{"paths", Value(Array{Value(5)})}}), error(4, "invalid request format")},
+        {"no paths", request("add"), error(4, "invalid request format")},
+        {"missing bundle", request("add", {{"paths", Value(Array{Value("/no/such.app")})}}),
+         error(9, "invalid plugin path: /no/such.app")},
+        {"empty paths", request("add", {{"paths", Value(Array{})}}), dict({})},
+        {"bulk with flags", request("bulk", {{"flags", uint64_t{0xff}}}), dict({})},
+        {"annotate without annotations", request("annotate"), error(4, "invalid request format (bad annotations dictionary)")},
+        {"annotate, election a string", request("annotate", {{"annotations", dict({{"election", "1"}})}}),
+         error(4, "invalid request format (annotation election)")},
+        {"annotate, extension a number", request("annotate", {{"annotations", dict({{"election", 1}, {"extension", 3}})}}),
+         error(4, "invalid request format (annotation extension)")},
+        {"annotate nothing", request("annotate", {{"annotations", dict({{"other", 1}})}}), dict({})},
+        {"annotate, no uuids", request("annotate", {{"annotations", dict({{"election", 1}})}}),
+         error(4, "invalid request format (uuid)")},
+        {"annotate, uuid as text", request("annotate", {{"annotations", dict({{"election", 1}})}, {"uuids", Value(Array{Value(unknown.string())})}}),
+         error(4, "invalid request (bad uuid array)")},
+        {"annotate, unknown uuid", request("annotate", {{"annotations", dict({{"election", 1}})}, {"uuids", Value(Array{Value(unknown)})}}),
+         error(4, "no such plugin (uuid not found)")},
+        {"bulk-annotate, value not a dictionary", request("bulk-annotate", {{"annotations", dict({{unknown.string(), 1}})}}),
+         error(18, "annotations values must be dictionaries")},
+        {"bulk-annotate, key not a UUID", request("bulk-annotate", {{"annotations", dict({{"nope", dict({})}})}}),
+         error(18, "invalid plug-in UUID value")},
+        {"bulk-annotate, unknown UUID", request("bulk-annotate", {{"annotations", dict({{unknown.string(), dict({})}})}}),
+         error(2, "no plug-in with the requested uuid")},
+    };
+    for (const auto& c : cases) EXPECT_EQ(d.send(c.message), c.reply) << c.name;
+    // Only the requests that changed nothing but succeeded without plug-ins post nothing.
+    EXPECT_EQ(notify::count(kChange), 0u);
+    EXPECT_TRUE(d.axd->waitForErr("bulk options 0xff not supported"));
+}
+
+TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    auto add = d.axctl({"add", app});
+    ASSERT_EQ(add.status, 0) << add.err;
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    auto one = (*registry)->plugInForPath(app + "/PlugIns/One.appex");
+    auto two = (*registry)->plugInForPath(app + "/PlugIns/Two.appex");
+    ASSERT_TRUE(one && two);
+
+    // annotate two plug-ins: both change, one notification.
+    auto annotate = d.axctl({"annotate", "--election", "1", one->uuid().string(), two->uuid().string()});
+    ASSERT_EQ(annotate.status, 0) << annotate.err;
+    EXPECT_EQ(notify::count(kChange), 1u);
+    std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";
+    auto onDisk = plist::readFile(file);
+    ASSERT_TRUE(onDisk) << file;
+    EXPECT_EQ(*onDisk, dict({{"version", 16},
+                             {"data", dict({{"com.example.One", dict({{"election", 1}})},
+                                            {"com.example.Two", dict({{"election", 1}})}})}}));
+    // The second UUID unknown: the first is changed and saved, no notification.
+    Value partial = d.send(request("annotate", {{"annotations", dict({{"election", 2}})},
+                                                 {"uuids", Value(Array{Value(one->uuid()), Value(UUID::random())})}}));
+    EXPECT_EQ(partial, error(4, "no such plugin (uuid not found)"));
+    EXPECT_EQ(notify::count(kChange), 1u);
+    // bulk-annotate replaces the extension whole and keeps the election.
+    plist::writeXMLFile(d.root / "bulk.plist", dict({{one->uuid().string(), dict({})}}));
+    ASSERT_EQ(d.axctl({"bulk-annotate", d.root / "bulk.plist"}).status, 0);
+    EXPECT_EQ(notify::count(kChange), 2u);
+    EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"], dict({{"election", 2}, {"extension", dict({})}}));
+    EXPECT_TRUE(d.axd->waitForErr("election := 1"));
+
+    // remove: refused without the manager entitlement, served with it.
+    auto refused = d.axctl({"remove", app});
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_NE(refused.err.find("caller lacks entitlement for this operation (error 11)"), std::string::npos) << refused.err;
+    EXPECT_TRUE((*registry)->plugInForPath(app + "/PlugIns/One.appex"));
+    EXPECT_EQ(d.send(request("remove", {{"paths", Value(Array{})}})), dict({}));  // no path: no test
+    auto key = codesign::generateKey();
+    codesign::writeKeyPair(d.root / "key", key);
+    codesign::trustKey(d.root / "key.pub");
+    std::string manager = d.root / "bin/axctl";
+    fs::create_directories(d.root / "bin");
+    fs::copy_file(axtest::binary("axctl"), manager);
+    ASSERT_FALSE(codesign::sign(manager, key, std::nullopt, dict({{"com.corvane.private.annexa.manager", true}})));
+    auto removed = d.axctl({"remove", app}, {}, manager);
+    EXPECT_EQ(removed.status, 0) << removed.err;
+    EXPECT_FALSE((*registry)->plugInForPath(app + "/PlugIns/One.appex"));
+    EXPECT_TRUE(d.axd->waitForErr("plug-in UNINSTALLED:com.example.One"));
+    EXPECT_TRUE(d.axd->waitForErr("requesting spawnd termination of plug-in: com.example.One(1)"));
+}
+
+TEST(Axd, SendRoundTripsTheTextNotation) {
+    Daemon d;
+    auto sent = d.axctl({"send"}, "{ \"request\" : \"bulk\", \"version\": 3u }");
+    EXPECT_EQ(sent.status, 0) << sent.err;
+    EXPECT_EQ(sent.out, "{}\n");
+    auto bad = d.axctl({"send"}, "{\"request\": \"x\", \"version\": 3u}");
+    EXPECT_EQ(bad.status, 0);  // a reply came, whatever it says
+    EXPECT_EQ(Value::parse(bad.out), error(4, "unrecognized request"));
+    EXPECT_EQ(d.axctl({"send"}, "not the notation").status, 65);
+    EXPECT_EQ(d.axctl({"-S", "com.nobody", "send"}, "{}").status, 69);
+    EXPECT_EQ(d.axctl({"--help"}).status, 0);
+}
+
+TEST(Axd, ClientsThatMisbehaveDisturbNobodyElse) {
+    Daemon d;
+    // Garbage frames, a request cut in half, a flood of requests nobody reads, a client that
+    // leaves mid-request.
+    auto raw = [&] {
+        int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        struct sockaddr_un addr {};
+        addr.sun_family = AF_UNIX;
+        std::string path = rpx::endpointPath("com.corvane.annexa.axd");
+        std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+        connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+        return fd;
+    };
+    int garbage = raw();
+    (void)!write(garbage, std::string(100, '\xee').data(), 100);
+    int flood = raw();
+    fcntl(flood, F_SETFL, O_NONBLOCK);
+    auto flooder = d.connect();
+    for (int i = 0; i < 2000; ++i) flooder->send(request("bulk"));
+    auto leaver = d.connect();
+    leaver->sendWithReply(request("bulk"), d.queue, [](const rpx::Reply&) {});
+    leaver->cancel();
+    close(garbage);
+    EXPECT_EQ(d.send(request("bulk")), dict({}));
+    EXPECT_TRUE(d.axd->waitForErr("is dead"));
+    close(flood);
+    // A non-dictionary message is logged, and answered when the sender waits for an answer.
+    auto c = d.connect();
+    c->send(Value(Array{Value(1)}));
+    EXPECT_TRUE(d.axd->waitForErr("unexpected message: [1] from: "));
+    EXPECT_EQ(d.send(Value("text")), error(4, "invalid request format"));
+    EXPECT_EQ(d.send(request("bulk")), dict({}));
+}
+
+TEST(Axd, TheThousandthRequestOfAClientIsLogged) {
+    Daemon d;
+    auto c = d.connect();
+    for (int i = 0; i < 999; ++i) c->send(request("bulk"));
+    ASSERT_TRUE(c->sendWithReplySync(request("bulk")).ok());  // the 1000th, and all before it are done
+    EXPECT_TRUE(d.axd->waitForErr("used 1000 requests so far"));
+    EXPECT_EQ(d.axd->err().find("used 999 requests"), std::string::npos);
+}
+
+TEST(Axd, CommandLineAndTermination) {
+    axtest::PlatformRoot root;
+    struct Case {
+        std::vector<std::string> args;
+        int status;
+    };
+    const Case cases[] = {{{"extra"}, 2}, {{"-x"}, 2}, {{"-c"}, 2}, {{"-S"}, 2}};
+    for (const auto& c : cases) {
+        std::vector<std::string> argv{axtest::binary("axd")};
+        argv.insert(argv.end(), c.args.begin(), c.args.end());
+        auto r = axtest::run(argv);
+        EXPECT_EQ(r.status, c.status) << c.args[0];
+        EXPECT_NE(r.err.find("Usage: axd [-S servicename] [-v]"), std::string::npos);
+    }
+    Daemon d({"-v", "-v", "-c", "abc"});
+    EXPECT_TRUE(d.axd->waitForErr("axd is launching"));
+    auto c = d.connect();
+    std::atomic<bool> invalid{false};
+    c->setEventHandler([&](const rpx::Event& e) {
+        if (e.error == rpx::ErrorKind::ConnectionInvalid) invalid = true;
+    });
+    ASSERT_TRUE(c->sendWithReplySync(request("bulk")).ok());
+    std::string err = d.axd->err();
+    size_t lines = 0;
+    for (size_t at = err.find("verbose option -v is ineffective"); at != std::string::npos;
+         at = err.find("verbose option -v is ineffective", at + 1))
+        ++lines;
+    EXPECT_EQ(lines, 2u);
+    d.axd->signal(SIGTERM);
+    EXPECT_EQ(d.axd->wait(5s), 0);
+    EXPECT_NE(d.axd->err().find("termination imminent"), std::string::npos);
+    for (int i = 0; i < 200 && !invalid; ++i) std::this_thread::sleep_for(10ms);
+    EXPECT_TRUE(invalid);
+    // A second daemon on a served endpoint cannot construct its server.
+    Daemon first;
+    auto second = axtest::run({axtest::binary("axd")}, {{"CORVANE_LOG_SINK", "stderr"}});
+    EXPECT_EQ(second.status, 1);
+    EXPECT_NE(second.err.find("unable to construct server"), std::string::npos);
+}
