@@ -125,8 +125,14 @@ std::map<std::pair<FileId, FileId>, Verification>& cache() {
     return *c;
 }
 
-Verification invalid(const std::string& path, std::string reason) {
-    log::notice(signLog(), "no entitlements for %{public}s: %{public}s", path, reason);
+// Unsigned code is common and says nothing is wrong, so it is logged at info level; a signature
+// that fails is worth the default level.
+Verification invalid(const std::string& path, std::string reason, bool unsignedCode = false) {
+    if (unsignedCode) {
+        log::info(signLog(), "no entitlements for %{public}s: %{public}s", path, reason);
+    } else {
+        log::notice(signLog(), "no entitlements for %{public}s: %{public}s", path, reason);
+    }
     Verification v;
     v.entitlements = Value(Dictionary{});
     v.reason = std::move(reason);
@@ -140,7 +146,7 @@ Verification verifyOpened(int exeFd, const std::string& path) {
     if (fstat(exeFd, &exeStat) != 0 || !S_ISREG(exeStat.st_mode)) return invalid(path, "not a file");
     std::string sigPath = signaturePath(path);
     int sigFd = ::open(sigPath.c_str(), O_RDONLY | O_CLOEXEC);
-    if (sigFd < 0) return invalid(path, "unsigned");
+    if (sigFd < 0) return invalid(path, "unsigned", true);
     struct stat sigStat {};
     fstat(sigFd, &sigStat);
     auto key = std::make_pair(idOf(exeStat), idOf(sigStat));
