@@ -1,7 +1,5 @@
 #include "Annexa/AXDaemonClient.h"
 
-#include <condition_variable>
-#include <mutex>
 #include <stdexcept>
 
 #include "Annexa/AXMessage.h"
@@ -115,17 +113,7 @@ void AXDaemonClient::copyReceipt(Completion reply) { send(Value(request("receipt
 
 Reply AXDaemonClient::wait(const std::function<void(Completion)>& operation) {
     replyQueue_->assertNotCurrent();
-    std::mutex m;
-    std::condition_variable cv;
-    std::optional<Reply> result;
-    operation([&](const Reply& r) {
-        std::lock_guard lock(m);
-        result = r;
-        cv.notify_one();
-    });
-    std::unique_lock lock(m);
-    cv.wait(lock, [&] { return result.has_value(); });
-    return *result;
+    return corvane::dispatch::waitForCallback<Reply>(operation);
 }
 
 std::optional<Error> AXDaemonClient::errorInReply(const Reply& reply) {

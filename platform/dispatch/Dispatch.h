@@ -12,6 +12,7 @@
 // Thread-safety: every member is safe to call from any thread.
 #pragma once
 
+#include <condition_variable>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -72,5 +73,26 @@ private:
 };
 
 using QueuePtr = std::shared_ptr<Queue>;
+
+// Starts an operation that reports once through a callback, and blocks the calling thread until it
+// has: `start` receives the callback and may call it from any thread. Returns what was reported.
+template <class T>
+T waitForCallback(const std::function<void(std::function<void(const T&)>)>& start) {
+    struct Slot {
+        std::mutex mutex;
+        std::condition_variable ready;
+        std::optional<T> value;
+    };
+    // Shared, so a callback that is still unlocking after the waiter returned touches live memory.
+    auto slot = std::make_shared<Slot>();
+    start([slot](const T& value) {
+        std::lock_guard lock(slot->mutex);
+        slot->value = value;
+        slot->ready.notify_one();
+    });
+    std::unique_lock lock(slot->mutex);
+    slot->ready.wait(lock, [&] { return slot->value.has_value(); });
+    return std::move(*slot->value);
+}
 
 }  // namespace corvane::dispatch

@@ -615,17 +615,8 @@ void Connection::sendWithReply(const Value& message, dispatch::QueuePtr queue,
 }
 
 Reply Connection::sendWithReplySync(const Value& message) {
-    std::mutex m;
-    std::condition_variable cv;
-    std::optional<Reply> result;
-    sendWithReply(message, nullptr, [&](const Reply& r) {
-        std::lock_guard lock(m);
-        result = r;
-        cv.notify_one();
-    });
-    std::unique_lock lock(m);
-    cv.wait(lock, [&] { return result.has_value(); });
-    return *result;
+    return dispatch::waitForCallback<Reply>(
+        [&](std::function<void(const Reply&)> done) { sendWithReply(message, nullptr, std::move(done)); });
 }
 
 void Connection::sendReply(uint64_t messageId, const Value& reply) {
