@@ -193,6 +193,31 @@ TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
     EXPECT_TRUE(d.axd->waitForErr("requesting spawnd termination of plug-in: com.example.One(1)"));
 }
 
+TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    auto one = (*registry)->plugInForPath(app + "/PlugIns/One.appex");
+    ASSERT_TRUE(one);
+    auto host = axtest::run({axtest::binary("annexa_c_client"), app, one->uuid().string()});
+    ASSERT_EQ(host.status, 0) << host.err;
+    EXPECT_EQ(host.out,
+              "send: 0 {}\n"
+              "send garbage: -1 -\n"
+              "add: 0 -\n"
+              "add relative: 9 absolute path required: relative/App.app\n"
+              "annotate: 0 -\n"
+              "annotate string election: 4 invalid request format (annotation election)\n"
+              "annotate bad uuid: -1 not a UUID: not-a-uuid\n"
+              "bulk-annotate: 0 -\n"
+              "remove: 11 caller lacks entitlement for this operation\n"
+              "unreachable: 4 Connection invalid\n");
+    std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";
+    EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"],
+              dict({{"election", 1}, {"extension", dict({{"from", "C"}})}}));
+}
+
 TEST(Axd, SendRoundTripsTheTextNotation) {
     Daemon d;
     auto sent = d.axctl({"send"}, "{ \"request\" : \"bulk\", \"version\": 3u }");

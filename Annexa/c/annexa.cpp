@@ -1,0 +1,123 @@
+// The C interface over AXDaemonClient: text in, text out, codes as return values. Nothing here
+// throws into C: a reply that breaks the protocol becomes code 4 with the library's text.
+#include "Annexa/c/annexa.h"
+
+#include <cstdlib>
+#include <cstring>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "Annexa/AXDaemonClient.h"
+
+struct annexa_client {
+    annexa::AXDaemonClient client;
+    explicit annexa_client(const char* name)
+        : client(name ? std::optional<std::string>(name) : std::nullopt) {}
+};
+
+namespace {
+
+using annexa::AXDaemonClient;
+using corvane::rpx::Reply;
+
+char* copyText(const std::string& text) {
+    char* out = static_cast<char*>(std::malloc(text.size() + 1));
+    if (out) std::memcpy(out, text.c_str(), text.size() + 1);
+    return out;
+}
+
+int64_t report(int64_t code, const std::string& text, char** errorText) {
+    if (errorText) *errorText = code == 0 ? nullptr : copyText(text);
+    return code;
+}
+
+int64_t finish(const Reply& reply, char** errorText) {
+    try {
+        if (auto error = AXDaemonClient::errorInReply(reply)) return report(error->code, error->description(), errorText);
+    } catch (const std::logic_error& e) {
+        return report(4, e.what(), errorText);
+    }
+    return report(0, {}, errorText);
+}
+
+bool readPaths(const char* const* paths, size_t count, std::vector<std::string>& out) {
+    if (!paths && count) return false;
+    for (size_t i = 0; i < count; ++i) {
+        if (!paths[i]) return false;
+        out.emplace_back(paths[i]);
+    }
+    return true;
+}
+
+}  // namespace
+
+extern "C" {
+
+annexa_client* annexa_client_create(const char* service_name) {
+    try {
+        return new annexa_client(service_name);
+    } catch (const std::exception&) {  // out of memory, or no thread for the reply queue
+        return nullptr;
+    }
+}
+
+void annexa_client_destroy(annexa_client* client) { delete client; }
+
+int64_t annexa_send(annexa_client* client, const char* message, char** reply) {
+    if (reply) *reply = nullptr;
+    if (!client || !message || !reply) return ANNEXA_EINVAL;
+    auto value = corvane::Value::parse(message);
+    if (!value) return ANNEXA_EINVAL;
+    AXDaemonClient& c = client->client;
+    Reply r = c.wait([&](AXDaemonClient::Completion done) { c.send(*value, std::move(done)); });
+    if (!r.ok()) return 4;
+    *reply = copyText(r.value.description());
+    return 0;
+}
+
+int64_t annexa_add(annexa_client* client, const char* const* paths, size_t count, char** error_text) {
+    std::vector<std::string> list;
+    if (!client || !readPaths(paths, count, list)) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    AXDaemonClient& c = client->client;
+    return finish(c.wait([&](AXDaemonClient::Completion done) { c.addPlugIns(list, std::move(done)); }), error_text);
+}
+
+int64_t annexa_remove(annexa_client* client, const char* const* paths, size_t count, char** error_text) {
+    std::vector<std::string> list;
+    if (!client || !readPaths(paths, count, list)) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    AXDaemonClient& c = client->client;
+    return finish(c.wait([&](AXDaemonClient::Completion done) { c.removePlugIns(list, std::move(done)); }),
+                  error_text);
+}
+
+int64_t annexa_annotate(annexa_client* client, const char* const* uuids, size_t count, const char* annotations,
+                        char** error_text) {
+    std::vector<std::string> texts;
+    if (!client || !annotations || !readPaths(uuids, count, texts))
+        return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    std::vector<corvane::UUID> list;
+    for (const auto& text : texts) {
+        auto uuid = corvane::UUID::parse(text);
+        if (!uuid) return report(ANNEXA_EINVAL, "not a UUID: " + text, error_text);
+        list.push_back(*uuid);
+    }
+    auto value = corvane::Value::parse(annotations);
+    if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
+    AXDaemonClient& c = client->client;
+    return finish(c.wait([&](AXDaemonClient::Completion done) { c.setPluginAnnotations(list, *value, std::move(done)); }),
+                  error_text);
+}
+
+int64_t annexa_bulk_annotate(annexa_client* client, const char* annotations, char** error_text) {
+    if (!client || !annotations) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    auto value = corvane::Value::parse(annotations);
+    if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
+    AXDaemonClient& c = client->client;
+    return finish(c.wait([&](AXDaemonClient::Completion done) { c.bulkSetPluginAnnotations(*value, std::move(done)); }),
+                  error_text);
+}
+
+void annexa_free(void* text) { std::free(text); }
+
+}  // extern "C"

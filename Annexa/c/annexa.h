@@ -1,0 +1,57 @@
+/* annexa.h: the C interface of the Annexa client library, for hosts written in languages other
+ * than C++. It talks to the per-user daemon axd like the C++ class AXDaemonClient.
+ *
+ *     cc host.c $(pkg-config --cflags --libs annexa)
+ *
+ * Values cross this interface in the text notation of messages (docs/rpx-wire.md), for example
+ * {"election": 1} or {"request": "bulk", "version": 3u}.
+ *
+ * Return codes: 0 for success; a positive code is the daemon's error code (4 also when the daemon
+ * cannot be reached); ANNEXA_EINVAL when the caller's arguments are unusable (a null pointer, text
+ * that is not one value in the notation, a UUID that does not parse). When `error_text` is not
+ * null it receives the error's text on failure (release it with annexa_free) and null on success.
+ *
+ * A client may be used from one thread at a time; separate clients are independent. */
+#ifndef ANNEXA_H
+#define ANNEXA_H
+
+#include <stddef.h>
+#include <stdint.h>
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+#define ANNEXA_EINVAL (-1)
+
+typedef struct annexa_client annexa_client;
+
+/* Connects to the daemon's endpoint; a null name means "com.corvane.annexa.axd". Returns null only
+ * when memory runs out: an unreachable daemon shows in the replies. */
+annexa_client* annexa_client_create(const char* service_name);
+void annexa_client_destroy(annexa_client* client);
+
+/* Sends one message written in the text notation and waits for the reply, which `reply` receives
+ * in the same notation (release it with annexa_free). Returns 0 whenever a reply came, whatever it
+ * says; 4 when the daemon cannot be reached. */
+int64_t annexa_send(annexa_client* client, const char* message, char** reply);
+
+/* Registers bundles (absolute paths): applications with their plug-ins, or plug-ins alone. */
+int64_t annexa_add(annexa_client* client, const char* const* paths, size_t count, char** error_text);
+/* Unregisters bundles; the daemon serves only callers signed with its manager entitlement. */
+int64_t annexa_remove(annexa_client* client, const char* const* paths, size_t count, char** error_text);
+/* Sets the same annotations ({"election": N} and/or {"extension": {...}}) on the plug-ins with
+ * these UUIDs (text form). */
+int64_t annexa_annotate(annexa_client* client, const char* const* uuids, size_t count, const char* annotations,
+                        char** error_text);
+/* Sets each plug-in's extension dictionary: a dictionary from UUID texts to dictionaries. */
+int64_t annexa_bulk_annotate(annexa_client* client, const char* annotations, char** error_text);
+
+/* Releases text returned by this interface. */
+void annexa_free(void* text);
+
+#ifdef __cplusplus
+}
+#endif
+
+#endif /* ANNEXA_H */

@@ -1,0 +1,56 @@
+/* A host written in C: drives the daemon through libannexa and prints what it gets, one line per
+ * call, for the integration test to compare.
+ *     annexa_c_client APP_PATH PLUGIN_UUID */
+#include <inttypes.h>
+#include <stdio.h>
+
+#include "Annexa/c/annexa.h"
+
+static void line(const char* what, int64_t code, char* text) {
+    printf("%s: %" PRId64 " %s\n", what, code, text ? text : "-");
+    annexa_free(text);
+}
+
+int main(int argc, char** argv) {
+    if (argc != 3) {
+        fprintf(stderr, "usage: annexa_c_client APP_PATH PLUGIN_UUID\n");
+        return 64;
+    }
+    annexa_client* client = annexa_client_create(NULL);
+    if (!client) return 70;
+    char* text = NULL;
+    int64_t code = annexa_send(client, "{\"request\": \"bulk\", \"version\": 3u}", &text);
+    line("send", code, text);
+    code = annexa_send(client, "{not the notation", &text);
+    line("send garbage", code, text);
+
+    const char* paths[] = {argv[1]};
+    code = annexa_add(client, paths, 1, &text);
+    line("add", code, text);
+    const char* relative[] = {"relative/App.app"};
+    code = annexa_add(client, relative, 1, &text);
+    line("add relative", code, text);
+
+    const char* uuids[] = {argv[2]};
+    code = annexa_annotate(client, uuids, 1, "{\"election\": 1}", &text);
+    line("annotate", code, text);
+    code = annexa_annotate(client, uuids, 1, "{\"election\": \"1\"}", &text);
+    line("annotate string election", code, text);
+    const char* bad[] = {"not-a-uuid"};
+    code = annexa_annotate(client, bad, 1, "{\"election\": 1}", &text);
+    line("annotate bad uuid", code, text);
+
+    char table[200];
+    snprintf(table, sizeof table, "{\"%s\": {\"from\": \"C\"}}", argv[2]);
+    code = annexa_bulk_annotate(client, table, &text);
+    line("bulk-annotate", code, text);
+    code = annexa_remove(client, paths, 1, &text);
+    line("remove", code, text);
+    annexa_client_destroy(client);
+
+    annexa_client* nobody = annexa_client_create("com.nobody.here");
+    code = annexa_add(nobody, paths, 1, &text);
+    line("unreachable", code, text);
+    annexa_client_destroy(nobody);
+    return 0;
+}
