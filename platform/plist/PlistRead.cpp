@@ -22,25 +22,8 @@ constexpr int kMaxDepth = 512;
 // Seconds between 1970-01-01 and 2001-01-01, the epoch of property-list dates.
 constexpr double kPlistEpoch = 978307200.0;
 
-bool appendUtf8(std::string& out, uint32_t cp) {
-    if (cp == 0 || cp > 0x10ffff || (cp >= 0xd800 && cp <= 0xdfff)) return false;
-    if (cp < 0x80) {
-        out.push_back(static_cast<char>(cp));
-    } else if (cp < 0x800) {
-        out.push_back(static_cast<char>(0xc0 | cp >> 6));
-        out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
-    } else if (cp < 0x10000) {
-        out.push_back(static_cast<char>(0xe0 | cp >> 12));
-        out.push_back(static_cast<char>(0x80 | (cp >> 6 & 0x3f)));
-        out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
-    } else {
-        out.push_back(static_cast<char>(0xf0 | cp >> 18));
-        out.push_back(static_cast<char>(0x80 | (cp >> 12 & 0x3f)));
-        out.push_back(static_cast<char>(0x80 | (cp >> 6 & 0x3f)));
-        out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
-    }
-    return true;
-}
+// Property lists carry no NUL characters (strings that hold one are refused).
+bool appendPlistCharacter(std::string& out, uint32_t cp) { return cp != 0 && appendUtf8(out, cp); }
 
 // Days since 1970-01-01 of a proleptic Gregorian date.
 int64_t daysFromCivil(int64_t y, unsigned m, unsigned d) {
@@ -189,7 +172,8 @@ private:
                     if (digits.empty()) return std::nullopt;
                     char* end = nullptr;
                     unsigned long cp = std::strtoul(digits.c_str(), &end, hex ? 16 : 10);
-                    if (*end || !appendUtf8(out, static_cast<uint32_t>(cp))) return std::nullopt;
+                    if (*end || cp > 0x10ffff || !appendPlistCharacter(out, static_cast<uint32_t>(cp)))
+                        return std::nullopt;
                 } else {
                     return std::nullopt;
                 }
@@ -488,7 +472,7 @@ private:
                         cp = 0x10000 + ((cp - 0xd800) << 10) + (lo - 0xdc00);
                         ++i;
                     }
-                    if (!appendUtf8(s, cp)) return std::nullopt;
+                    if (!appendPlistCharacter(s, cp)) return std::nullopt;
                 }
                 return Value(std::move(s));
             }

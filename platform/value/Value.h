@@ -246,4 +246,8 @@ private:
     std::variant<T, Error> v_;
 };
 
+// Appends the UTF-8 form of a Unicode scalar value; false (and nothing appended) for a surrogate or
+// a value past U+10FFFF. The readers of the text notation and of property lists share it.
+bool appendUtf8(std::string& out, uint32_t codePoint);
+
 }  // namespace corvane

@@ -313,24 +313,6 @@ private:
         }
     }
 
-    static void appendUtf8(std::string& out, uint32_t cp) {
-        if (cp < 0x80) {
-            out.push_back(static_cast<char>(cp));
-        } else if (cp < 0x800) {
-            out.push_back(static_cast<char>(0xc0 | cp >> 6));
-            out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
-        } else if (cp < 0x10000) {
-            out.push_back(static_cast<char>(0xe0 | cp >> 12));
-            out.push_back(static_cast<char>(0x80 | (cp >> 6 & 0x3f)));
-            out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
-        } else {
-            out.push_back(static_cast<char>(0xf0 | cp >> 18));
-            out.push_back(static_cast<char>(0x80 | (cp >> 12 & 0x3f)));
-            out.push_back(static_cast<char>(0x80 | (cp >> 6 & 0x3f)));
-            out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
-        }
-    }
-
     std::optional<uint32_t> hex4() {
         if (pos_ + 4 > s_.size()) return std::nullopt;
         uint32_t v = 0;
@@ -385,7 +367,7 @@ private:
                     } else if (*cp >= 0xdc00 && *cp <= 0xdfff) {
                         return std::nullopt;
                     }
-                    appendUtf8(out, *cp);
+                    if (!appendUtf8(out, *cp)) return std::nullopt;
                     break;
                 }
                 default: return std::nullopt;
@@ -520,5 +502,25 @@ std::string Value::description() const {
 }
 
 std::optional<Value> Value::parse(std::string_view text) { return Parser(text).parseAll(); }
+
+bool appendUtf8(std::string& out, uint32_t cp) {
+    if (cp > 0x10ffff || (cp >= 0xd800 && cp <= 0xdfff)) return false;
+    if (cp < 0x80) {
+        out.push_back(static_cast<char>(cp));
+    } else if (cp < 0x800) {
+        out.push_back(static_cast<char>(0xc0 | cp >> 6));
+        out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
+    } else if (cp < 0x10000) {
+        out.push_back(static_cast<char>(0xe0 | cp >> 12));
+        out.push_back(static_cast<char>(0x80 | (cp >> 6 & 0x3f)));
+        out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
+    } else {
+        out.push_back(static_cast<char>(0xf0 | cp >> 18));
+        out.push_back(static_cast<char>(0x80 | (cp >> 12 & 0x3f)));
+        out.push_back(static_cast<char>(0x80 | (cp >> 6 & 0x3f)));
+        out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
+    }
+    return true;
+}
 
 }  // namespace corvane
