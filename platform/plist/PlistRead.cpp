@@ -25,16 +25,6 @@ constexpr double kPlistEpoch = 978307200.0;
 // Property lists carry no NUL characters (strings that hold one are refused).
 bool appendPlistCharacter(std::string& out, uint32_t cp) { return cp != 0 && appendUtf8(out, cp); }
 
-// Days since 1970-01-01 of a proleptic Gregorian date.
-int64_t daysFromCivil(int64_t y, unsigned m, unsigned d) {
-    y -= m <= 2;
-    const int64_t era = (y >= 0 ? y : y - 399) / 400;
-    const auto yoe = static_cast<unsigned>(y - era * 400);
-    const unsigned doy = (153 * (m + (m > 2 ? -3 : 9)) + 2) / 5 + d - 1;
-    const unsigned doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
-    return era * 146097 + static_cast<int64_t>(doe) - 719468;
-}
-
 // ---- XML
 
 class XmlReader {

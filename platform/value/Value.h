@@ -250,4 +250,8 @@ private:
 // a value past U+10FFFF. The readers of the text notation and of property lists share it.
 bool appendUtf8(std::string& out, uint32_t codePoint);
 
+// Days since 1970-01-01 of a date of the proleptic Gregorian calendar (month 1 to 12), for the
+// readers of dates in text.
+int64_t daysFromCivil(int64_t year, unsigned month, unsigned day);
+
 }  // namespace corvane

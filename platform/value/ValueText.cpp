@@ -61,16 +61,8 @@ void appendDouble(std::string& out, double d) {
     if (!std::strpbrk(buf, ".eE")) out += ".0";
 }
 
-// Days since 1970-01-01 of a proleptic Gregorian date, and back (Howard Hinnant's algorithms).
-int64_t daysFromCivil(int64_t y, unsigned m, unsigned d) {
-    y -= m <= 2;
-    const int64_t era = (y >= 0 ? y : y - 399) / 400;
-    const auto yoe = static_cast<unsigned>(y - era * 400);
-    const unsigned doy = (153 * (m + (m > 2 ? -3 : 9)) + 2) / 5 + d - 1;
-    const unsigned doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
-    return era * 146097 + static_cast<int64_t>(doe) - 719468;
-}
-
+// The date of a day count since 1970-01-01, the inverse of daysFromCivil (Howard Hinnant's
+// algorithms).
 void civilFromDays(int64_t z, int64_t& y, unsigned& m, unsigned& d) {
     z += 719468;
     const int64_t era = (z >= 0 ? z : z - 146096) / 146097;
@@ -521,6 +513,15 @@ bool appendUtf8(std::string& out, uint32_t cp) {
         out.push_back(static_cast<char>(0x80 | (cp & 0x3f)));
     }
     return true;
+}
+
+int64_t daysFromCivil(int64_t y, unsigned m, unsigned d) {
+    y -= m <= 2;
+    const int64_t era = (y >= 0 ? y : y - 399) / 400;
+    const auto yoe = static_cast<unsigned>(y - era * 400);
+    const unsigned doy = (153 * (m + (m > 2 ? -3 : 9)) + 2) / 5 + d - 1;
+    const unsigned doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
+    return era * 146097 + static_cast<int64_t>(doe) - 719468;
 }
 
 }  // namespace corvane
