@@ -27,7 +27,10 @@ using namespace corvane;
 
 namespace {
 
+// The echo server's listener runs handlers inline (as axd's does); the second one delivers them on
+// a queue, for comparison.
 constexpr const char* kEndpoint = "com.corvane.bench.echo";
+constexpr const char* kQueuedEndpoint = "com.corvane.bench.echo.queued";
 
 Value requestBody() {
     return dict({{"request", "match"}, {"version", uint64_t{3}}, {"flags", uint64_t{0}},
@@ -35,10 +38,11 @@ Value requestBody() {
 }
 Value replyBody() { return dict({{"matches", Value(Array{})}}); }
 
-[[noreturn]] void serveRpx() {
+[[noreturn]] void serveRpx(const char* endpoint, bool inlineDelivery) {
     auto queue = dispatch::Queue::create("bench.listener");
-    auto listener = rpx::Listener::create(kEndpoint, queue);
+    auto listener = rpx::Listener::create(endpoint, queue);
     if (!listener) _exit(1);
+    (*listener)->setInlineDelivery(inlineDelivery);
     static const Value small = replyBody();
     static const Value big = dict({{"data", Value::data(std::string(256 * 1024, 'x').data(), 256 * 1024)}});
     (*listener)->setConnectionHandler([](rpx::ConnectionPtr c) {
@@ -104,9 +108,9 @@ int connectPlain(const std::string& path) {
     return -1;
 }
 
-std::shared_ptr<rpx::Connection> connectRpx(const dispatch::QueuePtr& queue) {
+std::shared_ptr<rpx::Connection> connectRpx(const dispatch::QueuePtr& queue, const char* endpoint = kEndpoint) {
     for (int i = 0; i < 500; ++i) {
-        auto c = rpx::Connection::connect(kEndpoint, queue);
+        auto c = rpx::Connection::connect(endpoint, queue);
         c->setEventHandler([](const rpx::Event&) {});
         c->resume();
         if (c->isValid() && c->sendWithReplySync(requestBody()).ok()) return c;
@@ -150,7 +154,10 @@ int runRpx(int argc, char** argv) {
 
     std::vector<pid_t> children;
     pid_t pid = fork();
-    if (pid == 0) serveRpx();
+    if (pid == 0) serveRpx(kEndpoint, true);
+    children.push_back(pid);
+    pid = fork();
+    if (pid == 0) serveRpx(kQueuedEndpoint, false);
     children.push_back(pid);
     pid = fork();
     if (pid == 0) servePlain(plainPath, request.size(), reply);
@@ -177,14 +184,24 @@ int runRpx(int argc, char** argv) {
         return 1;
     }
     Value body = requestBody();
-    for (int i = 0; i < 1000; ++i) c->sendWithReplySync(body);
-    std::vector<double> rpxSamples;
-    rpxSamples.reserve(static_cast<size_t>(requests));
-    for (int i = 0; i < requests; ++i) {
-        auto start = std::chrono::steady_clock::now();
-        c->sendWithReplySync(body);
-        rpxSamples.push_back(axbench::microsSince(start));
+    auto roundTrips = [&](rpx::Connection& connection) {
+        for (int i = 0; i < 1000; ++i) connection.sendWithReplySync(body);
+        std::vector<double> samples;
+        samples.reserve(static_cast<size_t>(requests));
+        for (int i = 0; i < requests; ++i) {
+            auto start = std::chrono::steady_clock::now();
+            connection.sendWithReplySync(body);
+            samples.push_back(axbench::microsSince(start));
+        }
+        return samples;
+    };
+    std::vector<double> rpxSamples = roundTrips(*c);
+    auto queued = connectRpx(queue, kQueuedEndpoint);
+    if (!queued) {
+        std::fprintf(stderr, "axbench rpx: no server\n");
+        return 1;
     }
+    std::vector<double> queuedSamples = roundTrips(*queued);
 
     // One client, the same bytes over a plain socket.
     int plain = connectPlain(plainPath);
@@ -232,6 +249,8 @@ int runRpx(int argc, char** argv) {
     double plainP99 = axbench::percentile(plainSamples, 99);
     double bigP50 = axbench::percentile(bigSamples, 50);
     std::printf("rpx round trip, 1 client, %d requests: p50 %.1f us, p99 %.1f us\n", requests, p50, p99);
+    std::printf("the same with the server's handlers on a delivery queue: p50 %.1f us, p99 %.1f us\n",
+                axbench::percentile(queuedSamples, 50), axbench::percentile(queuedSamples, 99));
     std::printf("plain socket ping-pong of the same %zu/%zu bytes: p50 %.1f us, p99 %.1f us\n",
                 request.size(), reply.size(), plainP50, plainP99);
     std::printf("256 KiB reply: p50 %.1f us\n", bigP50);

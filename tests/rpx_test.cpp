@@ -395,3 +395,72 @@ TEST(Rpx, ContextFinalizerRunsWhenTheConnectionGoes) {
     }
     EXPECT_EQ(finalized.load(), 1);
 }
+
+// Handlers that run without a delivery queue still see one connection's events one at a time and
+// in order, whichever thread makes them ready: here replies come from another queue, and a client
+// that floods the server makes reading pause and resume from that queue's replies.
+TEST(Rpx, InlineDeliveryKeepsEventsInOrderAndNeverOverlaps) {
+    axtest::PlatformRoot root;
+    auto listenerQueue = dispatch::Queue::create("test.listener");
+    auto replies = dispatch::Queue::create("test.replies");
+    auto listener = rpx::Listener::create("com.test.inline", listenerQueue);
+    ASSERT_TRUE(listener);
+    (*listener)->setInlineDelivery(true);
+    struct Seen {
+        std::atomic<int> inside{0};
+        std::atomic<bool> overlapped{false};
+        std::mutex m;
+        std::vector<int64_t> order;
+        Recorder ends;
+    };
+    auto seen = std::make_shared<Seen>();
+    (*listener)->setConnectionHandler([seen, replies](rpx::ConnectionPtr c) {
+        std::weak_ptr<rpx::Connection> weak = c;
+        c->setEventHandler([seen, replies, weak](const rpx::Event& ev) {
+            if (seen->inside.fetch_add(1) != 0) seen->overlapped = true;
+            if (ev.isError()) {
+                seen->ends.add(ev);
+            } else {
+                std::lock_guard lock(seen->m);
+                seen->order.push_back(*ev.message["n"].int64Value());
+            }
+            if (ev.wantsReply) {
+                replies->async([weak, ev] {
+                    if (auto conn = weak.lock()) conn->sendReply(ev.messageId, ev.message);
+                });
+            }
+            std::this_thread::yield();
+            seen->inside.fetch_sub(1);
+        });
+        c->resume();
+    });
+    (*listener)->resume();
+
+    auto q = dispatch::Queue::create("test.client");
+    auto c = rpx::Connection::connect("com.test.inline", q);
+    c->setEventHandler([](const rpx::Event&) {});
+    c->resume();
+    constexpr int kCount = 3000;
+    std::atomic<int> answered{0};
+    for (int i = 0; i < kCount; ++i) {
+        if (i % 2) {
+            c->send(dict({{"n", i}}));
+        } else {
+            c->sendWithReply(dict({{"n", i}}), q, [&](const rpx::Reply& r) {
+                if (r.ok()) ++answered;
+            });
+        }
+    }
+    auto last = c->sendWithReplySync(dict({{"n", kCount}}));
+    ASSERT_TRUE(last.ok());
+    EXPECT_EQ(last.value, dict({{"n", kCount}}));
+    for (int i = 0; i < 500 && answered < kCount / 2; ++i) std::this_thread::sleep_for(5ms);
+    EXPECT_EQ(answered.load(), kCount / 2);
+    c->cancel();
+    EXPECT_TRUE(seen->ends.waitFor([](const auto& events) { return !events.empty(); }));
+    EXPECT_FALSE(seen->overlapped.load());
+    std::lock_guard lock(seen->m);
+    ASSERT_EQ(seen->order.size(), static_cast<size_t>(kCount + 1));
+    for (int i = 0; i <= kCount; ++i) EXPECT_EQ(seen->order[static_cast<size_t>(i)], i);
+    EXPECT_EQ(seen->ends.count(rpx::ErrorKind::ConnectionInvalid), 1u);
+}

@@ -238,6 +238,11 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     bool readPaused = false;
     bool wantWrite = false;
     std::deque<Event> held;  // events before resume
+    // Inline delivery (Listener::setInlineDelivery): events wait in `ready` for a thread to run
+    // them; `running` says one does, so handlers never overlap. Set before start, then fixed.
+    bool inlineDelivery = false;
+    std::deque<Event> ready;
+    bool running = false;
     std::deque<Outgoing> out;
     size_t outBytes = 0;
     std::map<uint64_t, Pending> pending;
@@ -300,7 +305,30 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             return;
         }
         ++unfinished;
+        if (inlineDelivery) {
+            ready.push_back(std::move(ev));
+            return;
+        }
         delivery->async([impl = shared_from_this(), ev = std::move(ev)] { impl->runHandler(ev); });
+    }
+
+    // Inline delivery: runs the ready events on this thread unless another thread already does (it
+    // will see them). Called without the mutex, after every operation that may have made an event
+    // ready.
+    void runReady() {
+        if (!inlineDelivery) return;
+        auto keep = shared_from_this();  // the last event may release the connection's own hold
+        std::unique_lock lock(mutex);
+        if (running) return;
+        running = true;
+        while (!ready.empty()) {
+            Event ev = std::move(ready.front());
+            ready.pop_front();
+            lock.unlock();
+            runHandler(ev);
+            lock.lock();
+        }
+        running = false;
     }
 
     void runHandler(const Event& ev) {
@@ -487,6 +515,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             // Read what is left first (above), then end.
             if (fd >= 0 && !(events & EPOLLIN)) closeLocked();
         }
+        runReady();
     }
 
     void start() {
@@ -517,6 +546,7 @@ Connection::~Connection() {
         context = std::move(impl_->context);
         finalizer = std::move(impl_->finalizer);
     }
+    impl_->runReady();
     if (finalizer) finalizer(std::move(context));
 }
 
@@ -577,17 +607,23 @@ std::shared_ptr<void> Connection::context() const {
 }
 
 void Connection::resume() {
-    std::lock_guard lock(impl_->mutex);
-    if (impl_->resumed) return;
-    impl_->resumed = true;
-    auto held = std::move(impl_->held);
-    impl_->held.clear();
-    for (auto& ev : held) impl_->postEvent(std::move(ev));
+    {
+        std::lock_guard lock(impl_->mutex);
+        if (impl_->resumed) return;
+        impl_->resumed = true;
+        auto held = std::move(impl_->held);
+        impl_->held.clear();
+        for (auto& ev : held) impl_->postEvent(std::move(ev));
+    }
+    impl_->runReady();
 }
 
 void Connection::cancel() {
-    std::lock_guard lock(impl_->mutex);
-    impl_->closeLocked();
+    {
+        std::lock_guard lock(impl_->mutex);
+        impl_->closeLocked();
+    }
+    impl_->runReady();
 }
 
 bool Connection::isValid() const {
@@ -596,22 +632,28 @@ bool Connection::isValid() const {
 }
 
 void Connection::send(const Value& message) {
-    std::lock_guard lock(impl_->mutex);
-    if (impl_->invalid) return;
-    impl_->sendFrame(wire::FrameKind::Message, impl_->nextId++, message);
+    {
+        std::lock_guard lock(impl_->mutex);
+        if (impl_->invalid) return;
+        impl_->sendFrame(wire::FrameKind::Message, impl_->nextId++, message);
+    }
+    impl_->runReady();
 }
 
 void Connection::sendWithReply(const Value& message, dispatch::QueuePtr queue,
                                std::function<void(const Reply&)> completion) {
-    std::lock_guard lock(impl_->mutex);
-    uint64_t id = impl_->nextId++;
-    Impl::Pending pending{std::move(queue), std::move(completion)};
-    // The frame may also fail the connection while being written; then no reply will come.
-    if (impl_->invalid || !impl_->sendFrame(wire::FrameKind::Request, id, message) || impl_->invalid) {
-        pending.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
-        return;
+    {
+        std::lock_guard lock(impl_->mutex);
+        uint64_t id = impl_->nextId++;
+        Impl::Pending pending{std::move(queue), std::move(completion)};
+        // The frame may also fail the connection while being written; then no reply will come.
+        if (impl_->invalid || !impl_->sendFrame(wire::FrameKind::Request, id, message) || impl_->invalid) {
+            pending.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
+        } else {
+            impl_->pending.emplace(id, std::move(pending));
+        }
     }
-    impl_->pending.emplace(id, std::move(pending));
+    impl_->runReady();
 }
 
 Reply Connection::sendWithReplySync(const Value& message) {
@@ -620,10 +662,14 @@ Reply Connection::sendWithReplySync(const Value& message) {
 }
 
 void Connection::sendReply(uint64_t messageId, const Value& reply) {
-    std::lock_guard lock(impl_->mutex);
-    if (impl_->unanswered.erase(messageId) && impl_->unfinished) --impl_->unfinished;
-    if (impl_->invalid) return;
-    impl_->sendFrame(wire::FrameKind::Reply, messageId, reply);
+    {
+        std::lock_guard lock(impl_->mutex);
+        if (impl_->unanswered.erase(messageId) && impl_->unfinished) --impl_->unfinished;
+        if (impl_->invalid) return;
+        // Writing may fail the connection, and an answered request may resume reading.
+        impl_->sendFrame(wire::FrameKind::Reply, messageId, reply);
+    }
+    impl_->runReady();
 }
 
 void Connection::setMaxFrameSize(size_t bytes) {
@@ -645,6 +691,7 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     dispatch::QueuePtr delivery;
     std::function<void(ConnectionPtr)> handler;
     size_t maxFrame = kDefaultListenerMaxFrame;
+    bool inlineDelivery = false;
     bool resumed = false;
 
     void onAcceptable() {
@@ -662,6 +709,10 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
             PeerIdentity peer = identityOfSocket(client);
             auto impl = std::make_shared<Connection::Impl>(client, delivery, maxFrame);
             impl->peerPid = peer.pid;
+            {
+                std::lock_guard lock(mutex);
+                impl->inlineDelivery = inlineDelivery;
+            }
             auto connection = std::shared_ptr<Connection>(new Connection(impl, std::move(peer)));
             impl->self = connection;
             impl->start();
@@ -728,6 +779,11 @@ void Listener::setMaxFrameSize(size_t bytes) {
     impl_->maxFrame = bytes;
 }
 
+void Listener::setInlineDelivery(bool enabled) {
+    std::lock_guard lock(impl_->mutex);
+    impl_->inlineDelivery = enabled;
+}
+
 void Listener::resume() {
     std::lock_guard lock(impl_->mutex);
     if (impl_->resumed || impl_->fd < 0) return;
@@ -769,11 +825,18 @@ void handleTermination() {
         // Deliver the event, wait (boundedly) until every handler has seen it, then end.
         auto remaining = std::make_shared<std::atomic<size_t>>(connections.size());
         for (auto& impl : connections) {
-            std::lock_guard lock(impl->mutex);
-            Event ev;
-            ev.error = ErrorKind::TerminationImminent;
-            impl->postEvent(std::move(ev));
-            impl->delivery->async([remaining] { --*remaining; });
+            {
+                std::lock_guard lock(impl->mutex);
+                Event ev;
+                ev.error = ErrorKind::TerminationImminent;
+                impl->postEvent(std::move(ev));
+            }
+            if (impl->inlineDelivery) {
+                impl->runReady();
+                --*remaining;
+            } else {
+                impl->delivery->async([remaining] { --*remaining; });
+            }
         }
         std::thread([remaining] {
             for (int i = 0; i < 200 && *remaining > 0; ++i)

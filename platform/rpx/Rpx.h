@@ -168,6 +168,12 @@ public:
 
     void setConnectionHandler(std::function<void(ConnectionPtr)> handler);
     void setMaxFrameSize(size_t bytes);
+    // Runs the event handlers of connections accepted from now on without a delivery queue: on the
+    // thread that made the event ready (the I/O thread for received messages, or a thread that
+    // replied, resumed or cancelled), still one at a time and in order for each connection. This
+    // saves a thread hand-over per message, so it suits handlers that only look at a message and
+    // pass work on; a handler that blocks would hold up the I/O of every connection.
+    void setInlineDelivery(bool enabled);
     void resume();
     void cancel();
     const std::string& path() const;
