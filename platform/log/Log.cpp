@@ -93,8 +93,8 @@ void writeStderr(const Handle& h, Level level, const std::string& text) {
     std::strftime(stamp, sizeof stamp, "%Y-%m-%d %H:%M:%S", &tm);
     std::string line = std::string(stamp) + "." + std::to_string(ts.tv_nsec / 1000000 + 1000).substr(1) +
                        " " + program_invocation_short_name + "[" + std::to_string(getpid()) + "] <" +
-                       levelName(level) + "> " + h.subsystem() + ":" + h.category() + ": " + text +
-                       "\n";
+                       levelName(level) + "> " + (h.subsystem().empty() ? "" : h.subsystem() + ":") +
+                       h.category() + ": " + text + "\n";
     // One write per line, so that lines of several threads do not interleave.
     (void)!::write(STDERR_FILENO, line.data(), line.size());
 }
