@@ -464,3 +464,77 @@ TEST(Rpx, InlineDeliveryKeepsEventsInOrderAndNeverOverlaps) {
     for (int i = 0; i <= kCount; ++i) EXPECT_EQ(seen->order[static_cast<size_t>(i)], i);
     EXPECT_EQ(seen->ends.count(rpx::ErrorKind::ConnectionInvalid), 1u);
 }
+
+// A synchronous wait reads its reply on the waiting thread. Whoever reads, every waiter gets its
+// own reply: several threads waiting at once on one connection, a reply followed at once by the
+// peer's exit, and a cancel while nothing will ever answer.
+TEST(Rpx, SynchronousWaitsGetTheirOwnRepliesWhoeverReads) {
+    axtest::PlatformRoot root;
+    EchoServer server("com.test.sync");
+    auto q = dispatch::Queue::create("test.client");
+    auto c = rpx::Connection::connect("com.test.sync", q);
+    c->setEventHandler([](const rpx::Event&) {});
+    c->resume();
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t) {
+        threads.emplace_back([&, t] {
+            for (int i = 0; i < 300; ++i) {
+                Value body = dict({{"t", t}, {"i", i}});
+                auto r = c->sendWithReplySync(body);
+                if (!r.ok() || r.value["echo"] != body) ++wrong;
+            }
+        });
+    }
+    for (auto& th : threads) th.join();
+    EXPECT_EQ(wrong.load(), 0);
+
+    // A peer that answers and hangs up at once: the reply is still read.
+    std::string reply = frameBytes(wire::FrameKind::Reply, 1, dict({{"last", true}}));
+    for (int round = 0; round < 20; ++round) {
+        std::string name = "com.test.hangup" + std::to_string(round);
+        std::string path = rpx::endpointPath(name);
+        int listenFd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        struct sockaddr_un addr {};
+        addr.sun_family = AF_UNIX;
+        std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+        ASSERT_EQ(bind(listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+        ASSERT_EQ(listen(listenFd, 1), 0);
+        std::thread peer([&] {
+            int s = accept(listenFd, nullptr, nullptr);
+            char buf[256];
+            (void)!read(s, buf, sizeof buf);  // the request, in one piece
+            (void)!write(s, reply.data(), reply.size());
+            close(s);
+        });
+        auto once = rpx::Connection::connect(name, q);
+        once->setEventHandler([](const rpx::Event&) {});
+        once->resume();
+        auto r = once->sendWithReplySync(dict({{"x", 1}}));
+        EXPECT_TRUE(r.ok()) << "round " << round << ": " << r.description();
+        peer.join();
+        close(listenFd);
+    }
+
+    // Nobody answers; a cancel from another thread ends the wait.
+    int silent = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    std::string path = rpx::endpointPath("com.test.silent");
+    struct sockaddr_un addr {};
+    addr.sun_family = AF_UNIX;
+    std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+    ASSERT_EQ(bind(silent, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    ASSERT_EQ(listen(silent, 1), 0);
+    auto waiting = rpx::Connection::connect("com.test.silent", q);
+    waiting->setEventHandler([](const rpx::Event&) {});
+    waiting->resume();
+    std::thread canceller([&] {
+        std::this_thread::sleep_for(50ms);
+        waiting->cancel();
+    });
+    auto start = std::chrono::steady_clock::now();
+    auto r = waiting->sendWithReplySync(dict({{"x", 1}}));
+    EXPECT_EQ(r.error, rpx::ErrorKind::ConnectionInvalid);
+    EXPECT_LT(std::chrono::steady_clock::now() - start, 2s);
+    canceller.join();
+    close(silent);
+}

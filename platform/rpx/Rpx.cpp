@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <poll.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <sys/signalfd.h>
@@ -225,6 +226,11 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
 
     Impl(int socket, dispatch::QueuePtr deliveryQueue, size_t maxFrame)
         : fd(socket), delivery(std::move(deliveryQueue)), reader(maxFrame, kMaxDepth) {}
+    ~Impl() {
+        if (pollFd >= 0) ::close(pollFd);
+    }
+    Impl(const Impl&) = delete;
+    Impl& operator=(const Impl&) = delete;
 
     std::mutex mutex;
     int fd;
@@ -243,6 +249,12 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     bool inlineDelivery = false;
     std::deque<Event> ready;
     bool running = false;
+    // A synchronous sender reads the socket itself while it waits, instead of being woken by the
+    // I/O thread, which leaves the socket alone meanwhile. One such reader at a time; it polls a
+    // duplicate of the socket, which stays open (and reports the hang-up) when the connection
+    // closes under it.
+    bool syncReader = false;
+    int pollFd = -1;
     std::deque<Outgoing> out;
     size_t outBytes = 0;
     std::map<uint64_t, Pending> pending;
@@ -256,7 +268,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     // While paused, neither input nor a half-close is asked for: epoll is level-triggered and
     // would report them again and again. A peer that is gone entirely still shows as EPOLLHUP.
     uint32_t interest() const {
-        return (readPaused ? 0u : static_cast<uint32_t>(EPOLLIN | EPOLLRDHUP)) |
+        return (readPaused || syncReader ? 0u : static_cast<uint32_t>(EPOLLIN | EPOLLRDHUP)) |
                (wantWrite ? static_cast<uint32_t>(EPOLLOUT) : 0u);
     }
 
@@ -429,6 +441,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         invalid = true;
         if (fd >= 0) {
             IoLoop::shared().remove(fd);
+            ::shutdown(fd, SHUT_RDWR);  // wakes a synchronous reader polling its duplicate
             ::close(fd);
             fd = -1;
         }
@@ -445,44 +458,91 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         postEvent(std::move(ev));
     }
 
-    void onReadable() {
+    enum class ReadStatus { More, Drained, Closed };
+
+    // One read from the socket and the frames it completes. Called with the mutex held.
+    ReadStatus readOnce() {
         char buf[65536];
-        for (;;) {
-            struct iovec iov {buf, sizeof buf};
-            alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * 64)];
-            struct msghdr msg {};
-            msg.msg_iov = &iov;
-            msg.msg_iovlen = 1;
-            msg.msg_control = control;
-            msg.msg_controllen = sizeof control;
-            std::unique_lock lock(mutex);
-            if (fd < 0 || readPaused) return;
-            ssize_t n = recvmsg(fd, &msg, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-            if (n < 0) {
-                if (errno == EINTR) continue;
-                if (errno == EAGAIN || errno == EWOULDBLOCK) return;
-                closeLocked();
-                return;
-            }
-            for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
-                if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-                size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-                auto* slots = reinterpret_cast<int*>(CMSG_DATA(c));
-                for (size_t i = 0; i < count; ++i)
-                    reader.appendFd(std::make_shared<FileDescriptor>(slots[i]));
-            }
-            if (msg.msg_flags & MSG_CTRUNC) {
-                log::error(rpxLog(), "rpx: closing connection to pid %d: too many descriptors", peerPid);
-                closeLocked();
-                return;
-            }
-            if (n == 0) {
-                closeLocked();
-                return;
-            }
-            reader.append(buf, static_cast<size_t>(n));
-            drainFrames();
+        struct iovec iov {buf, sizeof buf};
+        alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * 64)];
+        struct msghdr msg {};
+        msg.msg_iov = &iov;
+        msg.msg_iovlen = 1;
+        msg.msg_control = control;
+        msg.msg_controllen = sizeof control;
+        ssize_t n = recvmsg(fd, &msg, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+        if (n < 0) {
+            if (errno == EINTR) return ReadStatus::More;
+            if (errno == EAGAIN || errno == EWOULDBLOCK) return ReadStatus::Drained;
+            closeLocked();
+            return ReadStatus::Closed;
         }
+        for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
+            if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
+            size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+            auto* slots = reinterpret_cast<int*>(CMSG_DATA(c));
+            for (size_t i = 0; i < count; ++i) reader.appendFd(std::make_shared<FileDescriptor>(slots[i]));
+        }
+        if (msg.msg_flags & MSG_CTRUNC) {
+            log::error(rpxLog(), "rpx: closing connection to pid %d: too many descriptors", peerPid);
+            closeLocked();
+            return ReadStatus::Closed;
+        }
+        if (n == 0) {
+            closeLocked();
+            return ReadStatus::Closed;
+        }
+        reader.append(buf, static_cast<size_t>(n));
+        drainFrames();
+        return ReadStatus::More;
+    }
+
+    void onReadable() {
+        for (;;) {
+            std::unique_lock lock(mutex);
+            if (fd < 0 || readPaused || syncReader) return;
+            if (readOnce() != ReadStatus::More) return;
+        }
+    }
+
+    // Becomes the synchronous reader, if the connection allows one now. Called with the mutex held.
+    bool claimSyncReader() {
+        if (syncReader || fd < 0 || invalid || readPaused) return false;
+        if (pollFd < 0) pollFd = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+        if (pollFd < 0) return false;
+        syncReader = true;
+        updateInterest();
+        return true;
+    }
+
+    // The synchronous reader's loop: reads until `done` says the awaited reply came, the
+    // connection ends, or reading must pause (then the I/O thread takes over again).
+    void readAsSyncReader(const std::function<bool()>& done) {
+        for (;;) {
+            if (done()) break;
+            struct pollfd p {pollFd, POLLIN, 0};
+            if (::poll(&p, 1, -1) < 0 && errno != EINTR) break;
+            bool stop;
+            {
+                std::lock_guard lock(mutex);
+                stop = fd < 0 || readPaused;
+                // Until the socket is empty, or the awaited reply has come (what follows it is
+                // the I/O thread's again).
+                while (!stop && !done()) {
+                    ReadStatus status = readOnce();
+                    if (status != ReadStatus::More) {
+                        stop = status == ReadStatus::Closed;
+                        break;
+                    }
+                    stop = fd < 0 || readPaused;
+                }
+            }
+            runReady();
+            if (stop) break;
+        }
+        std::lock_guard lock(mutex);
+        syncReader = false;
+        updateInterest();
     }
 
     void handleFrame(wire::Frame frame) {
@@ -512,8 +572,9 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         if (events & (EPOLLHUP | EPOLLERR)) {
             std::lock_guard lock(mutex);
-            // Read what is left first (above), then end.
-            if (fd >= 0 && !(events & EPOLLIN)) closeLocked();
+            // Read what is left first (above), then end. A synchronous reader reads what is left
+            // itself and ends the connection when it reaches the end.
+            if (fd >= 0 && !(events & EPOLLIN) && !syncReader) closeLocked();
         }
         runReady();
     }
@@ -657,8 +718,30 @@ void Connection::sendWithReply(const Value& message, dispatch::QueuePtr queue,
 }
 
 Reply Connection::sendWithReplySync(const Value& message) {
-    return dispatch::waitForCallback<Reply>(
-        [&](std::function<void(const Reply&)> done) { sendWithReply(message, nullptr, std::move(done)); });
+    return dispatch::waitForCallback<Reply>([&](std::function<void(const Reply&)> report) {
+        // The reply is read on this thread when it can be: no other thread need wake up for it.
+        auto came = std::make_shared<std::atomic<bool>>(false);
+        auto done = [came, report = std::move(report)](const Reply& r) {
+            came->store(true);
+            report(r);
+        };
+        bool reading;
+        {
+            std::lock_guard lock(impl_->mutex);
+            uint64_t id = impl_->nextId++;
+            Impl::Pending pending{nullptr, std::move(done)};
+            // The frame may also fail the connection while being written; then no reply will come.
+            if (impl_->invalid || !impl_->sendFrame(wire::FrameKind::Request, id, message) || impl_->invalid) {
+                pending.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
+                reading = false;
+            } else {
+                impl_->pending.emplace(id, std::move(pending));
+                reading = impl_->claimSyncReader();
+            }
+        }
+        impl_->runReady();
+        if (reading) impl_->readAsSyncReader([&] { return came->load(); });
+    });
 }
 
 void Connection::sendReply(uint64_t messageId, const Value& reply) {
