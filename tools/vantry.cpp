@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include <cinttypes>
+#include <cmath>
 #include <cstdio>
 #include <cstring>
 #include <string>
@@ -24,23 +25,6 @@ const char* kUsage =
     "       vantry rebuild                            move a damaged database aside and register again\n"
     "The registry lives under the platform root (CORVANE_ROOT).\n";
 
-void jsonString(std::string& out, const std::string& s) {
-    out.push_back('"');
-    for (unsigned char c : s) {
-        if (c == '"' || c == '\\') {
-            out.push_back('\\');
-            out.push_back(static_cast<char>(c));
-        } else if (c < 0x20) {
-            char buf[8];
-            std::snprintf(buf, sizeof buf, "\\u%04x", c);
-            out += buf;
-        } else {
-            out.push_back(static_cast<char>(c));
-        }
-    }
-    out.push_back('"');
-}
-
 // JSON for tools that read it: dates as RFC 3339 text, data and UUIDs as strings.
 void json(std::string& out, const Value& v) {
     using K = Value::Kind;
@@ -49,14 +33,21 @@ void json(std::string& out, const Value& v) {
         case K::Bool: out += *v.boolValue() ? "true" : "false"; break;
         case K::Int64: out += std::to_string(*v.int64Value()); break;
         case K::UInt64: out += std::to_string(*v.uint64Value()); break;
-        case K::Double: out += std::to_string(*v.doubleValue()); break;
-        case K::String: jsonString(out, *v.asString()); break;
-        case K::UUID: jsonString(out, v.asUUID()->string()); break;
+        case K::Double: {
+            // JSON has no infinities or not-a-number; those print as null.
+            double d = *v.doubleValue();
+            char buf[32];
+            std::snprintf(buf, sizeof buf, "%.17g", d);
+            out += std::isfinite(d) ? buf : "null";
+            break;
+        }
+        case K::String: appendJsonString(out, *v.asString()); break;
+        case K::UUID: appendJsonString(out, v.asUUID()->string()); break;
         case K::Date:
         case K::Data:
         case K::Fd: {
             std::string d = v.description();
-            jsonString(out, d[0] == '@' ? d.substr(1) : d);
+            appendJsonString(out, d[0] == '@' ? d.substr(1) : d);
             break;
         }
         case K::Array: {
@@ -76,7 +67,7 @@ void json(std::string& out, const Value& v) {
             for (const auto& [k, e] : *v.asDictionary()) {
                 if (!first) out.push_back(',');
                 first = false;
-                jsonString(out, k);
+                appendJsonString(out, k);
                 out.push_back(':');
                 json(out, e);
             }

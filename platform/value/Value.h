@@ -254,4 +254,8 @@ bool appendUtf8(std::string& out, uint32_t codePoint);
 // readers of dates in text.
 int64_t daysFromCivil(int64_t year, unsigned month, unsigned day);
 
+// Appends `s` as a JSON string, quotes included, control characters escaped; the text notation
+// writes its strings so, and tools that print JSON use it too.
+void appendJsonString(std::string& out, std::string_view s);
+
 }  // namespace corvane

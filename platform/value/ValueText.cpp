@@ -15,8 +15,6 @@
 
 namespace corvane {
 
-namespace {
-
 void appendJsonString(std::string& out, std::string_view s) {
     out.push_back('"');
     for (unsigned char c : s) {
@@ -40,6 +38,8 @@ void appendJsonString(std::string& out, std::string_view s) {
     }
     out.push_back('"');
 }
+
+namespace {
 
 // Shortest text that reads back as the same double, always with a '.', an exponent or a word, so
 // that it cannot be mistaken for an integer.
