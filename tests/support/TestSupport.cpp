@@ -79,14 +79,18 @@ bool exists(const std::string& path) {
     return lstat(path.c_str(), &st) == 0;
 }
 
-Process::Process(std::vector<std::string> argv, std::map<std::string, std::string> env) {
+namespace {
+
+// Starts argv[0] with the environment changed by `env`, standard input from `inPath` and standard
+// output and error into `outPath` and `errPath`; 0 or the error number of posix_spawn.
+int spawn(std::vector<std::string> argv, const std::map<std::string, std::string>& env,
+          const std::string& inPath, const std::string& outPath, const std::string& errPath, pid_t* pid) {
     std::vector<std::string> envStrings;
     for (char** e = environ; *e; ++e) {
         std::string entry = *e;
-        std::string key = entry.substr(0, entry.find('='));
-        if (!env.count(key)) envStrings.push_back(entry);
+        if (!env.count(entry.substr(0, entry.find('=')))) envStrings.push_back(entry);
     }
-    for (auto& [k, v] : env) envStrings.push_back(k + "=" + v);
+    for (const auto& [k, v] : env) envStrings.push_back(k + "=" + v);
     std::vector<char*> args;
     for (auto& a : argv) args.push_back(a.data());
     args.push_back(nullptr);
@@ -96,13 +100,18 @@ Process::Process(std::vector<std::string> argv, std::map<std::string, std::strin
 
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
-    std::string outPath = files_ / "out";
-    std::string errPath = files_ / "err";
+    posix_spawn_file_actions_addopen(&actions, 0, inPath.c_str(), O_RDONLY, 0);
     posix_spawn_file_actions_addopen(&actions, 1, outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
     posix_spawn_file_actions_addopen(&actions, 2, errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    int rc = posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), envp.data());
+    int rc = posix_spawn(pid, args[0], &actions, nullptr, args.data(), envp.data());
     posix_spawn_file_actions_destroy(&actions);
+    return rc;
+}
+
+}  // namespace
+
+Process::Process(std::vector<std::string> argv, std::map<std::string, std::string> env) {
+    int rc = spawn(argv, env, "/dev/null", files_ / "out", files_ / "err", &pid_);
     if (rc != 0) throw std::runtime_error("cannot start " + argv[0] + ": " + std::strerror(rc));
 }
 
@@ -159,29 +168,11 @@ RunResult run(std::vector<std::string> argv, std::map<std::string, std::string> 
               const std::string& input) {
     TempDir dir;
     std::string inPath = dir / "in";
-    writeFile(inPath, input);
-    std::vector<std::string> envStrings;
-    for (char** e = environ; *e; ++e) {
-        std::string entry = *e;
-        if (!env.count(entry.substr(0, entry.find('=')))) envStrings.push_back(entry);
-    }
-    for (auto& [k, v] : env) envStrings.push_back(k + "=" + v);
-    std::vector<char*> args;
-    for (auto& a : argv) args.push_back(a.data());
-    args.push_back(nullptr);
-    std::vector<char*> envp;
-    for (auto& e : envStrings) envp.push_back(e.data());
-    envp.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 0, inPath.c_str(), O_RDONLY, 0);
     std::string outPath = dir / "out";
     std::string errPath = dir / "err";
-    posix_spawn_file_actions_addopen(&actions, 1, outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    posix_spawn_file_actions_addopen(&actions, 2, errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    writeFile(inPath, input);
     pid_t pid = -1;
-    int rc = posix_spawn(&pid, args[0], &actions, nullptr, args.data(), envp.data());
-    posix_spawn_file_actions_destroy(&actions);
+    int rc = spawn(std::move(argv), env, inPath, outPath, errPath, &pid);
     if (rc != 0) return {127, "", std::string("cannot start: ") + std::strerror(rc)};
     int status = 0;
     waitpid(pid, &status, 0);
