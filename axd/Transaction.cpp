@@ -186,13 +186,18 @@ void Transaction::bulkPlugIns() {
 
 // ---- annotations
 
-void Transaction::annotatePlugIns() {
+Value Transaction::annotationsArgument() {
     const Value* annotations = rpx_dictionary_get_dictionary(request(), "annotations");
     if (!annotations) {
         failMessage(4, "invalid request format (bad annotations dictionary)");
-        return;
+        return Value();
     }
-    Value d = convertMessageToValue(*annotations);
+    return convertMessageToValue(*annotations);
+}
+
+void Transaction::annotatePlugIns() {
+    Value d = annotationsArgument();
+    if (d.isNull()) return;
     Dictionary changes;
     if (const Value* election = d.find(keys::kElection)) {
         if (!election->isNumber()) {
@@ -229,12 +234,8 @@ void Transaction::annotatePlugIns() {
 }
 
 void Transaction::bulkAnnotatePlugIns() {
-    const Value* annotations = rpx_dictionary_get_dictionary(request(), "annotations");
-    if (!annotations) {
-        failMessage(4, "invalid request format (bad annotations dictionary)");
-        return;
-    }
-    Value d = convertMessageToValue(*annotations);
+    Value d = annotationsArgument();
+    if (d.isNull()) return;
     const Dictionary* entries = d.asDictionary();
     size_t count = entries ? entries->size() : 0;
     log::debug(logOps(), "bulk change requested for %u plug-ins", static_cast<unsigned>(count));

@@ -54,6 +54,9 @@ public:
     corvane::rpx::ConnectionPtr connection() const;
 
 private:
+    // The request's "annotations" dictionary as a Value; null after answering that it is missing.
+    Value annotationsArgument();
+
     std::shared_ptr<AXDRpxClient> client_;
     corvane::rpx::Event request_;
     Dictionary reply_;
