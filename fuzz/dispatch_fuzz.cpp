@@ -55,9 +55,9 @@ struct World {
     }
     void registerSample() {
         app = root + "/Fuzz.app";
-        makeBundle(app, "com.example.fuzz", "APPL", corvane::Value());
+        makeBundle(app, "com.example.fuzz", "APP!", corvane::Value());
         for (const char* name : {"One", "Two", "Three"}) {
-            makeBundle(app + "/PlugIns/" + name + ".appex", std::string("com.example.fuzz.") + name, "XPC!",
+            makeBundle(app + "/PlugIns/" + name + ".appex", std::string("com.example.fuzz.") + name, "RPX!",
                        corvane::dict({{"KSExtensionPointIdentifier", "com.example.point"},
                                       {"KSExtensionAttributes", corvane::dict({{"KSExtensionVersion", "1"}})}}));
         }

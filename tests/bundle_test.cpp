@@ -45,8 +45,8 @@ TEST(Bundle, OpensByPathAndByExecutable) {
     EXPECT_EQ(b->property(4), std::nullopt);
     EXPECT_EQ(b->infoDictionary()["KFBundleIdentifier"], Value("com.example.app"));
     EXPECT_FALSE(b->receiptPath());
-    axtest::writeFile(app + "/_Receipt/receipt", "receipt bytes");
-    EXPECT_EQ(b->receiptPath(), app + "/_Receipt/receipt");
+    axtest::writeFile(app + "/Receipt", "receipt bytes");
+    EXPECT_EQ(b->receiptPath(), app + "/Receipt");
     EXPECT_FALSE(bundle::Bundle::openPath(dir / "nothing"));
     EXPECT_FALSE(bundle::Bundle::openPath(app + "/app"));  // a file is no bundle
 }

@@ -131,7 +131,7 @@ TEST(CodeSign, BundlesKeepTheirSignatureInside) {
     std::string app = axtest::makeBundle(root.path(), "Example.app", axtest::appInfo("com.example.app"),
                                          axtest::binary("rpx_peer"));
     ASSERT_FALSE(codesign::sign(app, keys.trusted, std::nullopt, kEntitlements));
-    EXPECT_TRUE(axtest::exists(app + "/_CodeSignature/signature.plist"));
+    EXPECT_TRUE(axtest::exists(app + "/Signature.plist"));
     auto v = codesign::verifyBundle(app);
     EXPECT_TRUE(v.valid) << v.reason;
     EXPECT_EQ(v.identifier, "com.example.app");

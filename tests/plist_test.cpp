@@ -63,6 +63,22 @@ TEST(Plist, OtherReadersAgree) {
     EXPECT_EQ(py.out, "16 -1\n");
 }
 
+TEST(Plist, WriterNamesNoDocumentTypeAndReaderAcceptsAny) {
+    auto xml = plist::toXML(sample());
+    ASSERT_TRUE(xml);
+    EXPECT_EQ(xml->find("<!DOCTYPE"), std::string::npos);
+    EXPECT_EQ(xml->rfind("<?xml", 0), 0u);
+    // Files written by other tools may carry a document type line; it is skipped, whatever it names.
+    const std::string body = "<plist version=\"1.0\"><dict><key>a</key><integer>1</integer></dict></plist>";
+    for (const std::string& prolog : {std::string(), std::string("<?xml version=\"1.0\"?>\n"),
+                                      std::string("<?xml version=\"1.0\"?>\n<!DOCTYPE plist SYSTEM \"plist.dtd\">\n"),
+                                      std::string("<!DOCTYPE plist>")}) {
+        auto r = plist::parse(prolog + body);
+        ASSERT_TRUE(r) << prolog;
+        EXPECT_EQ(*r, corvane::dict({{"a", 1}})) << prolog;
+    }
+}
+
 TEST(Plist, MalformedInputIsAnErrorValue) {
     const std::string inputs[] = {
         "", "not a plist at all", "<?xml version=\"1.0\"?><plist><dict><key>a</key></plist>",

@@ -46,9 +46,9 @@ struct Fixture {
         Dictionary appDict = *appInfo.asDictionary();
         appDict["KFBundleDisplayName"] = Value("Example");
         app = axtest::makeBundle(root.path(), "Example.app", Value(appDict), "/bin/true");
-        axtest::writeFile(app + "/de.lproj/InfoPlist.strings",
+        axtest::writeFile(app + "/Names/de.plist",
                           *plist::toXML(dict({{"KFBundleDisplayName", "Beispiel"}})));
-        axtest::writeFile(app + "/_Receipt/receipt", "receipt");
+        axtest::writeFile(app + "/Receipt", "receipt");
         std::string plugins = app + "/PlugIns";
         std::string share = axtest::makeBundle(
             plugins, "Share.appex",
@@ -115,7 +115,7 @@ TEST(Vantry, RegisterReadBackUnregisterWithAnObserverInAnotherProcess) {
     EXPECT_EQ(app->bundlePath(), f.app);
     EXPECT_EQ(app->identifier(), "com.example.app");
     EXPECT_EQ(app->localizedName(), std::optional<std::string>("Beispiel"));
-    EXPECT_EQ(app->receiptPath(), f.app + "/_Receipt/receipt");
+    EXPECT_EQ(app->receiptPath(), f.app + "/Receipt");
     EXPECT_FALSE(app->isPlaceholder());
     auto plugins = r.applicationForPath(f.app)->plugIns();
     ASSERT_EQ(plugins.size(), 3u);

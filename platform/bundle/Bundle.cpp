@@ -86,7 +86,7 @@ Value Bundle::infoDictionary() const {
 
 std::optional<std::string> Bundle::receiptPath() const {
     if (path_.empty()) return std::nullopt;
-    std::string receipt = path_ + "/_Receipt/receipt";
+    std::string receipt = path_ + "/" + kReceiptFileName;
     struct stat st {};
     if (::stat(receipt.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return std::nullopt;
     return receipt;

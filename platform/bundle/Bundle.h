@@ -1,9 +1,9 @@
 // The bundle reader: bundles as they lie on disk (docs/bundle-format.md).
 //
 // A bundle is a directory holding Info.plist, the executable named by its "KFBundleExecutable"
-// beside it, plug-ins under PlugIns/, a signature under _CodeSignature/ and a receipt at
-// _Receipt/receipt. Its support directory (the one that holds PlugIns/) is the bundle directory
-// itself.
+// beside it, plug-ins under PlugIns/, its signature in Signature.plist and, for an application, its
+// receipt in Receipt, both at the bundle's root. Its support directory (the one that holds PlugIns/)
+// is the bundle directory itself.
 //
 // Thread-safe: a Bundle caches its Info.plist under a lock until flush().
 #pragma once
@@ -22,6 +22,10 @@ inline constexpr int kPropertyBundlePath = 2;
 inline constexpr int kPropertyExecutablePath = 3;
 inline constexpr int kPropertySupportPath = 9;
 
+// Files at a bundle's root, beside Info.plist.
+inline constexpr const char* kSignatureFileName = "Signature.plist";
+inline constexpr const char* kReceiptFileName = "Receipt";
+
 class Bundle {
 public:
     // Mode 1: `path` is the bundle directory. Null when there is no directory there.
@@ -37,7 +41,7 @@ public:
     std::optional<std::string> property(int number) const;
     // The Info.plist as a Value; null when there is none or it is no dictionary.
     Value infoDictionary() const;
-    // <bundle>/_Receipt/receipt when that file exists.
+    // <bundle>/Receipt when that file exists.
     std::optional<std::string> receiptPath() const;
     // Forgets cached data, so the next read looks at the disk again.
     void flush();

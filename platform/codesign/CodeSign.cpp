@@ -196,9 +196,9 @@ Verification verifyOpened(int exeFd, const std::string& path) {
 
 std::string signaturePath(const std::string& path) {
     struct stat st {};
-    if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path + "/_CodeSignature/signature.plist";
+    if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path + "/" + bundle::kSignatureFileName;
     auto b = bundle::Bundle::openExecutable(path);
-    if (auto dir = b->property(bundle::kPropertyBundlePath)) return *dir + "/_CodeSignature/signature.plist";
+    if (auto dir = b->property(bundle::kPropertyBundlePath)) return *dir + "/" + bundle::kSignatureFileName;
     return path + ".axsig";
 }
 

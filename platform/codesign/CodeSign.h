@@ -1,8 +1,8 @@
 // Code signatures and the entitlements they carry (docs/code-signing.md).
 //
 // A signature binds one executable (its SHA-256) to an identifier and an entitlements dictionary,
-// signed with an ed25519 key. A bundle keeps its executable's signature in
-// _CodeSignature/signature.plist; an executable outside any bundle keeps a detached one beside
+// signed with an ed25519 key. A bundle keeps its executable's signature in Signature.plist at
+// its root; an executable outside any bundle keeps a detached one beside
 // it, "<executable>.axsig". Only keys installed in the trust directory (<root>/etc/corvane/trust.d,
 // root-owned on a real system) are trusted.
 //

@@ -18,6 +18,7 @@
 #include <thread>
 #include <unordered_map>
 
+#include "platform/bundle/Bundle.h"
 #include "platform/codesign/CodeSign.h"
 #include "platform/containers/Containers.h"
 #include "platform/layout/Layout.h"
@@ -86,7 +87,7 @@ std::pair<std::optional<std::string>, std::optional<std::string>> localizedNames
                                                                                   const Value& info) {
     Value table;
     for (const auto& lang : languages()) {
-        auto t = plist::readFile(bundle + "/" + lang + ".lproj/InfoPlist.strings");
+        auto t = plist::readFile(bundle + "/Names/" + lang + ".plist");
         if (t && t->isDictionary()) {
             table = *t;
             break;
@@ -601,7 +602,7 @@ public:
         auto [name, shortName] = localizedNames(*path, *info);
         Dictionary appRecord{{"identifier", *appId}, {"placeholder", placeholder}};
         if (name) appRecord.emplace("name", *name);
-        std::string receipt = *path + "/_Receipt/receipt";
+        std::string receipt = *path + "/" + bundle::kReceiptFileName;
         if (::stat(receipt.c_str(), &st) == 0 && S_ISREG(st.st_mode)) appRecord.emplace("receipt", receipt);
         std::string appFingerprint = Value(appRecord).description();
 

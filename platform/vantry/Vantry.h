@@ -82,7 +82,7 @@ public:
     const std::string& identifier() const { return identifier_; }
     const std::optional<std::string>& localizedName() const { return localizedName_; }
     bool isPlaceholder() const { return placeholder_; }
-    // <bundle>/_Receipt/receipt when it existed at registration.
+    // <bundle>/Receipt when it existed at registration.
     const std::optional<std::string>& receiptPath() const { return receipt_; }
     // The application's plug-ins, ordered by bundle path. Filled by the registry's lookups.
     std::vector<PlugInRecordPtr> plugIns() const;

@@ -29,7 +29,7 @@ corvane::Value appInfo(const std::string& identifier, const std::string& executa
                           {"KFBundleExecutable", executable},
                           {"KFBundleShortVersionString", "1.0"},
                           {"KFBundleVersion", "1"},
-                          {"KFBundlePackageType", "APPL"}});
+                          {"KFBundlePackageType", "APP!"}});
 }
 
 corvane::Value plugInInfo(const std::string& identifier, const corvane::Value& plugin,
@@ -38,7 +38,7 @@ corvane::Value plugInInfo(const std::string& identifier, const corvane::Value& p
                           {"KFBundleExecutable", executable},
                           {"KFBundleShortVersionString", "1.0"},
                           {"KFBundleVersion", "1"},
-                          {"KFBundlePackageType", "XPC!"},
+                          {"KFBundlePackageType", "RPX!"},
                           {"KSExtension", plugin}});
 }
 
