@@ -1,7 +1,5 @@
 #include "Annexa/AXDaemonClient.h"
 
-#include <stdexcept>
-
 #include "Annexa/AXMessage.h"
 
 namespace annexa {
@@ -25,19 +23,19 @@ AXDaemonClient::~AXDaemonClient() {
 }
 
 Dictionary AXDaemonClient::request(const std::string& name) const {
-    return Dictionary{{"request", name}, {"version", Value(static_cast<uint64_t>(protocolVersion_.load()))}};
+    return Dictionary{{message::kRequest, name}, {message::kVersion, Value(protocolVersion_.load())}};
 }
 
 Dictionary AXDaemonClient::requestPaths(const std::string& name, const std::vector<std::string>& paths) const {
     Dictionary m = request(name);
     Array list(paths.begin(), paths.end());
-    m["paths"] = convertValueToMessage(Value(std::move(list)));
+    m[message::kPaths] = convertValueToMessage(Value(std::move(list)));
     return m;
 }
 
 void AXDaemonClient::setUuids(Dictionary& message, const std::vector<UUID>& uuids) {
     Array list(uuids.begin(), uuids.end());
-    message["uuids"] = Value(std::move(list));
+    message[message::kUuids] = Value(std::move(list));
 }
 
 void AXDaemonClient::send(const Value& message, Completion reply) {
@@ -49,90 +47,93 @@ void AXDaemonClient::send(const Value& message, Completion reply) {
 }
 
 void AXDaemonClient::addPlugIns(const std::vector<std::string>& paths, Completion reply) {
-    send(Value(requestPaths("add", paths)), std::move(reply));
+    send(Value(requestPaths(request::kAdd, paths)), std::move(reply));
 }
 
 void AXDaemonClient::removePlugIns(const std::vector<std::string>& paths, Completion reply) {
-    send(Value(requestPaths("remove", paths)), std::move(reply));
+    send(Value(requestPaths(request::kRemove, paths)), std::move(reply));
 }
 
 void AXDaemonClient::bulkPlugins(uint64_t flags, Completion reply) {
-    Dictionary m = request("bulk");
-    m["flags"] = Value(flags);
+    Dictionary m = request(request::kBulk);
+    m[message::kFlags] = Value(flags);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::readyPlugIns(const std::vector<UUID>& uuids, uint64_t flags, Completion reply) {
-    Dictionary m = request("ready");
-    m["flags"] = Value(flags);
+    Dictionary m = request(request::kReady);
+    m[message::kFlags] = Value(flags);
     setUuids(m, uuids);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::accessPlugIns(const std::vector<UUID>& uuids, uint64_t flags, Completion reply) {
-    Dictionary m = request("access");
-    m["flags"] = Value(flags);
+    Dictionary m = request(request::kAccess);
+    m[message::kFlags] = Value(flags);
     setUuids(m, uuids);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::matchPlugIns(const Value& rules, uint64_t flags, Completion reply) {
-    Dictionary m = request("match");
-    m["rules"] = convertValueToMessage(rules);
-    m["flags"] = Value(flags);
+    Dictionary m = request(request::kMatch);
+    m[message::kRules] = convertValueToMessage(rules);
+    m[message::kFlags] = Value(flags);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::setPluginAnnotations(const std::vector<UUID>& uuids, const Value& annotations,
                                           Completion reply) {
-    Dictionary m = request("annotate");
+    Dictionary m = request(request::kAnnotate);
     setUuids(m, uuids);
-    m["annotations"] = convertValueToMessage(annotations);
+    m[message::kAnnotations] = convertValueToMessage(annotations);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::bulkSetPluginAnnotations(const Value& annotations, Completion reply) {
-    Dictionary m = request("bulk-annotate");
-    m["annotations"] = convertValueToMessage(annotations);
+    Dictionary m = request(request::kBulkAnnotate);
+    m[message::kAnnotations] = convertValueToMessage(annotations);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::holdPlugins(const std::vector<std::string>& paths, uint64_t flags, Completion reply) {
-    Dictionary m = requestPaths("lock", paths);
-    m["flags"] = Value(flags);
+    Dictionary m = requestPaths(request::kLock, paths);
+    m[message::kFlags] = Value(flags);
     send(Value(std::move(m)), std::move(reply));
 }
 
 void AXDaemonClient::releaseHold(const UUID& token, Completion reply) {
-    Dictionary m = request("lock");
+    Dictionary m = request(request::kLock);
     setUuids(m, {token});
     send(Value(std::move(m)), std::move(reply));
 }
 
-void AXDaemonClient::copyReceipt(Completion reply) { send(Value(request("receipt")), std::move(reply)); }
+void AXDaemonClient::copyReceipt(Completion reply) { send(Value(request(request::kReceipt)), std::move(reply)); }
 
 Reply AXDaemonClient::wait(const std::function<void(Completion)>& operation) {
     replyQueue_->assertNotCurrent();
     return corvane::dispatch::waitForCallback<Reply>(operation);
 }
 
-std::optional<Error> AXDaemonClient::errorInReply(const Reply& reply) {
-    if (!reply.ok()) return makeError(4, reply.description());
-    uint64_t code = reply.value["errorcode"].uint64Value().value_or(0);
-    const std::string* text = reply.value["error"].asString();
-    if (code == 0 && !text) return std::nullopt;
-    if (code == 0) throw std::logic_error(log::formatText("axd reported error without a code: %s", *text));
-    if (text) return makeError(static_cast<int64_t>(code), *text);
-    return makeError(static_cast<int64_t>(code), "unknown error returned by Annexa subsystem");
+Status AXDaemonClient::errorInReply(const Reply& reply) {
+    if (!reply.ok()) return makeError(AXErrorCode::InvalidRequest, reply.description());
+    uint64_t code = reply.value[message::kErrorCode].uint64Value().value_or(0);
+    const std::string* text = reply.value[message::kError].asString();
+    if (code == 0 && !text) return {};
+    if (code == 0) {
+        return makeErrorWithFormat(AXErrorCode::InvalidRequest, "axd reported error without a code: %s", *text);
+    }
+    auto replyCode = static_cast<AXErrorCode>(code);
+    if (text) return makeError(replyCode, *text);
+    return makeError(replyCode, "unknown error returned by Annexa subsystem");
 }
 
 std::optional<Value> AXDaemonClient::convertFromRPX(const Value& message) const {
-    if (protocolVersion_ != kProtocolVersion) return std::nullopt;
+    if (protocolVersion_ != kCurrentProtocolVersion) return std::nullopt;
     return convertMessageToValue(message);
 }
 
-std::optional<Value> AXDaemonClient::convertToRPX(const Value& value, int64_t version) {
-    if (version != kProtocolVersion) return std::nullopt;
+std::optional<Value> AXDaemonClient::convertToRPX(const Value& value, uint64_t version) {
+    if (version != kCurrentProtocolVersion) return std::nullopt;
     return convertValueToMessage(value);
 }
 

@@ -15,8 +15,6 @@
 
 namespace annexa {
 
-inline constexpr const char* kDefaultServiceName = "com.corvane.annexa.axd";
-inline constexpr int64_t kProtocolVersion = 3;
 
 // Thread-safe: requests may be made from any thread; completions and connection events run on the
 // queue "axd_client", one at a time.
@@ -52,20 +50,21 @@ public:
     //   auto r = client.wait([&](auto done) { client.addPlugIns({path}, done); });
     corvane::rpx::Reply wait(const std::function<void(Completion)>& operation);
 
-    // The error a reply carries, or nothing for success. A reply with a text but code 0 breaks the
-    // protocol: that throws std::logic_error("axd reported error without a code: <text>").
-    static std::optional<Error> errorInReply(const corvane::rpx::Reply& reply);
+    // The error a reply carries, or an ok status for success. A failed exchange is code 4 with the
+    // transport's description. A reply with a text but code 0 breaks the protocol: that is code 4
+    // "axd reported error without a code: <text>", never an exception into the host.
+    static Status errorInReply(const corvane::rpx::Reply& reply);
     // The in-memory form of a reply at protocol version 3; nothing at other versions.
     std::optional<Value> convertFromRPX(const Value& message) const;
-    static std::optional<Value> convertToRPX(const Value& value, int64_t version);
+    static std::optional<Value> convertToRPX(const Value& value, uint64_t version);
 
-    int64_t protocolVersion() const { return protocolVersion_; }
-    void setProtocolVersion(int64_t version) { protocolVersion_ = version; }
+    uint64_t protocolVersion() const { return protocolVersion_; }
+    void setProtocolVersion(uint64_t version) { protocolVersion_ = version; }
 
 private:
     corvane::dispatch::QueuePtr replyQueue_;
     std::shared_ptr<corvane::rpx::Connection> axd_;
-    std::atomic<int64_t> protocolVersion_{kProtocolVersion};
+    std::atomic<uint64_t> protocolVersion_{kCurrentProtocolVersion};
 };
 
 }  // namespace annexa

@@ -120,7 +120,7 @@ void AXPlugInCore::updateFromForm(const Value& f) {
 
 Value AXPlugInCore::exportForm(Error* error) const {
     auto missing = [&](const char* what) {
-        if (error) *error = makeErrorWithFormat(12, "cannot export plug-in: missing %s", what);
+        if (error) *error = makeErrorWithFormat(AXErrorCode::PlugInUnusable, "cannot export plug-in: missing %s", what);
         return Value();
     };
     Value info = bundleInfoDictionary();
@@ -259,18 +259,18 @@ Value AXPlugInCore::augmentInterface(const Value& /*interface*/) const { return 
 
 std::optional<Error> AXPlugInCore::diagnose() const {
     if (!identifier())
-        return makeError(12, "missing identifier (no KSExtensionIdentifier, nor even KFBundleIdentifier)");
+        return makeError(AXErrorCode::PlugInUnusable, "missing identifier (no KSExtensionIdentifier, nor even KFBundleIdentifier)");
     if (protocolSpec().isNull())
-        return makeErrorWithFormat(12, "missing \"%@\" key in Info.plist or SDK", keys::kProtocol);
+        return makeErrorWithFormat(AXErrorCode::PlugInUnusable, "missing \"%@\" key in Info.plist or SDK", keys::kProtocol);
     if (attributes().isNull())
-        return makeErrorWithFormat(12, "missing \"%@\" key in Info.plist or SDK", keys::kAttributes);
+        return makeErrorWithFormat(AXErrorCode::PlugInUnusable, "missing \"%@\" key in Info.plist or SDK", keys::kAttributes);
     if (isAppExtension() && !(principalSpec() == Value(keys::kDefaultSpec)))
-        return makeErrorWithFormat(12, "Application Extensions may not use the \"%@\" key",
+        return makeErrorWithFormat(AXErrorCode::PlugInUnusable, "Application Extensions may not use the \"%@\" key",
                                    keys::kPrincipalClass);
     if (!pluginKey(keys::kPassProxy).isNull())
-        return makeErrorWithFormat(12, "the \"%@\" key is not supported on this platform",
+        return makeErrorWithFormat(AXErrorCode::PlugInUnusable, "the \"%@\" key is not supported on this platform",
                                    keys::kPassProxy);
-    if (isHybrid()) return makeError(12, "hybrid plug-ins are not supported on this platform");
+    if (isHybrid()) return makeError(AXErrorCode::PlugInUnusable, "hybrid plug-ins are not supported on this platform");
     return std::nullopt;
 }
 

@@ -7,8 +7,8 @@ namespace annexa {
 
 namespace log = corvane::log;
 
-Error makeError(int64_t code, const char* text) {
-    Error e{kAnnexaErrorDomain, code, std::nullopt};
+Error makeError(AXErrorCode code, const char* text) {
+    Error e{kAnnexaErrorDomain, errorCodeValue(code), std::nullopt};
     if (text) e.text = text;
     return e;
 }

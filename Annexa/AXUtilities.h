@@ -5,6 +5,7 @@
 #include <string>
 #include <string_view>
 
+#include "Annexa/AXProtocol.h"
 #include "platform/log/Log.h"
 #include "platform/value/Value.h"
 
@@ -14,21 +15,21 @@ using corvane::Array;
 using corvane::Date;
 using corvane::Dictionary;
 using corvane::Error;
-using corvane::MaybeError;
 using corvane::Result;
+using corvane::Status;
 using corvane::UUID;
 using corvane::Value;
 
 inline constexpr const char* kAnnexaErrorDomain = "Annexa";
 
 // An error of the domain "Annexa" with the code and, when given, the text as its description.
-Error makeError(int64_t code, const char* text);
-inline Error makeError(int64_t code, const std::string& text) { return makeError(code, text.c_str()); }
+Error makeError(AXErrorCode code, const char* text);
+inline Error makeError(AXErrorCode code, const std::string& text) { return makeError(code, text.c_str()); }
 
 // Formats the text with the log formatter's directives ("%@", "%d", "%s", ...), unredacted; a null
 // format gives an error without description.
 template <class... A>
-Error makeErrorWithFormat(int64_t code, const char* format, const A&... args) {
+Error makeErrorWithFormat(AXErrorCode code, const char* format, const A&... args) {
     if (!format) return makeError(code, nullptr);
     return makeError(code, corvane::log::formatText(format, args...));
 }

@@ -37,19 +37,18 @@ int64_t versionOf(const Value& top) {
 
 AXDAnnotationStore::AXDAnnotationStore(const char* path)
     : annotationsURL_(path ? std::string(path) : defaultDatabaseURL()) {
-    Error error;
-    if (loadDb(annotationsURL_, &error)) return;
+    Status loaded = loadDb(annotationsURL_);
+    if (loaded.ok()) return;
+    const Error& error = loaded.error();
     if (!(error.domain == corvane::kFileErrorDomain && error.code == corvane::kFileNoSuchFile)) {
         log::error(logOps(), "unable to load annotation database:%{public}@ error:%{public}@ (resetting)",
                    annotationsURL_, error);
     }
-    Error oldError;
-    if (loadDb(corvane::layout::underRoot(kEarlierReleasesFile), &oldError)) {
+    if (loadDb(corvane::layout::underRoot(kEarlierReleasesFile)).ok()) {
         log::info(logOps(), "migrating old annotations");
-        Error saveError;
-        if (!saveDb(&saveError)) {
+        if (Status saved = saveDb(); !saved.ok()) {
             log::error(logOps(), "unable to save migrated annotations to %{public}@ error:%{public}@",
-                       annotationsURL_, saveError);
+                       annotationsURL_, saved.error());
         }
         return;
     }
@@ -72,47 +71,40 @@ void AXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, con
         }
         annotations_.insert_or_assign(key, Value(std::move(merged)));
     }
-    Error error;
-    if (!saveDb(&error)) {
+    if (Status saved = saveDb(); !saved.ok()) {
         log::error(logOps(), "unable to save annotations:%{public}@ error:%{public}@", annotationsURL_,
-                   error);
+                   saved.error());
     }
 }
 
-bool AXDAnnotationStore::loadDb(const std::string& path, Error* error) {
-    auto fail = [&](Error e) {
+Status AXDAnnotationStore::loadDb(const std::string& path) {
+    auto fail = [](Error e) {
         AXD_TRACE(db__load, e.domain.c_str(), static_cast<uint64_t>(e.code));
-        if (error) *error = std::move(e);
-        return false;
+        return Status(std::move(e));
     };
     auto top = corvane::plist::readFile(path);
     if (!top) return fail(top.error());
     int64_t version = versionOf(*top);
     if (version != kVersion) {
-        return fail(makeErrorWithFormat(7, "found database version %d needed version %d", version,
+        return fail(makeErrorWithFormat(AXErrorCode::VersionMismatch, "found database version %d needed version %d", version,
                                         kVersion));
     }
     // A current file whose "data" is missing or of another type still gives a usable table.
     const Dictionary* data = (*top)["data"].asDictionary();
     annotations_ = data ? *data : Dictionary{};
-    return true;
+    return {};
 }
 
-bool AXDAnnotationStore::saveDb(Error* error) {
-    Value top = corvane::dict({{"version", kVersion}, {"data", Value(annotations_)}});
-    if (auto err = corvane::plist::writeXMLFile(annotationsURL_, top)) {
-        if (error) *error = std::move(*err);
-        return false;
-    }
-    return true;
+Status AXDAnnotationStore::saveDb() {
+    return corvane::plist::writeXMLFile(annotationsURL_, corvane::dict({{"version", kVersion}, {"data", Value(annotations_)}}));
 }
 
 std::string AXDAnnotationStore::defaultDatabaseURL() {
     std::string dir = containerURL() + "/com.corvane.annexa/";
-    if (auto err = corvane::layout::makeDirectories(dir.substr(0, dir.size() - 1), 0700)) {
+    if (Status made = corvane::layout::makeDirectories(dir.substr(0, dir.size() - 1), 0700); !made.ok()) {
         log::error(logOps(), "failed to create storage directory at %{public}@ - error=%{public}@",
-                   dir, *err);
-        fatal(log::formatText("unable to create plugin annotations directory:%@ error:%@", dir, *err));
+                   dir, made.error());
+        fatal(log::formatText("unable to create plugin annotations directory:%@ error:%@", dir, made.error()));
     }
     std::string file = dir + "Annotations";
     log::debug(logOps(), "annotations are stored at %{public}@", file);

@@ -50,10 +50,10 @@ public:
         setAnnotationForIdentifier(annotation, plugIn.annotationKey());
     }
 
-    // Reads the file at `path` and installs its table. False with the error otherwise.
-    bool loadDb(const std::string& path, Error* error);
-    // Writes the whole table to annotationsURL(). False with the error otherwise.
-    bool saveDb(Error* error);
+    // Reads the file at `path` and installs its table; the table is unchanged on failure.
+    Status loadDb(const std::string& path);
+    // Writes the whole table to annotationsURL().
+    Status saveDb();
 
     // The default file location, creating its directory (fatal when that fails).
     static std::string defaultDatabaseURL();

@@ -83,10 +83,10 @@ void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) 
 std::optional<Error> AXDPlugIn::diagnose() const {
     if (auto err = AXPlugInCore::diagnose()) return err;
     if (!isData() && !(vtproxy_ && vtproxy_->dataContainerPath()))
-        return makeError(12, "this plug-in has no sandbox data container");
+        return makeError(AXErrorCode::PlugInUnusable, "this plug-in has no sandbox data container");
     // Stand-alone plug-ins belong to the system volume (under the platform root when it moves).
     if (!containingUrl() && path().rfind(corvane::layout::systemRoot() + "/", 0) != 0)
-        return makeError(12, "plug-ins outside containing apps must be in /System");
+        return makeError(AXErrorCode::PlugInUnusable, "plug-ins outside containing apps must be in /System");
     return std::nullopt;
 }
 

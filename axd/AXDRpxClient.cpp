@@ -35,8 +35,9 @@ void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
         log::error(logOps(), "unexpected message: %{public}@ from: %d", event.message, pid());
         // A sender that waits for an answer gets one rather than waiting for ever.
         if (auto conn = connection(); conn && event.wantsReply)
-            conn->sendReply(event.messageId, Value(Dictionary{{"errorcode", Value(uint64_t{4})},
-                                                              {"error", Value("invalid request format")}}));
+            conn->sendReply(event.messageId, Value(Dictionary{{message::kErrorCode, Value(static_cast<uint64_t>(errorCodeValue(
+                                                                   AXErrorCode::InvalidRequest)))},
+                                                              {message::kError, Value("invalid request format")}}));
         return;
     }
     if (AXD_TRACE_ENABLED(request__input)) {

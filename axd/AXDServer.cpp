@@ -30,15 +30,16 @@ bool AXDPlugInHold::heldBy(const AXDRpxClient* client) const { return clientIden
 
 // ---- server
 
-AXDServer::AXDServer(const char* database)
-    : AXDatabase(database, corvane::vantry::Registry::shared()),
+AXDServer::AXDServer(const char* database, std::shared_ptr<corvane::vantry::Registry> registry)
+    : AXDatabase(database, std::move(registry)),
       rpxQueue_(Queue::create("rpx")),
       mainQueue_(Queue::create("service", corvane::dispatch::QoS::UserInitiated)),
       syncQueue_(Queue::create("serverSync")),
       holdQueue_(*syncQueue_) {}
 
-std::shared_ptr<AXDServer> AXDServer::initForService(const std::string& serviceName, const char* database) {
-    auto server = std::shared_ptr<AXDServer>(new AXDServer(database));
+std::shared_ptr<AXDServer> AXDServer::initForService(const std::string& serviceName, const char* database,
+                                                     std::shared_ptr<corvane::vantry::Registry> registry) {
+    auto server = std::shared_ptr<AXDServer>(new AXDServer(database, std::move(registry)));
     auto listener = corvane::rpx::Listener::create(serviceName, server->rpxQueue_);
     if (!listener) {
         log::error(logOps(), "cannot listen on %{public}@: %{public}@", serviceName, listener.error().description());

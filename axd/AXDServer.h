@@ -41,10 +41,9 @@ private:
 // The database part lives on its queue; the holds on "serverSync"; requests run on "service".
 class AXDServer : public AXDatabase, public AXDatabaseDelegate {
 public:
-    static constexpr const char* kDefaultServiceName = "com.corvane.annexa.axd";
-
-    // The server, or null when its endpoint cannot be served.
-    static std::shared_ptr<AXDServer> initForService(const std::string& serviceName, const char* database);
+    // The server over `registry`, or null when its endpoint cannot be served.
+    static std::shared_ptr<AXDServer> initForService(const std::string& serviceName, const char* database,
+                                                     std::shared_ptr<corvane::vantry::Registry> registry);
     // The process's server; null before the first construction.
     static AXDServer* server();
 
@@ -69,7 +68,7 @@ public:
     const AXDUserPrefs& userPrefs() const { return *userPrefs_; }
 
 private:
-    explicit AXDServer(const char* database);
+    AXDServer(const char* database, std::shared_ptr<corvane::vantry::Registry> registry);
 
     uint32_t verbose_ = 0;
     corvane::dispatch::QueuePtr rpxQueue_;

@@ -29,8 +29,8 @@ private:
     AXDatabase* db_;
 };
 
-AXDatabase::AXDatabase(const char* database, corvane::vantry::Registry& workspace)
-    : workspace_(workspace),
+AXDatabase::AXDatabase(const char* database, std::shared_ptr<corvane::vantry::Registry> workspace)
+    : workspace_(std::move(workspace)),
       sync_(corvane::dispatch::Queue::create("AXDatabase")),
       syncQueue_(*sync_),
       observer_(std::make_shared<RegistryObserver>(this)) {
@@ -40,7 +40,7 @@ AXDatabase::AXDatabase(const char* database, corvane::vantry::Registry& workspac
         syncQueue_.assertCurrent();
         annotations_ = std::move(store);
     });
-    workspace_.addObserver(observer_);
+    workspace_->addObserver(observer_);
 }
 
 AXDatabase::~AXDatabase() { observer_->detach(); }
@@ -72,7 +72,7 @@ void AXDatabase::purgeCachesToLimit(int32_t limit) {
     if (cache_.size() <= static_cast<uint32_t>(limit)) return;
     log::info(logOps(), "purging cache for %d > %d", static_cast<int>(cache_.size()), limit);
     cache_.clear();
-    workspace_.dropCaches();
+    workspace_->dropCaches();
 }
 
 AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) {
@@ -85,7 +85,7 @@ AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) {
             result = it->second;
             return;
         }
-        if (auto record = workspace_.plugInForUUID(uuid)) {
+        if (auto record = workspace_->plugInForUUID(uuid)) {
             result = createPlugInForProxy(record);
         } else {
             log::info(logOps(), "Vantry cannot find plug-in with UUID:%{public}@", uuid.string());
@@ -95,7 +95,7 @@ AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) {
 }
 
 AXDPlugInPtr AXDatabase::findPlugInAtPath(const std::string& path) {
-    auto record = workspace_.plugInForPath(path);
+    auto record = workspace_->plugInForPath(path);
     if (!record) {
         log::info(logOps(), "Vantry cannot find plug-in at path:%@", path);
         return nullptr;
@@ -104,7 +104,7 @@ AXDPlugInPtr AXDatabase::findPlugInAtPath(const std::string& path) {
 }
 
 std::optional<std::vector<AXDPlugInPtr>> AXDatabase::plugInsWithinApplication(const std::string& path) {
-    auto app = workspace_.applicationForPath(path);
+    auto app = workspace_->applicationForPath(path);
     auto records = app ? app->plugIns() : std::vector<PlugInRecordPtr>{};
     if (records.empty()) return std::nullopt;
     std::vector<AXDPlugInPtr> result;
@@ -113,14 +113,19 @@ std::optional<std::vector<AXDPlugInPtr>> AXDatabase::plugInsWithinApplication(co
     return result;
 }
 
-MaybeError AXDatabase::addPlugIn(const std::string& path) {
-    if (workspace_.registerBundle(path)) return makeError(2, "Vantry failed to register the plug-in");
-    return std::nullopt;
+Status AXDatabase::addPlugIn(const std::string& path) {
+    Status registered = workspace_->registerBundle(path);
+    if (registered.ok()) return {};
+    // The reply's text is fixed; the registry's reason goes to the log.
+    log::error(logOps(), "Vantry cannot register %@: %{public}@", path, registered.error().description());
+    return makeError(AXErrorCode::RegistryRefused, "Vantry failed to register the plug-in");
 }
 
-MaybeError AXDatabase::removePlugIn(const std::string& path) {
-    if (workspace_.unregisterBundle(path)) return makeError(2, "Vantry failed to deregister the plug-in");
-    return std::nullopt;
+Status AXDatabase::removePlugIn(const std::string& path) {
+    Status unregistered = workspace_->unregisterBundle(path);
+    if (unregistered.ok()) return {};
+    log::info(logOps(), "Vantry cannot unregister %@: %{public}@", path, unregistered.error().description());
+    return makeError(AXErrorCode::RegistryRefused, "Vantry failed to deregister the plug-in");
 }
 
 Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {

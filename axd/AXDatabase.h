@@ -37,8 +37,8 @@ inline constexpr const char* kAnnotationChangeNotification = "com.corvane.annexa
 class AXDatabase {
 public:
     // Opens the annotation store (`database`: the -d path, or null for its default location),
-    // makes the queue and subscribes to the registry's events.
-    AXDatabase(const char* database, corvane::vantry::Registry& workspace);
+    // makes the queue and subscribes to the events of `workspace`, the registry it serves from.
+    AXDatabase(const char* database, std::shared_ptr<corvane::vantry::Registry> workspace);
     virtual ~AXDatabase();
     AXDatabase(const AXDatabase&) = delete;
     AXDatabase& operator=(const AXDatabase&) = delete;
@@ -50,8 +50,8 @@ public:
     AXDPlugInPtr findPlugInAtPath(const std::string& path);
     // Null (not empty) when the application has no plug-ins or is not known.
     std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& path);
-    MaybeError addPlugIn(const std::string& path);
-    MaybeError removePlugIn(const std::string& path);
+    Status addPlugIn(const std::string& path);
+    Status removePlugIn(const std::string& path);
 
     Value annotationForPlugIn(const AXDPlugIn& plugIn);
     void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
@@ -65,7 +65,7 @@ public:
     void setDelegate(AXDatabaseDelegate* delegate) { delegate_.store(delegate); }
     uint32_t cacheLimit() const { return cacheLimit_.load(); }
     void setCacheLimit(uint32_t limit) { cacheLimit_.store(limit); }
-    corvane::vantry::Registry& workspace() const { return workspace_; }
+    corvane::vantry::Registry& workspace() const { return *workspace_; }
     corvane::dispatch::Queue& databaseQueue() const RETURN_CAPABILITY(syncQueue_) { return syncQueue_; }
     // The number of cached records (read on the database queue).
     size_t cacheCount();
@@ -77,7 +77,7 @@ private:
 
     std::atomic<AXDatabaseDelegate*> delegate_{nullptr};
     std::atomic<uint32_t> cacheLimit_{0};
-    corvane::vantry::Registry& workspace_;
+    const std::shared_ptr<corvane::vantry::Registry> workspace_;
     corvane::dispatch::QueuePtr sync_;
     corvane::dispatch::Queue& syncQueue_;
     std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(syncQueue_);

@@ -20,11 +20,11 @@ using Handler = void (Transaction::*)();
 // Tested in this order, by exact, case-sensitive comparison. Requests whose handlers are not part
 // of this daemon yet ("match", "ready", "access", "lock", "receipt") are not in the table.
 const std::pair<const char*, Handler> kRequests[] = {
-    {"add", &Transaction::addPlugIns},
-    {"remove", &Transaction::removePlugIns},
-    {"bulk", &Transaction::bulkPlugIns},
-    {"annotate", &Transaction::annotatePlugIns},
-    {"bulk-annotate", &Transaction::bulkAnnotatePlugIns},
+    {request::kAdd, &Transaction::addPlugIns},
+    {request::kRemove, &Transaction::removePlugIns},
+    {request::kBulk, &Transaction::bulkPlugIns},
+    {request::kAnnotate, &Transaction::annotatePlugIns},
+    {request::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
 };
 
 }  // namespace
@@ -36,11 +36,11 @@ AXDServer& Transaction::server() const { return *client_->server(); }
 corvane::rpx::ConnectionPtr Transaction::connection() const { return client_->connection(); }
 
 void Transaction::dispatch() {
-    const std::string* name = request()["request"].asString();
-    const Value& version = request()["version"];
+    const std::string* name = request()[message::kRequest].asString();
+    const Value& version = request()[message::kVersion];
     version_ = version.kind() == Value::Kind::UInt64 ? *version.uint64Value() : 0;
-    if (version_ != 2 && version_ != 3) {
-        failMessage(7, log::formatText("unsupported protocol version %d (current %d)", static_cast<int32_t>(version_),
+    if (version_ < kOldestProtocolVersion || version_ > kCurrentProtocolVersion) {
+        failMessage(AXErrorCode::VersionMismatch, log::formatText("unsupported protocol version %d (current %d)", static_cast<int32_t>(version_),
                                        static_cast<int>(kCurrentProtocolVersion)));
         return;
     }
@@ -50,7 +50,7 @@ void Transaction::dispatch() {
     log::debug(logOps(), "client %d requested %{public}s", client_->pid(), text);
     AXD_TRACE(request, client_->pid(), text ? text : "");
     if (!name) {
-        failMessage(4, "invalid request format (missing type)");
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (missing type)");
         return;
     }
     for (const auto& [requestName, handler] : kRequests) {
@@ -59,7 +59,7 @@ void Transaction::dispatch() {
             return;
         }
     }
-    failMessage(4, "unrecognized request");
+    failMessage(AXErrorCode::InvalidRequest, "unrecognized request");
 }
 
 void Transaction::done() {
@@ -74,34 +74,34 @@ void Transaction::done() {
     if (conn && request_.wantsReply) conn->sendReply(request_.messageId, reply);
 }
 
-void Transaction::failMessage(int64_t code, const std::string& message) {
-    reply_["errorcode"] = Value(static_cast<uint64_t>(code));
-    reply_["error"] = Value(message);
+void Transaction::failMessage(AXErrorCode code, const std::string& message) {
+    reply_[message::kErrorCode] = Value(static_cast<uint64_t>(errorCodeValue(code)));
+    reply_[message::kError] = Value(message);
     done();
 }
 
-void Transaction::failError(int64_t fallback, const Error& error) {
+void Transaction::failError(AXErrorCode fallback, const Error& error) {
     if (error.domain == kAnnexaErrorDomain) {
-        failMessage(error.code, error.text.value_or(""));
+        failMessage(static_cast<AXErrorCode>(error.code), error.text.value_or(""));
     } else {
         failMessage(fallback, error.description());
     }
 }
 
 bool Transaction::marshalPaths(const std::function<Walk(const std::string&, bool)>& handler) {
-    const Value* paths = rpx_dictionary_get_array(request(), "paths");
+    const Value* paths = rpx_dictionary_get_array(request(), message::kPaths);
     if (!paths) {
-        failMessage(4, "invalid request format");
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format");
         return false;
     }
     for (const Value& element : *paths->asArray()) {
         const std::string* path = element.asString();
         if (!path) {
-            failMessage(4, "invalid request format");
+            failMessage(AXErrorCode::InvalidRequest, "invalid request format");
             return false;
         }
         if (path->empty() || (*path)[0] != '/') {
-            failMessage(9, log::formatText("absolute path required: %s", *path));
+            failMessage(AXErrorCode::BadPath, log::formatText("absolute path required: %s", *path));
             return false;
         }
         char resolved[PATH_MAX];
@@ -116,20 +116,20 @@ void Transaction::processPaths(const std::function<Walk(const std::string&, bool
 }
 
 bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>& handler) {
-    const Value* uuids = rpx_dictionary_get_array(request(), "uuids");
+    const Value* uuids = rpx_dictionary_get_array(request(), message::kUuids);
     if (!uuids) {
-        failMessage(4, "invalid request format (uuid)");
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (uuid)");
         return false;
     }
     for (const Value& element : *uuids->asArray()) {
         const UUID* uuid = element.asUUID();
         if (!uuid) {
-            failMessage(4, "invalid request (bad uuid array)");
+            failMessage(AXErrorCode::InvalidRequest, "invalid request (bad uuid array)");
             return false;
         }
         AXDPlugInPtr plugIn = server().findPlugIn(*uuid);
         if (!plugIn) {
-            failMessage(4, "no such plugin (uuid not found)");
+            failMessage(AXErrorCode::InvalidRequest, "no such plugin (uuid not found)");
             return false;
         }
         if (handler(plugIn) == Walk::Stop) return false;
@@ -139,7 +139,7 @@ bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>
 
 void Transaction::addAnnotationForPlugIn(const AXDPlugIn& plugIn, Dictionary& form) {
     Value annotation = server().annotationForPlugIn(plugIn);
-    form["annotations"] = annotation.isNull() ? Value(Dictionary{}) : annotation;
+    form[message::kAnnotations] = annotation.isNull() ? Value(Dictionary{}) : annotation;
 }
 
 // ---- registration
@@ -147,13 +147,13 @@ void Transaction::addAnnotationForPlugIn(const AXDPlugIn& plugIn, Dictionary& fo
 void Transaction::addPlugIns() {
     processPaths([this](const std::string& path, bool resolved) {
         if (!resolved) {
-            failMessage(9, log::formatText("invalid plugin path: %@", path));
+            failMessage(AXErrorCode::BadPath, log::formatText("invalid plugin path: %@", path));
             return Walk::Stop;
         }
         AXD_TRACE(plugin__add, path.c_str());
-        if (server().addPlugIn(path)) {
+        if (!server().addPlugIn(path).ok()) {
             log::notice(logOps(), "failed to register plug-in at %@", path);
-            failMessage(2, log::formatText("unable to register plug-in at %@", path));
+            failMessage(AXErrorCode::RegistryRefused, log::formatText("unable to register plug-in at %@", path));
             return Walk::Stop;
         }
         return Walk::Continue;
@@ -167,11 +167,11 @@ void Transaction::removePlugIns() {
             log::notice(log::defaultLog(),
                         "refused request from pid=%d to remove plug-in at %@ - client lacks required entitlement",
                         client_->pid(), path);
-            failMessage(11, "caller lacks entitlement for this operation");
+            failMessage(AXErrorCode::NotEntitled, "caller lacks entitlement for this operation");
             return Walk::Stop;
         }
-        if (server().removePlugIn(path)) {
-            failMessage(9, log::formatText("no plugin at %@", path));
+        if (!server().removePlugIn(path).ok()) {
+            failMessage(AXErrorCode::BadPath, log::formatText("no plugin at %@", path));
             return Walk::Stop;
         }
         return Walk::Continue;
@@ -179,7 +179,7 @@ void Transaction::removePlugIns() {
 }
 
 void Transaction::bulkPlugIns() {
-    uint64_t flags = request()["flags"].uint64Value().value_or(0);
+    uint64_t flags = request()[message::kFlags].uint64Value().value_or(0);
     log::info(logOps(), "bulk options 0x%lx not supported", static_cast<unsigned long>(flags & 0xffffffffu));
     done();
 }
@@ -187,9 +187,9 @@ void Transaction::bulkPlugIns() {
 // ---- annotations
 
 Value Transaction::annotationsArgument() {
-    const Value* annotations = rpx_dictionary_get_dictionary(request(), "annotations");
+    const Value* annotations = rpx_dictionary_get_dictionary(request(), message::kAnnotations);
     if (!annotations) {
-        failMessage(4, "invalid request format (bad annotations dictionary)");
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (bad annotations dictionary)");
         return Value();
     }
     return convertMessageToValue(*annotations);
@@ -201,14 +201,14 @@ void Transaction::annotatePlugIns() {
     Dictionary changes;
     if (const Value* election = d.find(keys::kElection)) {
         if (!election->isNumber()) {
-            failMessage(4, "invalid request format (annotation election)");
+            failMessage(AXErrorCode::InvalidRequest, "invalid request format (annotation election)");
             return;
         }
         changes.emplace(keys::kElection, *election);
     }
     if (const Value* extension = d.find(keys::kAnnotationExtension)) {
         if (!extension->isDictionary()) {
-            failMessage(4, "invalid request format (annotation extension)");
+            failMessage(AXErrorCode::InvalidRequest, "invalid request format (annotation extension)");
             return;
         }
         changes.emplace(keys::kAnnotationExtension, *extension);
@@ -242,17 +242,17 @@ void Transaction::bulkAnnotatePlugIns() {
     if (entries) {
         for (const auto& [key, value] : *entries) {
             if (!value.isDictionary()) {
-                failMessage(18, "annotations values must be dictionaries");
+                failMessage(AXErrorCode::BadAnnotation, "annotations values must be dictionaries");
                 return;
             }
             auto uuid = UUID::parse(key);
             if (!uuid) {
-                failMessage(18, "invalid plug-in UUID value");
+                failMessage(AXErrorCode::BadAnnotation, "invalid plug-in UUID value");
                 return;
             }
             AXDPlugInPtr p = server().findPlugIn(*uuid);
             if (!p) {
-                failMessage(2, "no plug-in with the requested uuid");
+                failMessage(AXErrorCode::RegistryRefused, "no plug-in with the requested uuid");
                 return;
             }
             log::debug(logOps(), "client %d plug-in %@(%{public}@) extension := %@", client_->pid(), p->identifier(),

@@ -15,8 +15,6 @@ namespace annexa {
 class AXDRpxClient;
 class AXDServer;
 
-inline constexpr uint64_t kCurrentProtocolVersion = 3;
-
 // Lives on: the service queue, for the length of its handler.
 class Transaction {
 public:
@@ -27,10 +25,10 @@ public:
     void dispatch();
     // Sends the reply (dropped when the connection is gone or no reply is expected).
     void done();
-    void failMessage(int64_t code, const std::string& message);
+    void failMessage(AXErrorCode code, const std::string& message);
     // An error of the domain "Annexa" answers with its own code and text; any other with
     // `fallback` and its description.
-    void failError(int64_t fallback, const Error& error);
+    void failError(AXErrorCode fallback, const Error& error);
     // Walks "paths": each absolute path, canonical when it resolves. False when the walk stopped
     // (the reply was sent then).
     bool marshalPaths(const std::function<Walk(const std::string& path, bool resolved)>& handler);

@@ -24,7 +24,7 @@ int main(int argc, char** argv) {
     corvane::rpx::handleTermination();
     log::info(annexa::logOps(), "axd is launching");
 
-    std::string serviceName = annexa::AXDServer::kDefaultServiceName;
+    std::string serviceName = annexa::kDefaultServiceName;
     uint32_t cacheLimit = 1000000;
     const char* database = nullptr;
     uint32_t verbose = 0;
@@ -32,9 +32,9 @@ int main(int argc, char** argv) {
     while ((opt = getopt(argc, argv, "c:d:S:v")) != -1) {
         switch (opt) {
             case 'c':
-                // The leading digits, as a decimal number; text without them gives 0.
-                cacheLimit = static_cast<uint32_t>(std::strtoul(optarg, nullptr, 10));
-                if (optarg[0] < '0' || optarg[0] > '9') cacheLimit = 0;
+                // A decimal number read as strtol reads it (leading blanks and a sign allowed);
+                // text without leading digits gives 0.
+                cacheLimit = static_cast<uint32_t>(std::strtol(optarg, nullptr, 10));
                 break;
             case 'd': database = optarg; break;
             case 'S': serviceName = optarg; break;
@@ -48,7 +48,13 @@ int main(int argc, char** argv) {
     }
     if (optind < argc) usage();
 
-    auto server = annexa::AXDServer::initForService(serviceName, database);
+    auto registry = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
+    if (!registry) {
+        log::error(annexa::logOps(), "cannot open the application registry: %{public}@", registry.error().description());
+        log::error(annexa::logOps(), "unable to construct server");
+        return 1;
+    }
+    auto server = annexa::AXDServer::initForService(serviceName, database, std::move(*registry));
     if (!server) {
         log::error(annexa::logOps(), "unable to construct server");
         return 1;

@@ -60,8 +60,8 @@ int runRegistry(int argc, char** argv) {
     auto& registry = **opened;
     auto start = std::chrono::steady_clock::now();
     for (const auto& app : apps) {
-        if (auto err = registry.registerBundle(app)) {
-            std::fprintf(stderr, "axbench registry: %s\n", err->description().c_str());
+        if (corvane::Status registered = registry.registerBundle(app); !registered.ok()) {
+            std::fprintf(stderr, "axbench registry: %s\n", registered.error().description().c_str());
             return 1;
         }
     }

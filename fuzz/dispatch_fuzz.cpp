@@ -25,6 +25,7 @@ constexpr const char* kService = "com.corvane.annexa.axd.fuzz";
 
 struct World {
     std::string root;
+    std::shared_ptr<corvane::vantry::Registry> registry;
     std::shared_ptr<annexa::AXDServer> server;
     corvane::dispatch::QueuePtr queue = corvane::dispatch::Queue::create("fuzz.client");
     corvane::rpx::ConnectionPtr connection;
@@ -37,8 +38,11 @@ struct World {
         root = dir;
         setenv("CORVANE_ROOT", dir, 1);
         setenv("CORVANE_LOG", "error", 0);
+        auto opened = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
+        if (!opened) std::abort();
+        registry = std::move(*opened);
         registerSample();
-        server = annexa::AXDServer::initForService(kService, nullptr);
+        server = annexa::AXDServer::initForService(kService, nullptr, registry);
         if (!server) std::abort();
         server->service()->resume();
         reconnect();
@@ -49,7 +53,7 @@ struct World {
         corvane::Dictionary info{{"KFBundleIdentifier", identifier}, {"KFBundleExecutable", "exe"},
                                  {"KFBundleVersion", "1"}, {"KFBundlePackageType", type}};
         if (!plugin.isNull()) info.emplace("KSExtension", plugin);
-        if (corvane::plist::writeXMLFile(path + "/Info.plist", corvane::Value(info))) std::abort();
+        if (!corvane::plist::writeXMLFile(path + "/Info.plist", corvane::Value(info)).ok()) std::abort();
         std::filesystem::copy_file("/bin/true", path + "/exe");
         chmod((path + "/exe").c_str(), 0755);
     }
@@ -61,9 +65,8 @@ struct World {
                        corvane::dict({{"KSExtensionPointIdentifier", "com.example.point"},
                                       {"KSExtensionAttributes", corvane::dict({{"KSExtensionVersion", "1"}})}}));
         }
-        auto& registry = corvane::vantry::Registry::shared();
-        if (registry.registerBundle(app)) std::abort();
-        for (const auto& record : registry.installedPlugIns()) plugIns.push_back(record->uuid());
+        if (!registry->registerBundle(app).ok()) std::abort();
+        for (const auto& record : registry->installedPlugIns()) plugIns.push_back(record->uuid());
         if (plugIns.empty()) std::abort();
     }
     corvane::UUID bindUuid(const corvane::UUID& uuid) const {

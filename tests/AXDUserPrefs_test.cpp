@@ -25,7 +25,7 @@ TEST(AXDUserPrefs, ExclusionsAreReadAnewAndOddShapesCountAsNone) {
     };
     for (const auto& c : cases) {
         // Written by another party between two reads; no restart, no cache.
-        ASSERT_FALSE(corvane::prefs::setValue(AXDUserPrefs::kExclusionsKey, c.stored, AXDUserPrefs::kDomain));
+        ASSERT_TRUE(corvane::prefs::setValue(AXDUserPrefs::kExclusionsKey, c.stored, AXDUserPrefs::kDomain).ok());
         EXPECT_EQ(prefs.exclusions(), c.stored);
         EXPECT_EQ(prefs.exclusionPatterns().size(), c.patterns) << c.stored.description();
     }

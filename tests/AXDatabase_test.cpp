@@ -30,8 +30,8 @@ struct Fixture {
 
     Fixture() {
         auto key = corvane::codesign::generateKey();
-        corvane::codesign::writeKeyPair(root / "key", key);
-        corvane::codesign::trustKey(root / "key.pub");
+        EXPECT_TRUE(corvane::codesign::writeKeyPair(root / "key", key).ok());
+        EXPECT_TRUE(corvane::codesign::trustKey(root / "key.pub").ok());
         app = axtest::makeBundle(root.path(), "Example.app", axtest::appInfo("com.example.app"), "/bin/true");
         auto plugIn = [&](const std::string& name, const std::string& id, const Value& ents) {
             std::string p = axtest::makeBundle(
@@ -39,7 +39,7 @@ struct Fixture {
                 axtest::plugInInfo(id, dict({{"KSExtensionProtocol", "P"},
                                              {"KSExtensionAttributes", dict({{"KSExtensionVersion", "1"}})}})),
                 "/bin/true");
-            corvane::codesign::sign(p, key, std::nullopt, ents);
+            EXPECT_TRUE(corvane::codesign::sign(p, key, std::nullopt, ents).ok());
             return p;
         };
         auto_ = plugIn("Auto.appex", "com.example.auto", dict({{"com.corvane.developer.auto-elect-plugin", true}}));
@@ -47,6 +47,17 @@ struct Fixture {
         replacer = plugIn("Replacer.appex", "com.example.replacer",
                           dict({{"com.corvane.developer.replace-plugin", "com.example.plain"}}));
     }
+
+    // The registry of this fixture's platform root, opened on first use.
+    std::shared_ptr<vantry::Registry> registry() {
+        if (!registry_) {
+            auto opened = vantry::Registry::open(vantry::Registry::defaultPath());
+            EXPECT_TRUE(opened) << opened.error().description();
+            registry_ = std::move(*opened);
+        }
+        return registry_;
+    }
+    std::shared_ptr<vantry::Registry> registry_;
 
     static int vantry(const std::vector<std::string>& args) {
         std::vector<std::string> argv{axtest::binary("vantry")};
@@ -79,7 +90,7 @@ struct Delegate : AXDatabaseDelegate {
 TEST(AXDatabase, LookupsBuildRecordsOnceAndServeThemFromTheCache) {
     Fixture f;
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
-    AXDatabase db(nullptr, vantry::Registry::shared());
+    AXDatabase db(nullptr, f.registry());
     db.setCacheLimit(1000000);
     auto plain = db.findPlugInAtPath(f.plain);
     ASSERT_TRUE(plain);
@@ -101,11 +112,11 @@ TEST(AXDatabase, LookupsBuildRecordsOnceAndServeThemFromTheCache) {
     EXPECT_FALSE(db.plugInsWithinApplication(f.root / "Nothing.app"));
     EXPECT_EQ(db.cacheCount(), 3u);
 
-    auto refused = db.addPlugIn(f.root / "not-a-bundle");
-    ASSERT_TRUE(refused);
-    EXPECT_EQ(refused->code, 2);
-    EXPECT_EQ(refused->text, "Vantry failed to register the plug-in");
-    EXPECT_EQ(db.removePlugIn(f.root / "never")->text, "Vantry failed to deregister the plug-in");
+    corvane::Status refused = db.addPlugIn(f.root / "not-a-bundle");
+    ASSERT_FALSE(refused.ok());
+    EXPECT_EQ(refused.error().code, 2);
+    EXPECT_EQ(refused.error().text, "Vantry failed to register the plug-in");
+    EXPECT_EQ(db.removePlugIn(f.root / "never").error().text, "Vantry failed to deregister the plug-in");
 }
 
 TEST(AXDatabase, TheCacheIsClearedWhenAnInsertionFindsItOverItsLimit) {
@@ -117,8 +128,8 @@ TEST(AXDatabase, TheCacheIsClearedWhenAnInsertionFindsItOverItsLimit) {
                                                                     {"KSExtensionAttributes", dict({})}})),
                                            "/bin/true");
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
-    AXDatabase db(nullptr, vantry::Registry::shared());
-    auto records = vantry::Registry::shared().applicationForPath(f.app)->plugIns();
+    AXDatabase db(nullptr, f.registry());
+    auto records = f.registry()->applicationForPath(f.app)->plugIns();
     ASSERT_EQ(records.size(), 4u);
 
     db.setCacheLimit(0);
@@ -140,7 +151,7 @@ TEST(AXDatabase, AutoElectionIsWrittenOnceAndNeverOverridesAnElection) {
     Fixture f;
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
     {
-        AXDatabase db(nullptr, vantry::Registry::shared());
+        AXDatabase db(nullptr, f.registry());
         db.setCacheLimit(1000000);
         auto a = db.findPlugInAtPath(f.auto_);
         ASSERT_TRUE(a);
@@ -161,8 +172,8 @@ TEST(AXDatabase, AutoElectionIsWrittenOnceAndNeverOverridesAnElection) {
         {dict({{"election", -1}}), dict({{"election", -1}})},
     };
     for (const auto& c : cases) {
-        AXDatabase db(nullptr, vantry::Registry::shared());
-        auto record = vantry::Registry::shared().plugInForPath(f.auto_);
+        AXDatabase db(nullptr, f.registry());
+        auto record = f.registry()->plugInForPath(f.auto_);
         auto p = AXDPlugIn::initWithVTData(record);
         db.setAnnotationForPlugIn(Value(), *p);
         db.setAnnotationForPlugIn(c.stored, *p);
@@ -174,7 +185,7 @@ TEST(AXDatabase, AutoElectionIsWrittenOnceAndNeverOverridesAnElection) {
 TEST(AXDatabase, UninstallDropsTheCacheAndTellsTheDelegateOnceWithEveryRecord) {
     Fixture f;
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
-    AXDatabase db(nullptr, vantry::Registry::shared());
+    AXDatabase db(nullptr, f.registry());
     db.setCacheLimit(1000000);
     Delegate delegate;
     db.setDelegate(&delegate);
@@ -221,13 +232,13 @@ TEST(AXDatabaseDeathTest, QueueRulesAreEnforced) {
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
     EXPECT_DEATH(
         {
-            AXDatabase db(nullptr, vantry::Registry::shared());
-            createOffQueue(db, vantry::Registry::shared().plugInForPath(f.plain));
+            AXDatabase db(nullptr, f.registry());
+            createOffQueue(db, f.registry()->plugInForPath(f.plain));
         },
         "must run on this queue \\(queue \"AXDatabase\"\\)");
     EXPECT_DEATH(
         {
-            AXDatabase db(nullptr, vantry::Registry::shared());
+            AXDatabase db(nullptr, f.registry());
             db.databaseQueue().sync([&] { db.findPlugIn(corvane::UUID::random()); });
         },
         "must not run on this queue \\(queue \"AXDatabase\"\\)");

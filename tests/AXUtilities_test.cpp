@@ -37,14 +37,14 @@ TEST(AXUtilities, CompareVersionString) {
 }
 
 TEST(AXUtilities, MakeErrorAndFormat) {
-    auto e = annexa::makeError(4, nullptr);
+    auto e = annexa::makeError(annexa::AXErrorCode::InvalidRequest, nullptr);
     EXPECT_EQ(e.domain, "Annexa");
     EXPECT_EQ(e.code, 4);
     EXPECT_FALSE(e.text);
-    auto f = annexa::makeErrorWithFormat(12, "missing \"%@\" key in Info.plist or SDK",
+    auto f = annexa::makeErrorWithFormat(annexa::AXErrorCode::PlugInUnusable, "missing \"%@\" key in Info.plist or SDK",
                                          std::string("KSExtensionProtocol"));
     EXPECT_EQ(f.text, "missing \"KSExtensionProtocol\" key in Info.plist or SDK");
-    EXPECT_FALSE(annexa::makeErrorWithFormat(12, nullptr).text);
+    EXPECT_FALSE(annexa::makeErrorWithFormat(annexa::AXErrorCode::PlugInUnusable, nullptr).text);
 }
 
 TEST(AXUtilities, DictionaryChanging) {

@@ -47,7 +47,7 @@ TEST(Plist, XmlRoundTripKeepsEveryPropertyListKind) {
 TEST(Plist, OtherReadersAgree) {
     axtest::TempDir dir;
     std::string path = dir / "a.plist";
-    ASSERT_FALSE(plist::writeXMLFile(path, sample()));
+    ASSERT_TRUE(plist::writeXMLFile(path, sample()).ok());
     // plistutil (libplist) converts our XML to the binary form, and we read that back too.
     auto conv = axtest::run({"/usr/bin/plistutil", "-i", path, "-o", dir / "a.bin"});
     ASSERT_EQ(conv.status, 0) << conv.err;
@@ -119,9 +119,9 @@ TEST(Plist, ValueWithoutPropertyListFormWritesNothing) {
     axtest::writeFile(path, "old");
     for (const Value& bad : {Value(corvane::UUID::random()), corvane::dict({{"a", Value()}}),
                              Value("bell \x07")}) {
-        auto err = plist::writeXMLFile(path, corvane::dict({{"v", bad}}));
-        ASSERT_TRUE(err);
-        EXPECT_EQ(err->domain, plist::kPlistErrorDomain);
+        corvane::Status written = plist::writeXMLFile(path, corvane::dict({{"v", bad}}));
+        ASSERT_FALSE(written.ok());
+        EXPECT_EQ(written.error().domain, plist::kPlistErrorDomain);
         EXPECT_EQ(axtest::readFile(path), "old");
     }
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.path()), {}), 1);
@@ -138,8 +138,8 @@ TEST(Plist, FailedWriteLeavesTheOldFileAndNoTemporary) {
         signal(SIGXFSZ, SIG_IGN);
         struct rlimit lim {4096, 4096};
         setrlimit(RLIMIT_FSIZE, &lim);
-        auto err = plist::writeFileAtomically(path, std::string(100000, 'x'));
-        _exit(err && err->code == corvane::kFileWriteUnknown ? 0 : 1);
+        corvane::Status written = plist::writeFileAtomically(path, std::string(100000, 'x'));
+        _exit(!written.ok() && written.error().code == corvane::kFileWriteUnknown ? 0 : 1);
     }
     int status = 0;
     waitpid(pid, &status, 0);
@@ -149,7 +149,7 @@ TEST(Plist, FailedWriteLeavesTheOldFileAndNoTemporary) {
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.path()), {}), 1);
     // And a successful write replaces it whole, with the process's default permissions.
     mode_t old = umask(022);
-    ASSERT_FALSE(plist::writeFileAtomically(path, "new"));
+    ASSERT_TRUE(plist::writeFileAtomically(path, "new").ok());
     umask(old);
     EXPECT_EQ(axtest::readFile(path), "new");
     struct stat st {};

@@ -12,13 +12,13 @@ TEST(Prefs, EveryReadSeesTheFileAsItIsNow) {
     const std::string domain = "com.corvane.annexa.userprefs";
     EXPECT_TRUE(prefs::copyValue("exclusions", domain).isNull());
     Value exclusions(corvane::Array{corvane::dict({{"KSExtensionIdentifier", "com.example.a"}})});
-    ASSERT_FALSE(prefs::setValue("exclusions", exclusions, domain));
+    ASSERT_TRUE(prefs::setValue("exclusions", exclusions, domain).ok());
     EXPECT_EQ(prefs::copyValue("exclusions", domain), exclusions);
     // Another writer replaces the file behind our back: the next read sees it.
-    ASSERT_FALSE(corvane::plist::writeXMLFile(prefs::domainPath(domain),
-                                              corvane::dict({{"exclusions", "not an array"}})));
+    ASSERT_TRUE(corvane::plist::writeXMLFile(prefs::domainPath(domain),
+                                              corvane::dict({{"exclusions", "not an array"}})).ok());
     EXPECT_EQ(prefs::copyValue("exclusions", domain), Value("not an array"));
-    ASSERT_FALSE(prefs::setValue("exclusions", Value(), domain));
+    ASSERT_TRUE(prefs::setValue("exclusions", Value(), domain).ok());
     EXPECT_TRUE(prefs::copyValue("exclusions", domain).isNull());
     // A file that is no property list reads as no values at all.
     axtest::writeFile(prefs::domainPath(domain), "garbage");
@@ -28,15 +28,15 @@ TEST(Prefs, EveryReadSeesTheFileAsItIsNow) {
 
 TEST(Prefs, SearchListAndUnusableDomains) {
     axtest::PlatformRoot root;
-    ASSERT_FALSE(prefs::setValue("k", 1, "a"));
-    ASSERT_FALSE(prefs::setValue("k", 2, "b"));
+    ASSERT_TRUE(prefs::setValue("k", 1, "a").ok());
+    ASSERT_TRUE(prefs::setValue("k", 2, "b").ok());
     prefs::UserDefaults defaults;
     defaults.addSuite("b");
     defaults.addSuite("a");
     EXPECT_EQ(defaults.objectForKey("k"), Value(2));
     EXPECT_TRUE(defaults.objectForKey("missing").isNull());
     for (const char* bad : {"", "../x", ".hidden", "a/b"}) {
-        EXPECT_TRUE(prefs::setValue("k", 1, bad)) << bad;
+        EXPECT_FALSE(prefs::setValue("k", 1, bad).ok()) << bad;
         EXPECT_TRUE(prefs::copyValue("k", bad).isNull()) << bad;
     }
 }

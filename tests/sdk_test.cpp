@@ -86,9 +86,9 @@ TEST(Sdk, ResolveMergesTheRegisteredDefinitionAndCanonicalizes) {
     Value definition = dict({{"KSExtension", dict({{"KSExtensionProtocol", "PickerProtocol"},
                                                    {"KSExtensionAttributes",
                                                     dict({{"KSExtensionPointName", "Picker"}})}})}});
-    ASSERT_FALSE(corvane::layout::makeDirectories(sdk::sdkDirectory(), 0755));
-    ASSERT_FALSE(corvane::plist::writeXMLFile(sdk::sdkDirectory() + "/com.corvane.picker.plist",
-                                              definition));
+    ASSERT_TRUE(corvane::layout::makeDirectories(sdk::sdkDirectory(), 0755).ok());
+    ASSERT_TRUE(corvane::plist::writeXMLFile(sdk::sdkDirectory() + "/com.corvane.picker.plist",
+                                              definition).ok());
     struct Case {
         const char* name;
         Value info;

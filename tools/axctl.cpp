@@ -55,14 +55,10 @@ int finish(const corvane::rpx::Reply& reply, const std::string& service) {
         std::fprintf(stderr, "axctl: cannot reach the daemon at %s: %s\n", service.c_str(), reply.description().c_str());
         return kUnavailable;
     }
-    try {
-        if (auto err = AXDaemonClient::errorInReply(reply)) {
-            std::fprintf(stderr, "axctl: %s (error %lld)\n", err->description().c_str(),
-                         static_cast<long long>(err->code));
-            return 1;
-        }
-    } catch (const std::logic_error& e) {
-        std::fprintf(stderr, "axctl: %s\n", e.what());
+    corvane::Status status = AXDaemonClient::errorInReply(reply);
+    if (!status.ok()) {
+        std::fprintf(stderr, "axctl: %s (error %lld)\n", status.error().description().c_str(),
+                     static_cast<long long>(status.error().code));
         return 1;
     }
     return 0;

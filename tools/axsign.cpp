@@ -56,13 +56,13 @@ int main(int argc, char** argv) {
     }
     if (command == "keygen") {
         if (args.size() != 2 || args[0] != "--out") return fail("keygen needs --out KEY");
-        if (auto err = codesign::writeKeyPair(args[1], codesign::generateKey())) return fail(err->description());
+        if (Status err = codesign::writeKeyPair(args[1], codesign::generateKey()); !err.ok()) return fail(err.error().description());
         std::printf("wrote %s and %s.pub\n", args[1].c_str(), args[1].c_str());
         return 0;
     }
     if (command == "trust") {
         if (args.size() != 1) return fail("trust needs one public key file");
-        if (auto err = codesign::trustKey(args[0])) return fail(err->description());
+        if (Status err = codesign::trustKey(args[0]); !err.ok()) return fail(err.error().description());
         std::printf("trusted %s in %s\n", args[0].c_str(), codesign::trustDirectory().c_str());
         return 0;
     }
@@ -89,7 +89,7 @@ int main(int argc, char** argv) {
         if (key.empty() || path.empty()) return fail("sign needs --key KEY and a PATH");
         auto keys = codesign::readSecretKey(key);
         if (!keys) return fail(keys.error().description());
-        if (auto err = codesign::sign(path, *keys, identifier, entitlements)) return fail(err->description());
+        if (Status err = codesign::sign(path, *keys, identifier, entitlements); !err.ok()) return fail(err.error().description());
         std::printf("signed %s\n", path.c_str());
         return 0;
     }

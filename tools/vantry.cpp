@@ -154,10 +154,10 @@ int main(int argc, char** argv) {
         }
         int status = 0;
         for (const auto& path : operands) {
-            MaybeError err = command == "register" ? registry->registerBundle(path, placeholder)
-                                                   : registry->unregisterBundle(path);
-            if (err) {
-                std::fprintf(stderr, "vantry: %s\n", err->description().c_str());
+            Status done = command == "register" ? registry->registerBundle(path, placeholder)
+                                                : registry->unregisterBundle(path);
+            if (!done.ok()) {
+                std::fprintf(stderr, "vantry: %s\n", done.error().description().c_str());
                 status = 1;
             } else {
                 std::printf("%sed %s\n", command.c_str(), path.c_str());

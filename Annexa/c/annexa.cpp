@@ -1,10 +1,10 @@
 // The C interface over AXDaemonClient: text in, text out, codes as return values. Nothing here
-// throws into C: a reply that breaks the protocol becomes code 4 with the library's text.
+// throws into C: a reply that breaks the protocol is code 4 with the library's text.
 #include "Annexa/c/annexa.h"
 
 #include <cstdlib>
 #include <cstring>
-#include <stdexcept>
+#include <new>
 #include <string>
 #include <vector>
 
@@ -33,11 +33,8 @@ int64_t report(int64_t code, const std::string& text, char** errorText) {
 }
 
 int64_t finish(const Reply& reply, char** errorText) {
-    try {
-        if (auto error = AXDaemonClient::errorInReply(reply)) return report(error->code, error->description(), errorText);
-    } catch (const std::logic_error& e) {
-        return report(4, e.what(), errorText);
-    }
+    corvane::Status status = AXDaemonClient::errorInReply(reply);
+    if (!status.ok()) return report(status.error().code, status.error().description(), errorText);
     return report(0, {}, errorText);
 }
 
@@ -71,7 +68,7 @@ int64_t annexa_send(annexa_client* client, const char* message, char** reply) {
     if (!value) return ANNEXA_EINVAL;
     AXDaemonClient& c = client->client;
     Reply r = c.wait([&](AXDaemonClient::Completion done) { c.send(*value, std::move(done)); });
-    if (!r.ok()) return 4;
+    if (!r.ok()) return annexa::errorCodeValue(annexa::AXErrorCode::InvalidRequest);
     *reply = copyText(r.value.description());
     return 0;
 }

@@ -256,8 +256,9 @@ KeyPair generateKey() {
     return k;
 }
 
-MaybeError writeKeyPair(const std::string& path, const KeyPair& keys) {
-    if (auto err = plist::writeFileAtomically(path, hex(keys.secretKey) + "\n", 0600)) return err;
+Status writeKeyPair(const std::string& path, const KeyPair& keys) {
+    if (Status written = plist::writeFileAtomically(path, hex(keys.secretKey) + "\n", 0600); !written.ok())
+        return written;
     return plist::writeFileAtomically(path + ".pub", hex(keys.publicKey) + "\n", 0644);
 }
 
@@ -281,15 +282,15 @@ Result<Bytes> readPublicKey(const std::string& path) {
 
 std::string trustDirectory() { return layout::configDir() + "/trust.d"; }
 
-MaybeError trustKey(const std::string& publicKeyPath) {
+Status trustKey(const std::string& publicKeyPath) {
     auto key = readPublicKey(publicKeyPath);
     if (!key) return key.error();
-    if (auto err = layout::makeDirectories(trustDirectory(), 0755)) return err;
+    if (Status made = layout::makeDirectories(trustDirectory(), 0755); !made.ok()) return made;
     return plist::writeFileAtomically(trustDirectory() + "/" + hex(*key).substr(0, 16) + ".pub",
                                       hex(*key) + "\n", 0644);
 }
 
-MaybeError sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
+Status sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
                 const Value& entitlements) {
     if (!sodiumReady()) return signError("no crypto library");
     std::string exe = path;
@@ -324,7 +325,7 @@ MaybeError sign(const std::string& path, const KeyPair& keys, std::optional<std:
                        {"signer", Value::data(keys.publicKey)},
                        {"signature", Value::data(signature)}});
     std::string target = signaturePath(path);
-    if (auto err = layout::makeDirectories(target.substr(0, target.rfind('/')), 0755)) return err;
+    if (Status made = layout::makeDirectories(target.substr(0, target.rfind('/')), 0755); !made.ok()) return made;
     return plist::writeXMLFile(target, file, 0644);
 }
 

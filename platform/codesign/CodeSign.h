@@ -66,16 +66,16 @@ struct KeyPair {
 
 KeyPair generateKey();
 // Writes KEY (secret, mode 0600) and KEY.pub.
-MaybeError writeKeyPair(const std::string& path, const KeyPair& keys);
+Status writeKeyPair(const std::string& path, const KeyPair& keys);
 Result<KeyPair> readSecretKey(const std::string& path);
 Result<Bytes> readPublicKey(const std::string& path);
 std::string trustDirectory();
 // Installs a public key file in the trust directory.
-MaybeError trustKey(const std::string& publicKeyPath);
+Status trustKey(const std::string& publicKeyPath);
 
 // Signs a bundle (its executable) or a bare executable. Without an identifier, the bundle's
 // KFBundleIdentifier or the executable's file name is used.
-MaybeError sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
+Status sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
                 const Value& entitlements);
 
 // Where the signature of `path` (a bundle or an executable) lives.

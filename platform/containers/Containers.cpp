@@ -17,8 +17,8 @@ Result<std::string> lookupDataContainer(int containerClass, const std::string& i
     struct stat st {};
     if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path;
     if (!create) return Error{kErrorDomain, kNotFound, "no container at " + path};
-    if (auto err = layout::makeDirectories(path, 0700))
-        return Error{kErrorDomain, kCannotCreate, "cannot create " + path + ": " + err->description()};
+    if (Status made = layout::makeDirectories(path, 0700); !made.ok())
+        return Error{kErrorDomain, kCannotCreate, "cannot create " + path + ": " + made.error().description()};
     return path;
 }
 

@@ -62,7 +62,7 @@ std::string configDir() { return underRoot("/etc/corvane"); }
 std::string sharedDataDir() { return underRoot("/usr/share/corvane"); }
 std::string systemRoot() { return underRoot("/System"); }
 
-MaybeError makeDirectories(const std::string& path, mode_t mode) {
+Status makeDirectories(const std::string& path, mode_t mode) {
     if (path.empty()) return Error::posix(ENOENT, path);
     std::string partial;
     size_t pos = 0;
@@ -77,7 +77,7 @@ MaybeError makeDirectories(const std::string& path, mode_t mode) {
     struct stat st {};
     if (::stat(path.c_str(), &st) != 0) return Error::posix(errno, path);
     if (!S_ISDIR(st.st_mode)) return Error::posix(ENOTDIR, path);
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace corvane::layout

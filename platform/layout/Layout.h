@@ -42,6 +42,6 @@ std::string underRoot(const std::string& absolutePath);
 
 // Creates a directory and its missing parents with the given mode (existing ones are left as they
 // are). Returns the errno value on failure.
-MaybeError makeDirectories(const std::string& path, mode_t mode);
+Status makeDirectories(const std::string& path, mode_t mode);
 
 }  // namespace corvane::layout

@@ -29,10 +29,10 @@ Error badName(const std::string& name) {
 
 }  // namespace
 
-MaybeError post(const std::string& name) {
+Status post(const std::string& name) {
     if (!validName(name)) return badName(name);
     std::string dir = directory();
-    if (auto err = layout::makeDirectories(dir, 0700)) return err;
+    if (Status made = layout::makeDirectories(dir, 0700); !made.ok()) return made;
     std::string path = dir + "/" + name;
     int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd < 0) return Error::posix(errno, path);
@@ -51,7 +51,7 @@ MaybeError post(const std::string& name) {
     int err = n == static_cast<ssize_t>(sizeof counter) ? 0 : errno;
     ::close(fd);  // closing a written file is what observers see (IN_CLOSE_WRITE)
     if (err) return Error::posix(err, path);
-    return std::nullopt;
+    return {};
 }
 
 uint64_t count(const std::string& name) {
@@ -71,7 +71,7 @@ Result<std::unique_ptr<Observer>> Observer::observe(const std::string& name,
                                                     std::function<void()> handler) {
     if (!validName(name)) return badName(name);
     std::string dir = directory();
-    if (auto err = layout::makeDirectories(dir, 0700)) return *err;
+    if (Status made = layout::makeDirectories(dir, 0700); !made.ok()) return made.error();
     int in = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
     if (in < 0) return Error::posix(errno, "inotify_init1");
     if (inotify_add_watch(in, dir.c_str(), IN_CLOSE_WRITE | IN_MOVED_TO) < 0) {

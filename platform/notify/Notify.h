@@ -21,7 +21,7 @@
 namespace corvane::notify {
 
 // Posts the notification `name` (any text without '/' that is not "." or ".."; others are refused).
-MaybeError post(const std::string& name);
+Status post(const std::string& name);
 
 // How many times `name` has been posted under the current platform root (0 when never).
 uint64_t count(const std::string& name);

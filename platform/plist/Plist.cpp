@@ -68,7 +68,7 @@ void appendBase64(std::string& out, const Bytes& bytes) {
     }
 }
 
-MaybeError writeNode(std::string& out, const Value& v, int depth) {
+Status writeNode(std::string& out, const Value& v, int depth) {
     if (depth > kMaxDepth) return plistError(kPlistWriteInvalid, "value nested too deeply");
     std::string indent(static_cast<size_t>(depth), '\t');
     char buf[64];
@@ -130,7 +130,7 @@ MaybeError writeNode(std::string& out, const Value& v, int depth) {
             }
             out += indent + "<array>\n";
             for (const Value& e : *v.asArray())
-                if (auto err = writeNode(out, e, depth + 1)) return err;
+                if (Status err = writeNode(out, e, depth + 1); !err.ok()) return err;
             out += indent + "</array>\n";
             break;
         case K::Dictionary:
@@ -145,7 +145,7 @@ MaybeError writeNode(std::string& out, const Value& v, int depth) {
                 out += indent + "\t<key>";
                 appendEscaped(out, key);
                 out += "</key>\n";
-                if (auto err = writeNode(out, e, depth + 1)) return err;
+                if (Status err = writeNode(out, e, depth + 1); !err.ok()) return err;
             }
             out += indent + "</dict>\n";
             break;
@@ -156,7 +156,7 @@ MaybeError writeNode(std::string& out, const Value& v, int depth) {
                                                       Value::kindName(v.kind()) +
                                                       " has no property-list form");
     }
-    return std::nullopt;
+    return {};
 }
 
 std::string directoryOf(const std::string& path) {
@@ -205,12 +205,12 @@ Result<std::string> toXML(const Value& value) {
     std::string out =
         "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
         "<plist version=\"1.0\">\n";
-    if (auto err = writeNode(out, value, 0)) return *err;
+    if (Status err = writeNode(out, value, 0); !err.ok()) return err.error();
     out += "</plist>\n";
     return out;
 }
 
-MaybeError writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
     std::string dir = directoryOf(path);
     std::string base = path.substr(path.rfind('/') == std::string::npos ? 0 : path.rfind('/') + 1);
     std::string tmp = dir + "/." + base + ".XXXXXX";
@@ -249,10 +249,10 @@ MaybeError writeFileAtomically(const std::string& path, std::string_view bytes, 
         (void)fsync(dfd);  // the rename is done; a failed directory sync cannot be undone
         ::close(dfd);
     }
-    return std::nullopt;
+    return {};
 }
 
-MaybeError writeXMLFile(const std::string& path, const Value& value, mode_t mode) {
+Status writeXMLFile(const std::string& path, const Value& value, mode_t mode) {
     auto xml = toXML(value);
     if (!xml) return xml.error();
     return writeFileAtomically(path, *xml, mode);

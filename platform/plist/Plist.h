@@ -45,9 +45,9 @@ Result<std::string> readWholeFile(const std::string& path);
 // a mix, also across a crash: a temporary file beside the target is written in full, fsynced,
 // renamed over the target, and the directory is fsynced. A failure leaves the old file as it was
 // and no temporary file behind. The new file gets `mode` (masked by the umask).
-MaybeError writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666);
+Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666);
 
 // toXML, then writeFileAtomically.
-MaybeError writeXMLFile(const std::string& path, const Value& value, mode_t mode = 0666);
+Status writeXMLFile(const std::string& path, const Value& value, mode_t mode = 0666);
 
 }  // namespace corvane::plist

@@ -34,9 +34,9 @@ std::string domainPath(const std::string& domain) {
     return layout::userConfigDir() + "/preferences/ByHost/" + domain + "." + hostName() + ".plist";
 }
 
-MaybeError synchronize(const std::string& domain) {
+Status synchronize(const std::string& domain) {
     if (!usableDomain(domain)) return Error::posix(EINVAL, "preference domain " + domain);
-    return std::nullopt;
+    return {};
 }
 
 Value copyValue(const std::string& key, const std::string& domain) {
@@ -44,10 +44,10 @@ Value copyValue(const std::string& key, const std::string& domain) {
     return readDomain(domain)[key];
 }
 
-MaybeError setValue(const std::string& key, const Value& value, const std::string& domain) {
+Status setValue(const std::string& key, const Value& value, const std::string& domain) {
     if (!usableDomain(domain)) return Error::posix(EINVAL, "preference domain " + domain);
     std::string path = domainPath(domain);
-    if (auto err = layout::makeDirectories(path.substr(0, path.rfind('/')), 0700)) return err;
+    if (Status made = layout::makeDirectories(path.substr(0, path.rfind('/')), 0700); !made.ok()) return made;
     Value current = readDomain(domain);
     Dictionary d = *current.asDictionary();
     if (value.isNull()) {

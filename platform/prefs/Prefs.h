@@ -17,13 +17,13 @@ std::string domainPath(const std::string& domain);
 
 // Re-reads the domain from storage. Reads never cache, so this only exists for callers that
 // state the intent; it checks that the domain name is usable.
-MaybeError synchronize(const std::string& domain);
+Status synchronize(const std::string& domain);
 
 // The value of `key` in `domain`, or null when it is not set (or the file cannot be read).
 Value copyValue(const std::string& key, const std::string& domain);
 
 // Sets (or, with a null value, removes) one key of a domain.
-MaybeError setValue(const std::string& key, const Value& value, const std::string& domain);
+Status setValue(const std::string& key, const Value& value, const std::string& domain);
 
 // A per-process view of settings over a search list of domains: a key is looked up in each domain
 // in the order they were added.

@@ -819,7 +819,7 @@ Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, disp
     if (name.empty() || name.find('/') != std::string::npos || name[0] == '.')
         return Error::posix(EINVAL, "invalid endpoint name: " + name);
     std::string dir = layout::runtimeDir() + "/rpx";
-    if (auto err = layout::makeDirectories(dir, 0700)) return *err;
+    if (Status made = layout::makeDirectories(dir, 0700); !made.ok()) return made.error();
     std::string path = endpointPath(name);
     struct sockaddr_un addr {};
     addr.sun_family = AF_UNIX;

@@ -43,7 +43,7 @@ std::optional<Bytes> secretKey() {
             if (n == static_cast<ssize_t>(key.size())) return key;
             return std::nullopt;
         }
-        if (layout::makeDirectories(path.substr(0, path.rfind('/')), 0700)) return std::nullopt;
+        if (!layout::makeDirectories(path.substr(0, path.rfind('/')), 0700).ok()) return std::nullopt;
         Bytes key(crypto_auth_KEYBYTES);
         crypto_auth_keygen(key.data());
         std::string tmp = path + ".new." + std::to_string(getpid());

@@ -221,18 +221,32 @@ inline constexpr int64_t kFileNoPermission = 257;
 inline constexpr int64_t kFileNoSuchFile = 260;
 inline constexpr int64_t kFileWriteUnknown = 512;
 
-// nullopt on success, else the error.
-using MaybeError = std::optional<Error>;
+// The outcome of an operation that gives nothing back: ok, or the error that stopped it. Failures
+// are values throughout: nothing is thrown.
+class [[nodiscard]] Status {
+public:
+    Status() = default;  // ok
+    Status(Error error) : error_(std::move(error)) {}  // NOLINT(google-explicit-constructor)
 
-// A value or the error that kept it from being made.
+    bool ok() const { return !error_.has_value(); }
+    // Only on a failed status.
+    const Error& error() const { return *error_; }
+
+private:
+    std::optional<Error> error_;
+};
+
+// A value or the error that kept it from being made; true (ok()) when it holds the value.
 template <class T>
-class Result {
+class [[nodiscard]] Result {
 public:
     Result(T value) : v_(std::move(value)) {}   // NOLINT(google-explicit-constructor)
     Result(Error error) : v_(std::move(error)) {}  // NOLINT(google-explicit-constructor)
 
     bool ok() const { return v_.index() == 0; }
     explicit operator bool() const { return ok(); }
+    // The status alone, for callers that pass a failure on.
+    Status status() const { return ok() ? Status() : Status(error()); }
     T& value() & { return std::get<0>(v_); }
     const T& value() const& { return std::get<0>(v_); }
     T&& value() && { return std::get<0>(std::move(v_)); }

@@ -278,23 +278,23 @@ public:
         return Error{kDomain, rc, text};
     }
 
-    MaybeError exec(const char* sql) {
+    Status exec(const char* sql) {
         char* msg = nullptr;
         if (sqlite3_exec(db_, sql, nullptr, nullptr, &msg) != SQLITE_OK) {
             sqlite3_free(msg);
             return sqlError(sql);
         }
-        return std::nullopt;
+        return {};
     }
 
-    MaybeError migrate() {
-        if (auto err = exec("CREATE TABLE IF NOT EXISTS meta (key TEXT PRIMARY KEY, value TEXT)")) return err;
+    Status migrate() {
+        if (Status err = exec("CREATE TABLE IF NOT EXISTS meta (key TEXT PRIMARY KEY, value TEXT)"); !err.ok()) return err;
         Statement q(db_, "SELECT value FROM meta WHERE key = 'schema'");
         if (!q) return sqlError("reading the schema version");
         int version = q.step() == SQLITE_ROW ? std::atoi(q.text(0).c_str()) : 0;
         if (version > kSchemaVersion)
             return refusal("registry database " + path_ + " is of a newer release (schema " + std::to_string(version) + ")");
-        if (version == kSchemaVersion) return std::nullopt;
+        if (version == kSchemaVersion) return {};
         // Version 0 -> 1: the first schema.
         return exec(
             "BEGIN;"
@@ -434,7 +434,7 @@ public:
         return r;
     }
 
-    MaybeError insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint) {
+    Status insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint) {
         Statement ins(db_,
                       "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
                       " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
@@ -464,11 +464,11 @@ public:
         }
         ins.bind(13, fingerprint);
         if (ins.step() != SQLITE_DONE) return sqlError("recording a plug-in");
-        return std::nullopt;
+        return {};
     }
 
-    MaybeError journal(int kind, const std::vector<PlugInRecordPtr>& records) {
-        if (records.empty()) return std::nullopt;
+    Status journal(int kind, const std::vector<PlugInRecordPtr>& records) {
+        if (records.empty()) return {};
         Array list;
         for (const auto& r : records) list.push_back(r->serialize());
         auto xml = plist::toXML(Value(std::move(list)));
@@ -481,7 +481,7 @@ public:
         Statement prune(db_, "DELETE FROM journal WHERE at < ?");
         prune.bind(1, Date::now().wholeSeconds() - kJournalKeepSeconds);
         prune.step();
-        return std::nullopt;
+        return {};
     }
 
     // Existing plug-ins at the given condition: path -> (uuid, fingerprint).
@@ -500,11 +500,11 @@ public:
         return recordFromRow(q.text(0), q.blob(1), q.text(2));
     }
 
-    MaybeError deletePlugIn(const std::string& uuid) {
+    Status deletePlugIn(const std::string& uuid) {
         Statement del(db_, "DELETE FROM plugins WHERE uuid = ?");
         del.bind(1, uuid);
         if (del.step() != SQLITE_DONE) return sqlError("removing a plug-in");
-        return std::nullopt;
+        return {};
     }
 
     void wake() {
@@ -524,34 +524,34 @@ public:
 
     // Runs `body` in one write transaction; on success records journal entries, remembers the
     // registered paths and wakes observers.
-    MaybeError write(const std::function<MaybeError(std::vector<PlugInRecordPtr>&, std::vector<PlugInRecordPtr>&)>& body) {
+    Status write(const std::function<Status(std::vector<PlugInRecordPtr>&, std::vector<PlugInRecordPtr>&)>& body) {
         std::lock_guard lock(mutex_);
         checkFreshness();
-        if (auto err = exec("BEGIN IMMEDIATE")) return err;
+        if (Status err = exec("BEGIN IMMEDIATE"); !err.ok()) return err;
         std::vector<PlugInRecordPtr> installed;
         std::vector<PlugInRecordPtr> uninstalled;
-        MaybeError err = body(installed, uninstalled);
-        if (!err) err = journal(kUninstall, uninstalled);
-        if (!err) err = journal(kInstall, installed);
-        if (err || (installed.empty() && uninstalled.empty() && !changedOther_)) {
-            exec("ROLLBACK");
+        Status status = body(installed, uninstalled);
+        if (status.ok()) status = journal(kUninstall, uninstalled);
+        if (status.ok()) status = journal(kInstall, installed);
+        if (!status.ok() || (installed.empty() && uninstalled.empty() && !changedOther_)) {
+            (void)exec("ROLLBACK");
             changedOther_ = false;
-            return err;
+            return status;
         }
         changedOther_ = false;
-        if (auto commitErr = exec("COMMIT")) {
-            exec("ROLLBACK");
-            return commitErr;
+        if (Status committed = exec("COMMIT"); !committed.ok()) {
+            (void)exec("ROLLBACK");
+            return committed;
         }
         byUUID_.clear();
         apps_.clear();
         rememberPaths();
         wake();
-        return std::nullopt;
+        return {};
     }
     bool changedOther_ = false;  // a write that changed rows without plug-in events (an app alone)
 
-    MaybeError registerBundle(const std::string& given, bool placeholder) {
+    Status registerBundle(const std::string& given, bool placeholder) {
         auto path = canonical(given);
         struct stat st {};
         if (!path || ::stat(path->c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return refusal("not a bundle: " + given);
@@ -561,17 +561,17 @@ public:
         if ((*info)["KSExtension"].isDictionary()) {
             auto scanned = scanPlugIn(*path);
             if (!scanned) return scanned.error();
-            return write([&](auto& installed, auto& uninstalled) -> MaybeError {
+            return write([&](auto& installed, auto& uninstalled) -> Status {
                 auto old = existing("path = ?", *path);
-                if (!old.empty() && old.begin()->second.second == scanned->fingerprint) return std::nullopt;
+                if (!old.empty() && old.begin()->second.second == scanned->fingerprint) return {};
                 if (!old.empty()) {
                     if (auto r = recordByUUIDText(old.begin()->second.first)) uninstalled.push_back(r);
-                    if (auto err = deletePlugIn(old.begin()->second.first)) return err;
+                    if (Status err = deletePlugIn(old.begin()->second.first); !err.ok()) return err;
                 }
                 auto r = makeRecord(*scanned, nullptr);
-                if (auto err = insertPlugIn(r, "", scanned->fingerprint)) return err;
+                if (Status err = insertPlugIn(r, "", scanned->fingerprint); !err.ok()) return err;
                 installed.push_back(r);
-                return std::nullopt;
+                return {};
             });
         }
 
@@ -606,7 +606,7 @@ public:
         if (::stat(receipt.c_str(), &st) == 0 && S_ISREG(st.st_mode)) appRecord.emplace("receipt", receipt);
         std::string appFingerprint = Value(appRecord).description();
 
-        return write([&](auto& installed, auto& uninstalled) -> MaybeError {
+        return write([&](auto& installed, auto& uninstalled) -> Status {
             Statement old(db_, "SELECT fingerprint FROM applications WHERE path = ?");
             old.bind(1, *path);
             bool appChanged = old.step() != SQLITE_ROW || old.text(0) != appFingerprint;
@@ -638,27 +638,27 @@ public:
                 });
                 if (same != scanned.end()) continue;
                 if (auto r = recordByUUIDText(row.first)) uninstalled.push_back(r);
-                if (auto err = deletePlugIn(row.first)) return err;
+                if (Status err = deletePlugIn(row.first); !err.ok()) return err;
             }
             for (const auto& s : scanned) {
                 auto it = before.find(s.path);
                 if (it != before.end() && it->second.second == s.fingerprint && !appChanged) continue;
                 auto r = makeRecord(s, app);
-                if (auto err = insertPlugIn(r, *path, s.fingerprint)) {
+                if (Status err = insertPlugIn(r, *path, s.fingerprint); !err.ok()) {
                     if (sqlite3_errcode(db_) == SQLITE_CONSTRAINT)
                         return refusal(s.path + " is already registered elsewhere");
                     return err;
                 }
                 installed.push_back(r);
             }
-            return std::nullopt;
+            return {};
         });
     }
 
-    MaybeError unregisterBundle(const std::string& given) {
+    Status unregisterBundle(const std::string& given) {
         std::vector<std::string> candidates{given};
         if (auto p = canonical(given); p && *p != given) candidates.insert(candidates.begin(), *p);
-        return write([&](auto&, auto& uninstalled) -> MaybeError {
+        return write([&](auto&, auto& uninstalled) -> Status {
             for (const auto& path : candidates) {
                 auto plugins = existing("app_path = ?", path);
                 Statement app(db_, "SELECT 1 FROM applications WHERE path = ?");
@@ -668,7 +668,7 @@ public:
                 if (!isApp && plugins.empty()) continue;
                 for (const auto& [p, row] : plugins) {
                     if (auto r = recordByUUIDText(row.first)) uninstalled.push_back(r);
-                    if (auto err = deletePlugIn(row.first)) return err;
+                    if (Status err = deletePlugIn(row.first); !err.ok()) return err;
                 }
                 if (isApp) {
                     Statement del(db_, "DELETE FROM applications WHERE path = ?");
@@ -676,7 +676,7 @@ public:
                     if (del.step() != SQLITE_DONE) return sqlError("removing an application");
                     changedOther_ = true;
                 }
-                return std::nullopt;
+                return {};
             }
             return refusal("not registered: " + given);
         });
@@ -756,16 +756,16 @@ public:
 
 Result<std::shared_ptr<Store>> Store::open(const std::string& path) {
     auto store = std::make_shared<Store>(path);
-    if (auto err = layout::makeDirectories(store->directory(), 0755)) return *err;
+    if (Status err = layout::makeDirectories(store->directory(), 0755); !err.ok()) return err.error();
     if (sqlite3_open_v2(path.c_str(), &store->db_,
                         SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_FULLMUTEX, nullptr) != SQLITE_OK)
         return store->sqlError("opening the registry");
     // A writer in another process holds the lock for a few milliseconds at most; wait that long,
     // boundedly.
     sqlite3_busy_timeout(store->db_, 5000);
-    if (auto err = store->exec("PRAGMA journal_mode=WAL")) return *err;
-    if (auto err = store->exec("PRAGMA foreign_keys=ON")) return *err;
-    if (auto err = store->migrate()) return *err;
+    if (Status err = store->exec("PRAGMA journal_mode=WAL"); !err.ok()) return err.error();
+    if (Status err = store->exec("PRAGMA foreign_keys=ON"); !err.ok()) return err.error();
+    if (Status err = store->migrate(); !err.ok()) return err.error();
     return store;
 }
 
@@ -806,19 +806,6 @@ Registry::Registry(std::shared_ptr<Store> store) : store_(std::move(store)) {}
 Registry::~Registry() = default;
 
 std::string Registry::defaultPath() { return layout::stateDir() + "/vantry/registry.db"; }
-
-Registry& Registry::shared() {
-    static Registry* registry = [] {
-        auto r = open(defaultPath());
-        if (!r) {
-            log::error(vtLog(), "cannot open the application registry: %{public}@", r.error().description());
-            std::fprintf(stderr, "vantry: %s\n", r.error().description().c_str());
-            std::abort();
-        }
-        return r->release();  // lives for the process's life
-    }();
-    return *registry;
-}
 
 Result<std::unique_ptr<Registry>> Registry::open(const std::string& path) {
     auto store = Store::open(path);
@@ -898,11 +885,11 @@ std::vector<PlugInRecordPtr> Registry::query(
     return out;
 }
 
-MaybeError Registry::registerBundle(const std::string& path, bool placeholder) {
+Status Registry::registerBundle(const std::string& path, bool placeholder) {
     return store_->registerBundle(path, placeholder);
 }
 
-MaybeError Registry::unregisterBundle(const std::string& path) { return store_->unregisterBundle(path); }
+Status Registry::unregisterBundle(const std::string& path) { return store_->unregisterBundle(path); }
 
 std::vector<std::string> Registry::registeredPaths() {
     std::lock_guard lock(store_->mutex_);
@@ -947,7 +934,7 @@ Result<std::vector<std::string>> Registry::rebuild(const std::string& path) {
             std::string p = list->substr(start, end == std::string::npos ? std::string::npos : end - start);
             start = end == std::string::npos ? list->size() : end + 1;
             if (p.empty()) continue;
-            if ((*fresh)->registerBundle(p)) failed.push_back(p);
+            if (!(*fresh)->registerBundle(p).ok()) failed.push_back(p);
         }
     }
     return failed;

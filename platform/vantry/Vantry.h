@@ -111,9 +111,8 @@ class Store;
 
 class Registry {
 public:
-    // The registry of the current platform root, opened once per process.
-    static Registry& shared();
-    // A registry over the database at `path` (created when missing).
+    // A registry over the database at `path` (created when missing). Each opening is independent;
+    // a program opens the registry of its platform root at defaultPath() and hands it to its users.
     static Result<std::unique_ptr<Registry>> open(const std::string& path);
     // <root>/var/lib/corvane/vantry/registry.db
     static std::string defaultPath();
@@ -132,8 +131,8 @@ public:
     // Registers an application (with its plug-ins) or a stand-alone plug-in. An unchanged bundle
     // changes nothing; a changed one replaces its records. Refused with the reason when the bundle
     // cannot be read; the database is then unchanged.
-    MaybeError registerBundle(const std::string& path, bool placeholder = false);
-    MaybeError unregisterBundle(const std::string& path);
+    Status registerBundle(const std::string& path, bool placeholder = false);
+    Status unregisterBundle(const std::string& path);
     // The paths registered so far, for rebuilding a damaged database.
     std::vector<std::string> registeredPaths();
 

@@ -167,7 +167,7 @@ TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
     EXPECT_EQ(partial, error(4, "no such plugin (uuid not found)"));
     EXPECT_EQ(notify::count(kChange), 1u);
     // bulk-annotate replaces the extension whole and keeps the election.
-    plist::writeXMLFile(d.root / "bulk.plist", dict({{one->uuid().string(), dict({})}}));
+    ASSERT_TRUE(plist::writeXMLFile(d.root / "bulk.plist", dict({{one->uuid().string(), dict({})}})).ok());
     ASSERT_EQ(d.axctl({"bulk-annotate", d.root / "bulk.plist"}).status, 0);
     EXPECT_EQ(notify::count(kChange), 2u);
     EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"], dict({{"election", 2}, {"extension", dict({})}}));
@@ -180,12 +180,12 @@ TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
     EXPECT_TRUE((*registry)->plugInForPath(app + "/PlugIns/One.appex"));
     EXPECT_EQ(d.send(request("remove", {{"paths", Value(Array{})}})), dict({}));  // no path: no test
     auto key = codesign::generateKey();
-    codesign::writeKeyPair(d.root / "key", key);
-    codesign::trustKey(d.root / "key.pub");
+    ASSERT_TRUE(codesign::writeKeyPair(d.root / "key", key).ok());
+    ASSERT_TRUE(codesign::trustKey(d.root / "key.pub").ok());
     std::string manager = d.root / "bin/axctl";
     fs::create_directories(d.root / "bin");
     fs::copy_file(axtest::binary("axctl"), manager);
-    ASSERT_FALSE(codesign::sign(manager, key, std::nullopt, dict({{"com.corvane.private.annexa.manager", true}})));
+    ASSERT_TRUE(codesign::sign(manager, key, std::nullopt, dict({{"com.corvane.private.annexa.manager", true}})).ok());
     auto removed = d.axctl({"remove", app}, {}, manager);
     EXPECT_EQ(removed.status, 0) << removed.err;
     EXPECT_FALSE((*registry)->plugInForPath(app + "/PlugIns/One.appex"));
