@@ -42,7 +42,7 @@ std::optional<std::string> AXBundle::executablePath() const {
 }
 
 std::optional<std::string> AXBundle::supportPath() const {
-    std::lock_guard lock(mutex_);
+    corvane::MutexLock lock(mutex_);
     if (!supportPath_) supportPath_ = stringProperty(corvane::bundle::kPropertySupportPath);
     return supportPath_;
 }

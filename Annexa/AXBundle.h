@@ -45,8 +45,8 @@ private:
     explicit AXBundle(std::shared_ptr<corvane::bundle::Bundle> bundle) : bundle_(std::move(bundle)) {}
 
     const std::shared_ptr<corvane::bundle::Bundle> bundle_;
-    mutable std::mutex mutex_;
-    mutable std::optional<std::string> supportPath_;
+    mutable corvane::Mutex mutex_;
+    mutable std::optional<std::string> supportPath_ GUARDED_BY(mutex_);
 };
 
 }  // namespace annexa

@@ -257,7 +257,7 @@ Date AXPlugInCore::timestamp() const { return Date{int64_t{lastModified()} * 100
 
 Value AXPlugInCore::augmentInterface(const Value& /*interface*/) const { return Value(); }
 
-std::optional<Error> AXPlugInCore::diagnose() const {
+Status AXPlugInCore::diagnose() const {
     if (!identifier())
         return makeError(AXErrorCode::PlugInUnusable, "missing identifier (no KSExtensionIdentifier, nor even KFBundleIdentifier)");
     if (protocolSpec().isNull())
@@ -271,11 +271,11 @@ std::optional<Error> AXPlugInCore::diagnose() const {
         return makeErrorWithFormat(AXErrorCode::PlugInUnusable, "the \"%@\" key is not supported on this platform",
                                    keys::kPassProxy);
     if (isHybrid()) return makeError(AXErrorCode::PlugInUnusable, "hybrid plug-ins are not supported on this platform");
-    return std::nullopt;
+    return {};
 }
 
 void AXPlugInCore::setAnnotationValue(const std::string& key, const Value& value) {
-    std::lock_guard lock(mutex_);
+    corvane::MutexLock lock(mutex_);
     if (annotations_.isNull()) return;
     annotations_ = Value(dictionaryChanging(annotations_, key, value));
 }
@@ -304,11 +304,11 @@ std::string AXPlugInCore::description() const {
 
 #define AX_FIELD(Type, getter, setter, member)      \
     Type AXPlugInCore::getter() const {             \
-        std::lock_guard lock(mutex_);               \
+        corvane::MutexLock lock(mutex_);               \
         return member;                              \
     }                                               \
     void AXPlugInCore::setter(const Type& v) {      \
-        std::lock_guard lock(mutex_);               \
+        corvane::MutexLock lock(mutex_);               \
         member = v;                                 \
     }
 

@@ -162,7 +162,7 @@ public:
     virtual Value augmentInterface(const Value& interface) const;
 
     // Null when sound, else an error of code 12 naming the misconfiguration.
-    virtual std::optional<Error> diagnose() const;
+    virtual Status diagnose() const;
 
     // Replaces the annotations by a copy in which `key` maps to `value` (null removes it). Absent
     // annotations stay absent.
@@ -213,7 +213,7 @@ public:
     void setRequirement(const std::optional<std::string>& v);
 
 private:
-    mutable std::mutex mutex_;
+    mutable corvane::Mutex mutex_;
     std::atomic<bool> onSystemVolume_{false};
     Value plugInDictionary_;
     std::optional<std::string> identifier_;

@@ -22,12 +22,12 @@ void AXSandboxExtension::expel() {
 }
 
 std::string AXSandboxExtension::token() const {
-    std::lock_guard lock(mutex_);
+    corvane::MutexLock lock(mutex_);
     return token_;
 }
 
 void AXSandboxExtension::setToken(std::string token) {
-    std::lock_guard lock(mutex_);
+    corvane::MutexLock lock(mutex_);
     token_ = std::move(token);
 }
 

@@ -33,8 +33,8 @@ public:
     void setHandle(int64_t handle) { handle_.store(handle); }
 
 private:
-    mutable std::mutex mutex_;
-    std::string token_;
+    mutable corvane::Mutex mutex_;
+    std::string token_ GUARDED_BY(mutex_);
     std::atomic<int64_t> handle_{0};
 };
 

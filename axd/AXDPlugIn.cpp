@@ -32,62 +32,80 @@ std::shared_ptr<AXDPlugIn> AXDPlugIn::initWithVTData(const corvane::vantry::Plug
         p->setHubProtocolVersion(p->infoKey(keys::kOldStyle).isNull() ? 2 : 1);
     }
     if (const auto& app = r->containingApplication()) p->setContainingUrl(app->bundlePath());
-    if (auto err = p->diagnose()) {
-        log::info(logOps(), "ignoring mis-configured plug-in at %@: %{public}@", r->bundlePath(), err->description());
+    if (Status usable = p->diagnose(); !usable.ok()) {
+        log::info(logOps(), "ignoring mis-configured plug-in at %@: %{public}@", r->bundlePath(),
+                  usable.error().description());
         return nullptr;
     }
     return p;
 }
 
 Value AXDPlugIn::infoKey(std::string_view key) const {
-    return vtproxy_ ? vtproxy_->lookup(Scope::InfoPlist, key) : Value();
+    auto record = vtproxy();
+    return record ? record->lookup(Scope::InfoPlist, key) : Value();
 }
 Value AXDPlugIn::pluginKey(std::string_view key) const {
-    return vtproxy_ ? vtproxy_->lookup(Scope::PlugIn, key) : Value();
+    auto record = vtproxy();
+    return record ? record->lookup(Scope::PlugIn, key) : Value();
 }
 Value AXDPlugIn::attribute(std::string_view key) const {
-    return vtproxy_ ? vtproxy_->lookup(Scope::Attributes, key) : Value();
+    auto record = vtproxy();
+    return record ? record->lookup(Scope::Attributes, key) : Value();
 }
-Value AXDPlugIn::bundleInfoDictionary() const { return vtproxy_ ? vtproxy_->infoDictionary() : Value(); }
+Value AXDPlugIn::bundleInfoDictionary() const {
+    auto record = vtproxy();
+    return record ? record->infoDictionary() : Value();
+}
+
+corvane::vantry::PlugInRecordPtr AXDPlugIn::vtproxy() const {
+    corvane::MutexLock lock(mutex_);
+    return vtproxy_;
+}
+
+void AXDPlugIn::setVtproxy(corvane::vantry::PlugInRecordPtr record) {
+    corvane::MutexLock lock(mutex_);
+    vtproxy_ = std::move(record);
+}
 
 // The caches fill on the first read that gets an answer; a missing answer is asked again next time.
 std::optional<std::string> AXDPlugIn::localizedName() const {
-    std::lock_guard lock(namesMutex_);
+    corvane::MutexLock lock(mutex_);
     if (!localizedName_ && vtproxy_) localizedName_ = vtproxy_->localizedName();
     return localizedName_;
 }
 void AXDPlugIn::setLocalizedName(const std::optional<std::string>& v) {
-    std::lock_guard lock(namesMutex_);
+    corvane::MutexLock lock(mutex_);
     localizedName_ = v;
 }
 std::optional<std::string> AXDPlugIn::localizedShortName() const {
-    std::lock_guard lock(namesMutex_);
+    corvane::MutexLock lock(mutex_);
     if (!localizedShortName_ && vtproxy_) localizedShortName_ = vtproxy_->localizedShortName();
     return localizedShortName_;
 }
 void AXDPlugIn::setLocalizedShortName(const std::optional<std::string>& v) {
-    std::lock_guard lock(namesMutex_);
+    corvane::MutexLock lock(mutex_);
     localizedShortName_ = v;
 }
 std::optional<std::string> AXDPlugIn::localizedContainingName() const {
-    std::lock_guard lock(namesMutex_);
+    corvane::MutexLock lock(mutex_);
     if (!localizedContainingName_ && vtproxy_ && vtproxy_->containingApplication())
         localizedContainingName_ = vtproxy_->containingApplication()->localizedName();
     return localizedContainingName_;
 }
 void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) {
-    std::lock_guard lock(namesMutex_);
+    corvane::MutexLock lock(mutex_);
     localizedContainingName_ = v;
 }
 
-std::optional<Error> AXDPlugIn::diagnose() const {
-    if (auto err = AXPlugInCore::diagnose()) return err;
-    if (!isData() && !(vtproxy_ && vtproxy_->dataContainerPath()))
+Status AXDPlugIn::diagnose() const {
+    if (Status usable = AXPlugInCore::diagnose(); !usable.ok()) return usable;
+    auto record = vtproxy();
+    if (!isData() && !(record && record->dataContainerPath()))
         return makeError(AXErrorCode::PlugInUnusable, "this plug-in has no sandbox data container");
     // Stand-alone plug-ins belong to the system volume (under the platform root when it moves).
     if (!containingUrl() && path().rfind(corvane::layout::systemRoot() + "/", 0) != 0)
         return makeError(AXErrorCode::PlugInUnusable, "plug-ins outside containing apps must be in /System");
-    return std::nullopt;
+    return {};
 }
 
 Value AXDPlugIn::valueForEntitlement(const std::string& key) const { return entitlements()[key]; }

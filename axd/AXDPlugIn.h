@@ -30,7 +30,7 @@ public:
     void setLocalizedShortName(const std::optional<std::string>& v) override;
     std::optional<std::string> localizedContainingName() const override;
     void setLocalizedContainingName(const std::optional<std::string>& v) override;
-    std::optional<Error> diagnose() const override;
+    Status diagnose() const override;
 
     // The plug-in's own entitlement, or null.
     Value valueForEntitlement(const std::string& key) const;
@@ -47,15 +47,16 @@ public:
     // The entries whose keys do not begin with "DT".
     static Dictionary prunedInfoDictionaryFor(const Value& dictionary);
 
-    const corvane::vantry::PlugInRecordPtr& vtproxy() const { return vtproxy_; }
-    void setVtproxy(corvane::vantry::PlugInRecordPtr record) { vtproxy_ = std::move(record); }
+    // The registry record, replaced whole; readers get their own reference.
+    corvane::vantry::PlugInRecordPtr vtproxy() const;
+    void setVtproxy(corvane::vantry::PlugInRecordPtr record);
 
 private:
-    corvane::vantry::PlugInRecordPtr vtproxy_;
-    mutable std::mutex namesMutex_;
-    mutable std::optional<std::string> localizedName_;
-    mutable std::optional<std::string> localizedShortName_;
-    mutable std::optional<std::string> localizedContainingName_;
+    mutable corvane::Mutex mutex_;
+    corvane::vantry::PlugInRecordPtr vtproxy_ GUARDED_BY(mutex_);
+    mutable std::optional<std::string> localizedName_ GUARDED_BY(mutex_);
+    mutable std::optional<std::string> localizedShortName_ GUARDED_BY(mutex_);
+    mutable std::optional<std::string> localizedContainingName_ GUARDED_BY(mutex_);
 };
 
 using AXDPlugInPtr = std::shared_ptr<AXDPlugIn>;

@@ -7,43 +7,20 @@ namespace annexa {
 namespace log = corvane::log;
 using corvane::vantry::PlugInRecordPtr;
 
-// Forwards the registry's events while the database lives.
-class AXDatabase::RegistryObserver : public corvane::vantry::Observer {
-public:
-    explicit RegistryObserver(AXDatabase* db) : db_(db) {}
-    void detach() {
-        std::lock_guard lock(mutex_);
-        db_ = nullptr;
-    }
-    void pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) override {
-        std::lock_guard lock(mutex_);
-        if (db_) db_->pluginsDidInstall(records);
-    }
-    void pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) override {
-        std::lock_guard lock(mutex_);
-        if (db_) db_->pluginsWillUninstall(records);
-    }
-
-private:
-    std::mutex mutex_;
-    AXDatabase* db_;
-};
-
 AXDatabase::AXDatabase(const char* database, std::shared_ptr<corvane::vantry::Registry> workspace)
     : workspace_(std::move(workspace)),
       sync_(corvane::dispatch::Queue::create("AXDatabase")),
-      syncQueue_(*sync_),
-      observer_(std::make_shared<RegistryObserver>(this)) {
+      syncQueue_(*sync_) {
     // Made before the queue serves anything; nothing else can see it yet.
     auto store = std::make_unique<AXDAnnotationStore>(database);
     syncQueue_.sync([&] {
         syncQueue_.assertCurrent();
         annotations_ = std::move(store);
     });
-    workspace_->addObserver(observer_);
+    subscription_ = workspace_->subscribe(*this);
 }
 
-AXDatabase::~AXDatabase() { observer_->detach(); }
+AXDatabase::~AXDatabase() = default;
 
 AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
     syncQueue_.assertNotCurrent();

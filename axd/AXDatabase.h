@@ -34,7 +34,7 @@ inline constexpr const char* kAnnotationChangeNotification = "com.corvane.annexa
 // Lives on: the database queue "AXDatabase" for the cache and the annotation store; the registry
 // and the delegate are used from the calling thread. The queue is entered synchronously and never
 // re-entered.
-class AXDatabase {
+class AXDatabase : private corvane::vantry::Observer {
 public:
     // Opens the annotation store (`database`: the -d path, or null for its default location),
     // makes the queue and subscribes to the events of `workspace`, the registry it serves from.
@@ -57,8 +57,9 @@ public:
     void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
     void notifyAnnotationChange();
     void autoElect(const AXDPlugIn& plugIn) REQUIRES(syncQueue_);
-    void pluginsDidInstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records);
-    void pluginsWillUninstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records);
+    // The registry's events, on its event thread.
+    void pluginsDidInstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;
+    void pluginsWillUninstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;
 
     AXDatabaseDelegate* delegate() const { return delegate_.load(); }
     // Not owned.
@@ -73,7 +74,6 @@ public:
     std::string annotationsURL();
 
 private:
-    class RegistryObserver;
 
     std::atomic<AXDatabaseDelegate*> delegate_{nullptr};
     std::atomic<uint32_t> cacheLimit_{0};
@@ -82,7 +82,8 @@ private:
     corvane::dispatch::Queue& syncQueue_;
     std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(syncQueue_);
     std::unordered_map<UUID, AXDPlugInPtr, corvane::UUIDHash> cache_ GUARDED_BY(syncQueue_);
-    std::shared_ptr<RegistryObserver> observer_;
+    // Last, so that it ends first: no event reaches a database being destroyed.
+    corvane::vantry::Subscription subscription_;
 };
 
 }  // namespace annexa

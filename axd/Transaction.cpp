@@ -7,6 +7,7 @@
 #include "Annexa/AXMessage.h"
 #include "axd/AXDRpxClient.h"
 #include "axd/AXDServer.h"
+#include "platform/layout/Layout.h"
 #include "platform/trace/Trace.h"
 
 namespace annexa {
@@ -104,9 +105,9 @@ bool Transaction::marshalPaths(const std::function<Walk(const std::string&, bool
             failMessage(AXErrorCode::BadPath, log::formatText("absolute path required: %s", *path));
             return false;
         }
-        char resolved[PATH_MAX];
-        bool ok = realpath(path->c_str(), resolved) != nullptr && std::strlen(resolved) < 1024;
-        if (handler(ok ? std::string(resolved) : *path, ok) == Walk::Stop) return false;
+        auto resolved = corvane::layout::canonicalPath(*path);
+        bool ok = resolved && resolved->size() < 1024;
+        if (handler(ok ? *resolved : *path, ok) == Walk::Stop) return false;
     }
     return true;
 }

@@ -34,15 +34,15 @@ int runRegistry(int argc, char** argv) {
     for (int a = 0; a * kPerApp < plugins; ++a) {
         std::string app = root + "/Apps/App" + std::to_string(a) + ".app";
         std::filesystem::create_directories(app + "/PlugIns");
-        plist::writeXMLFile(app + "/Info.plist", dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)},
-                                                       {"KFBundleExecutable", "app"}}));
+        (void)plist::writeXMLFile(app + "/Info.plist", dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)},
+                                                             {"KFBundleExecutable", "app"}}));
         for (int p = 0; p < kPerApp && a * kPerApp + p < plugins; ++p) {
             int n = a * kPerApp + p;
             std::string dir = app + "/PlugIns/P" + std::to_string(p) + ".appex";
             std::filesystem::create_directories(dir);
             Value attrs = dict({{"KSExtensionPointName", "point" + std::to_string(n % points)},
                                 {"KSExtensionVersion", "1.0"}});
-            plist::writeXMLFile(dir + "/Info.plist",
+            (void)plist::writeXMLFile(dir + "/Info.plist",
                                 dict({{"KFBundleIdentifier", "com.bench.plugin" + std::to_string(n)},
                                       {"KFBundleExecutable", "plugin"},
                                       {"KFBundleVersion", "1"},

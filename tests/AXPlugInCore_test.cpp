@@ -161,17 +161,18 @@ TEST(AXPlugInCore, DiagnoseReportsTheFirstProblemInOrder) {
                                                                  dict({{"KSExtension", c.plugin}}), Value(),
                                                                  std::nullopt);
         ASSERT_TRUE(r);
-        auto err = r->diagnose();
+        corvane::Status usable = r->diagnose();
         if (!c.expected) {
-            EXPECT_FALSE(err) << c.path << " " << c.plugin.description() << ": " << err->description();
+            EXPECT_TRUE(usable.ok()) << c.path << " " << c.plugin.description() << ": "
+                                     << usable.error().description();
         } else {
-            ASSERT_TRUE(err) << c.expected;
-            EXPECT_EQ(err->code, 12);
-            EXPECT_EQ(err->text, std::string(c.expected));
+            ASSERT_FALSE(usable.ok()) << c.expected;
+            EXPECT_EQ(usable.error().code, 12);
+            EXPECT_EQ(usable.error().text, std::string(c.expected));
         }
     }
     AXPlugInCore empty;
-    EXPECT_EQ(empty.diagnose()->text,
+    EXPECT_EQ(empty.diagnose().error().text,
               "missing identifier (no KSExtensionIdentifier, nor even KFBundleIdentifier)");
 }
 
@@ -276,7 +277,7 @@ TEST(AXPlugInCore, SdkResolutionFollowsTheLookupsAndTheRecordsSource) {
     ASSERT_TRUE(o.setupWithNameUrlBundleInfoInfoUuid(std::string("o"), std::string("/x/O.appex"),
                                                      dict({{"KSExtension", dict({})}}), Value(), std::nullopt));
     EXPECT_EQ(o.protocolSpec(), Value("P"));  // derived properties follow the override
-    EXPECT_FALSE(o.diagnose());
+    EXPECT_TRUE(o.diagnose().ok());
     o.resolveSDK();
     // The merge went into the stored metadata; canonical form used the overriding lookups.
     EXPECT_EQ(o.bundleInfoDictionary()["KSExtension"]["KSExtensionAttributes"]["KSExtensionPointName"],

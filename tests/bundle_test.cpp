@@ -56,7 +56,7 @@ TEST(Bundle, InfoPlistIsCachedUntilFlushed) {
     std::string app = axtest::makeBundle(dir.path(), "A.app", axtest::appInfo("com.example.a"));
     auto b = bundle::Bundle::openPath(app);
     EXPECT_EQ(b->infoDictionary()["KFBundleIdentifier"], Value("com.example.a"));
-    corvane::plist::writeXMLFile(app + "/Info.plist", axtest::appInfo("com.example.b"));
+    EXPECT_TRUE(corvane::plist::writeXMLFile(app + "/Info.plist", axtest::appInfo("com.example.b")).ok());
     EXPECT_EQ(b->infoDictionary()["KFBundleIdentifier"], Value("com.example.a"));
     b->flush();
     EXPECT_EQ(b->infoDictionary()["KFBundleIdentifier"], Value("com.example.b"));
@@ -65,7 +65,7 @@ TEST(Bundle, InfoPlistIsCachedUntilFlushed) {
     b->flush();
     EXPECT_TRUE(b->infoDictionary().isNull());
     EXPECT_FALSE(b->property(3));
-    corvane::plist::writeXMLFile(app + "/Info.plist", corvane::dict({{"KFBundleExecutable", "../x"}}));
+    EXPECT_TRUE(corvane::plist::writeXMLFile(app + "/Info.plist", corvane::dict({{"KFBundleExecutable", "../x"}})).ok());
     b->flush();
     EXPECT_FALSE(b->property(3));
 }

@@ -26,7 +26,7 @@ struct Keys {
     codesign::KeyPair trusted = codesign::generateKey();
     codesign::KeyPair stranger = codesign::generateKey();
     explicit Keys(const std::string& dir) {
-        codesign::writeKeyPair(dir + "/trusted", trusted);
+        EXPECT_TRUE(codesign::writeKeyPair(dir + "/trusted", trusted).ok());
         EXPECT_TRUE(codesign::trustKey(dir + "/trusted.pub").ok());
     }
 };
@@ -65,14 +65,14 @@ TEST(CodeSign, OnlyATrustedSignatureOverTheCurrentFileGivesEntitlements) {
         {"signed by the program's own key",
          [&](const std::string& d) {
              auto exe = copyExecutable(d + "/tool");
-             codesign::sign(exe, keys.stranger, std::nullopt, kEntitlements);
+             EXPECT_TRUE(codesign::sign(exe, keys.stranger, std::nullopt, kEntitlements).ok());
              return exe;
          },
          false, "untrusted key"},
         {"altered after signing",
          [&](const std::string& d) {
              auto exe = copyExecutable(d + "/tool");
-             codesign::sign(exe, keys.trusted, std::nullopt, kEntitlements);
+             EXPECT_TRUE(codesign::sign(exe, keys.trusted, std::nullopt, kEntitlements).ok());
              appendByte(exe);
              return exe;
          },
@@ -80,12 +80,12 @@ TEST(CodeSign, OnlyATrustedSignatureOverTheCurrentFileGivesEntitlements) {
         {"entitlements edited in the signature file",
          [&](const std::string& d) {
              auto exe = copyExecutable(d + "/tool");
-             codesign::sign(exe, keys.trusted, std::nullopt, dict({{"harmless", true}}));
+             EXPECT_TRUE(codesign::sign(exe, keys.trusted, std::nullopt, dict({{"harmless", true}})).ok());
              auto sig = plist::readFile(exe + ".axsig");
              Dictionary edited = *sig->asDictionary();
              auto xml = *plist::toXML(kEntitlements);
              edited["entitlements"] = Value::data(xml.data(), xml.size());
-             plist::writeXMLFile(exe + ".axsig", Value(edited));
+             EXPECT_TRUE(plist::writeXMLFile(exe + ".axsig", Value(edited)).ok());
              return exe;
          },
          false, "does not verify"},
@@ -93,7 +93,7 @@ TEST(CodeSign, OnlyATrustedSignatureOverTheCurrentFileGivesEntitlements) {
          [&](const std::string& d) {
              auto other = copyExecutable(d + "/other");
              appendByte(other);
-             codesign::sign(other, keys.trusted, std::nullopt, kEntitlements);
+             EXPECT_TRUE(codesign::sign(other, keys.trusted, std::nullopt, kEntitlements).ok());
              auto exe = copyExecutable(d + "/tool");
              fs::copy_file(other + ".axsig", exe + ".axsig");
              return exe;
@@ -203,7 +203,7 @@ TEST(CodeSign, KeysAndTheTool) {
     EXPECT_EQ(st.st_mode & 0777, 0600u);
     ASSERT_EQ(axtest::run({axtest::binary("axsign"), "trust", root / "k.pub"}).status, 0);
     std::string exe = copyExecutable(root / "tool");
-    plist::writeXMLFile(root / "ents.plist", kEntitlements);
+    EXPECT_TRUE(plist::writeXMLFile(root / "ents.plist", kEntitlements).ok());
     auto sign = axtest::run({axtest::binary("axsign"), "sign", "--key", root / "k", "--identifier", "com.x",
                              "--entitlements", root / "ents.plist", exe});
     ASSERT_EQ(sign.status, 0) << sign.err;

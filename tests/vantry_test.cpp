@@ -35,13 +35,13 @@ struct Fixture {
 
     Fixture() {
         setenv("LANG", "de_DE.UTF-8", 1);
-        codesign::writeKeyPair(root / "key", key);
-        codesign::trustKey(root / "key.pub");
-        layout::makeDirectories(layout::sharedDataDir() + "/sdk", 0755);
-        plist::writeXMLFile(layout::sharedDataDir() + "/sdk/com.corvane.share.plist",
+        EXPECT_TRUE(codesign::writeKeyPair(root / "key", key).ok());
+        EXPECT_TRUE(codesign::trustKey(root / "key.pub").ok());
+        EXPECT_TRUE(layout::makeDirectories(layout::sharedDataDir() + "/sdk", 0755).ok());
+        EXPECT_TRUE(plist::writeXMLFile(layout::sharedDataDir() + "/sdk/com.corvane.share.plist",
                             dict({{"KSExtension", dict({{"KSExtensionProtocol", "ShareProtocol"},
                                                         {"KSExtensionAttributes",
-                                                         dict({{"KSExtensionPointName", "Share"}})}})}}));
+                                                         dict({{"KSExtensionPointName", "Share"}})}})}})).ok());
         Value appInfo = axtest::appInfo("com.example.app");
         Dictionary appDict = *appInfo.asDictionary();
         appDict["KFBundleDisplayName"] = Value("Example");
@@ -56,13 +56,13 @@ struct Fixture {
                                dict({{"KSExtensionPointIdentifier", "com.corvane.share"},
                                      {"KSExtensionIdentifier", "com.example.share"}})),
             "/bin/true");
-        codesign::sign(share, key, std::nullopt, shareEntitlements);
+        EXPECT_TRUE(codesign::sign(share, key, std::nullopt, shareEntitlements).ok());
         std::string data = axtest::makeBundle(
             plugins, "Data.appex",
             axtest::plugInInfo("com.example.app.data",
                                dict({{"KSExtensionProtocol", "#Data"}, {"KSExtensionAttributes", dict({})}})),
             "/bin/true");
-        codesign::sign(data, key, std::nullopt, dict({}));
+        EXPECT_TRUE(codesign::sign(data, key, std::nullopt, dict({})).ok());
         axtest::makeBundle(plugins, "Plain.appex",
                            axtest::plugInInfo("com.example.app.plain",
                                               dict({{"KSExtensionAttributes",
@@ -235,7 +235,7 @@ TEST(Vantry, AChangedPlugInIsReplacedAndOthersKeepTheirIdentity) {
     Value info = *plist::readFile(f.app + "/PlugIns/Data.appex/Info.plist");
     Dictionary changed = *info.asDictionary();
     changed["KFBundleVersion"] = Value("2");
-    plist::writeXMLFile(f.app + "/PlugIns/Data.appex/Info.plist", Value(changed));
+    EXPECT_TRUE(plist::writeXMLFile(f.app + "/PlugIns/Data.appex/Info.plist", Value(changed)).ok());
     ASSERT_TRUE(r.registerBundle(f.app).ok());
     EXPECT_EQ(r.plugInForPath(f.app + "/PlugIns/Share.appex")->uuid(), share->uuid());
     auto newData = r.plugInForPath(f.app + "/PlugIns/Data.appex");

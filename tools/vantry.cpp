@@ -208,7 +208,8 @@ int main(int argc, char** argv) {
         return 0;
     }
     if (command == "watch") {
-        registry->addObserver(std::make_shared<Printer>());
+        Printer printer;
+        auto subscription = registry->subscribe(printer);
         std::printf("watching %s\n", registry->path().c_str());
         std::fflush(stdout);
         for (;;) pause();

@@ -6,17 +6,12 @@
 #include <climits>
 #include <cstdlib>
 
+#include "platform/layout/Layout.h"
 #include "platform/plist/Plist.h"
 
 namespace corvane::bundle {
 
 namespace {
-
-std::optional<std::string> canonical(const std::string& path) {
-    char buf[PATH_MAX];
-    if (!realpath(path.c_str(), buf)) return std::nullopt;
-    return std::string(buf);
-}
 
 bool isDirectory(const std::string& path) {
     struct stat st {};
@@ -37,13 +32,13 @@ Value readInfoPlist(const std::string& path) {
 }
 
 std::shared_ptr<Bundle> Bundle::openPath(const std::string& path) {
-    auto real = canonical(path);
+    auto real = layout::canonicalPath(path);
     if (!real || !isDirectory(*real)) return nullptr;
     return std::shared_ptr<Bundle>(new Bundle(*real));
 }
 
 std::shared_ptr<Bundle> Bundle::openExecutable(const std::string& path) {
-    auto real = canonical(path);
+    auto real = layout::canonicalPath(path);
     if (real) {
         // Walk up from the executable's directory; the first bundle whose executable is this file
         // is its bundle.
@@ -79,7 +74,7 @@ std::optional<std::string> Bundle::property(int number) const {
 
 Value Bundle::infoDictionary() const {
     if (path_.empty()) return Value();
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!info_) info_ = readInfoPlist(path_);
     return *info_;
 }
@@ -93,7 +88,7 @@ std::optional<std::string> Bundle::receiptPath() const {
 }
 
 void Bundle::flush() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     info_.reset();
 }
 

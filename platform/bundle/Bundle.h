@@ -13,6 +13,7 @@
 #include <optional>
 #include <string>
 
+#include "platform/dispatch/ThreadSafety.h"
 #include "platform/value/Value.h"
 
 namespace corvane::bundle {
@@ -52,8 +53,8 @@ private:
     explicit Bundle(std::string path) : path_(std::move(path)) {}
 
     const std::string path_;  // canonical; empty for a mode-2 open that found nothing
-    mutable std::mutex mutex_;
-    mutable std::optional<Value> info_;
+    mutable Mutex mutex_;
+    mutable std::optional<Value> info_ GUARDED_BY(mutex_);
 };
 
 // Reads the Info.plist of the bundle directory `path` without caching anything.

@@ -119,8 +119,8 @@ FileId idOf(const struct stat& st) {
     return {st.st_dev, st.st_ino, st.st_size, int64_t{st.st_mtim.tv_sec} * 1000000000 + st.st_mtim.tv_nsec};
 }
 
-std::mutex gCacheMutex;
-std::map<std::pair<FileId, FileId>, Verification>& cache() {
+Mutex gCacheMutex;
+std::map<std::pair<FileId, FileId>, Verification>& cache() REQUIRES(gCacheMutex) {
     static auto* c = new std::map<std::pair<FileId, FileId>, Verification>();
     return *c;
 }
@@ -151,7 +151,7 @@ Verification verifyOpened(int exeFd, const std::string& path) {
     fstat(sigFd, &sigStat);
     auto key = std::make_pair(idOf(exeStat), idOf(sigStat));
     {
-        std::lock_guard lock(gCacheMutex);
+        MutexLock lock(gCacheMutex);
         auto it = cache().find(key);
         if (it != cache().end()) {
             ::close(sigFd);
@@ -186,7 +186,7 @@ Verification verifyOpened(int exeFd, const std::string& path) {
             v.entitlements = *ents;
         }
     }
-    std::lock_guard lock(gCacheMutex);
+    MutexLock lock(gCacheMutex);
     if (cache().size() >= kCacheLimit) cache().clear();
     cache().emplace(key, v);
     return v;

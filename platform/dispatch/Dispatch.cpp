@@ -7,7 +7,6 @@
 
 #include <cstdio>
 #include <cstdlib>
-#include <condition_variable>
 #include <deque>
 #include <mutex>
 #include <optional>
@@ -18,10 +17,10 @@ struct Queue::State {
     State(std::string l, QoS q) : label(std::move(l)), qos(q) {}
     const std::string label;
     const QoS qos;
-    std::mutex mutex;
-    std::condition_variable wake;
-    std::deque<std::function<void()>> tasks;
-    bool stopping = false;
+    Mutex mutex;
+    ConditionVariable wake;
+    std::deque<std::function<void()>> tasks GUARDED_BY(mutex);
+    bool stopping GUARDED_BY(mutex) = false;
 };
 
 namespace {
@@ -58,8 +57,8 @@ void drain(const std::shared_ptr<State>& state) {
     for (;;) {
         std::function<void()> task;
         {
-            std::unique_lock lock(state->mutex);
-            state->wake.wait(lock, [&] { return state->stopping || !state->tasks.empty(); });
+            MutexLock lock(state->mutex);
+            while (!state->stopping && state->tasks.empty()) state->wake.wait(lock);
             if (state->tasks.empty()) break;
             task = std::move(state->tasks.front());
             state->tasks.pop_front();
@@ -82,7 +81,7 @@ Queue::Queue(std::string label, QoS qos)
 
 Queue::~Queue() {
     {
-        std::lock_guard lock(state_->mutex);
+        MutexLock lock(state_->mutex);
         state_->stopping = true;
     }
     state_->wake.notify_all();
@@ -100,7 +99,7 @@ QoS Queue::qos() const { return state_->qos; }
 
 void Queue::async(std::function<void()> task) {
     {
-        std::lock_guard lock(state_->mutex);
+        MutexLock lock(state_->mutex);
         state_->tasks.push_back(std::move(task));
     }
     state_->wake.notify_one();
@@ -108,17 +107,19 @@ void Queue::async(std::function<void()> task) {
 
 void Queue::sync(const std::function<void()>& task) {
     if (isCurrent()) fail("sync onto the current queue would deadlock", state_->label);
-    std::mutex doneMutex;
-    std::condition_variable doneCv;
-    bool done = false;
+    struct Done {
+        Mutex mutex;
+        ConditionVariable cv;
+        bool done GUARDED_BY(mutex) = false;
+    } done;
     async([&] {
         task();
-        std::lock_guard lock(doneMutex);
-        done = true;
-        doneCv.notify_one();
+        MutexLock lock(done.mutex);
+        done.done = true;
+        done.cv.notify_one();
     });
-    std::unique_lock lock(doneMutex);
-    doneCv.wait(lock, [&] { return done; });
+    MutexLock lock(done.mutex);
+    while (!done.done) done.cv.wait(lock);
 }
 
 bool Queue::isCurrent() const { return tCurrent == state_.get(); }

@@ -12,7 +12,6 @@
 // Thread-safety: every member is safe to call from any thread.
 #pragma once
 
-#include <condition_variable>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -79,19 +78,19 @@ using QueuePtr = std::shared_ptr<Queue>;
 template <class T>
 T waitForCallback(const std::function<void(std::function<void(const T&)>)>& start) {
     struct Slot {
-        std::mutex mutex;
-        std::condition_variable ready;
-        std::optional<T> value;
+        Mutex mutex;
+        ConditionVariable ready;
+        std::optional<T> value GUARDED_BY(mutex);
     };
     // Shared, so a callback that is still unlocking after the waiter returned touches live memory.
     auto slot = std::make_shared<Slot>();
     start([slot](const T& value) {
-        std::lock_guard lock(slot->mutex);
+        MutexLock lock(slot->mutex);
         slot->value = value;
         slot->ready.notify_one();
     });
-    std::unique_lock lock(slot->mutex);
-    slot->ready.wait(lock, [&] { return slot->value.has_value(); });
+    MutexLock lock(slot->mutex);
+    while (!slot->value) slot->ready.wait(lock);
     return std::move(*slot->value);
 }
 

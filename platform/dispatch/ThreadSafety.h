@@ -1,7 +1,18 @@
-// Clang thread-safety annotations. A serial queue is a capability: state that lives on a queue is
-// GUARDED_BY it, functions that must run there REQUIRE it, and code that enters the queue tells the
-// analysis so with Queue::assertCurrent() (an ASSERT_CAPABILITY). Other compilers see nothing.
+// Clang thread-safety annotations, and the mutex the analysis understands.
+//
+// A serial queue is a capability: state that lives on a queue is GUARDED_BY it, functions that must
+// run there REQUIRE it, and code that enters the queue tells the analysis so with
+// Queue::assertCurrent() (an ASSERT_CAPABILITY). A Mutex is a capability too: fields it protects
+// are GUARDED_BY it, functions called with it held REQUIRE it, and MutexLock holds it for a scope.
+// Other compilers see plain code.
 #pragma once
+
+#include <atomic>
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <mutex>
+#include <thread>
 
 #if defined(__clang__)
 #define AX_TSA(x) __attribute__((x))
@@ -10,6 +21,7 @@
 #endif
 
 #define CAPABILITY(x) AX_TSA(capability(x))
+#define SCOPED_CAPABILITY AX_TSA(scoped_lockable)
 #define GUARDED_BY(x) AX_TSA(guarded_by(x))
 #define PT_GUARDED_BY(x) AX_TSA(pt_guarded_by(x))
 #define REQUIRES(...) AX_TSA(requires_capability(__VA_ARGS__))
@@ -19,3 +31,51 @@
 #define ASSERT_CAPABILITY(x) AX_TSA(assert_capability(x))
 #define RETURN_CAPABILITY(x) AX_TSA(lock_returned(x))
 #define NO_THREAD_SAFETY_ANALYSIS AX_TSA(no_thread_safety_analysis)
+
+namespace corvane {
+
+// A std::mutex that clang's analysis can check, and that knows which thread holds it.
+class CAPABILITY("mutex") Mutex {
+public:
+    void lock() ACQUIRE() {
+        mutex_.lock();
+        owner_.store(std::this_thread::get_id(), std::memory_order_relaxed);
+    }
+    void unlock() RELEASE() {
+        owner_.store(std::thread::id(), std::memory_order_relaxed);
+        mutex_.unlock();
+    }
+    // Aborts unless the calling thread holds the mutex; tells the analysis that it does (for code,
+    // such as a lambda, that runs under a lock its caller took).
+    void assertHeld() const ASSERT_CAPABILITY(this) {
+        if (owner_.load(std::memory_order_relaxed) != std::this_thread::get_id()) {
+            std::fputs("Mutex::assertHeld: the calling thread does not hold the mutex\n", stderr);
+            std::abort();
+        }
+    }
+
+private:
+    std::mutex mutex_;
+    std::atomic<std::thread::id> owner_{};
+};
+
+// Holds a Mutex from construction to the end of the scope. A condition variable waits on it as
+// `std::condition_variable_any::wait(lock, ...)`, which unlocks and relocks it in between.
+class SCOPED_CAPABILITY MutexLock {
+public:
+    explicit MutexLock(Mutex& mutex) ACQUIRE(mutex) : mutex_(mutex) { mutex_.lock(); }
+    ~MutexLock() RELEASE() { mutex_.unlock(); }
+    MutexLock(const MutexLock&) = delete;
+    MutexLock& operator=(const MutexLock&) = delete;
+
+    // For condition_variable_any only; the scope's capability is unchanged for the analysis.
+    void lock() NO_THREAD_SAFETY_ANALYSIS { mutex_.lock(); }
+    void unlock() NO_THREAD_SAFETY_ANALYSIS { mutex_.unlock(); }
+
+private:
+    Mutex& mutex_;
+};
+
+using ConditionVariable = std::condition_variable_any;
+
+}  // namespace corvane

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <climits>
 #include <cstdlib>
 
 namespace corvane::layout {
@@ -78,6 +79,12 @@ Status makeDirectories(const std::string& path, mode_t mode) {
     if (::stat(path.c_str(), &st) != 0) return Error::posix(errno, path);
     if (!S_ISDIR(st.st_mode)) return Error::posix(ENOTDIR, path);
     return {};
+}
+
+std::optional<std::string> canonicalPath(const std::string& path) {
+    char buf[PATH_MAX];
+    if (!realpath(path.c_str(), buf)) return std::nullopt;
+    return std::string(buf);
 }
 
 }  // namespace corvane::layout

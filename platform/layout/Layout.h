@@ -11,6 +11,7 @@
 
 #include <sys/types.h>
 
+#include <optional>
 #include <string>
 
 #include "platform/value/Value.h"
@@ -41,7 +42,11 @@ std::string systemRoot();
 std::string underRoot(const std::string& absolutePath);
 
 // Creates a directory and its missing parents with the given mode (existing ones are left as they
-// are). Returns the errno value on failure.
+// are).
 Status makeDirectories(const std::string& path, mode_t mode);
+
+// The canonical form of an existing path (symbolic links, "." and ".." resolved), as realpath(3)
+// gives it; nullopt with errno set when the path cannot be resolved.
+std::optional<std::string> canonicalPath(const std::string& path);
 
 }  // namespace corvane::layout

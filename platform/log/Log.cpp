@@ -72,7 +72,7 @@ const Config& config() {
 }
 
 std::atomic<CaptureSink*> gCapture{nullptr};
-std::mutex gCaptureMutex;  // held while a capture is (un)installed or written to
+Mutex gCaptureMutex;  // held while a capture is (un)installed or written to
 
 int journalPriority(Level level) {
     switch (level) {
@@ -302,7 +302,7 @@ std::string format(std::string_view fmt, std::span<const Arg> args, bool redact)
 
 void write(const Handle& handle, Level level, std::string_view fmt, std::span<const Arg> args) {
     if (gCapture.load(std::memory_order_acquire)) {
-        std::lock_guard lock(gCaptureMutex);
+        MutexLock lock(gCaptureMutex);
         if (CaptureSink* capture = gCapture.load(std::memory_order_relaxed)) {
             capture->add(Record{handle.subsystem(), handle.category(), level,
                                 format(fmt, args, !capture->showPrivate())});
@@ -320,7 +320,7 @@ void write(const Handle& handle, Level level, std::string_view fmt, std::span<co
 // ---- CaptureSink
 
 CaptureSink::CaptureSink(bool showPrivate) : showPrivate_(showPrivate) {
-    std::lock_guard lock(gCaptureMutex);
+    MutexLock lock(gCaptureMutex);
     CaptureSink* expected = nullptr;
     if (!gCapture.compare_exchange_strong(expected, this)) {
         std::fprintf(stderr, "log: a capture sink is already installed\n");
@@ -329,22 +329,22 @@ CaptureSink::CaptureSink(bool showPrivate) : showPrivate_(showPrivate) {
 }
 
 CaptureSink::~CaptureSink() {
-    std::lock_guard lock(gCaptureMutex);
+    MutexLock lock(gCaptureMutex);
     gCapture.store(nullptr, std::memory_order_release);
 }
 
 void CaptureSink::add(Record record) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     records_.push_back(std::move(record));
 }
 
 std::vector<Record> CaptureSink::records() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return records_;
 }
 
 size_t CaptureSink::count(std::string_view text) const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     size_t n = 0;
     for (const Record& r : records_)
         if (r.message.find(text) != std::string::npos) ++n;
@@ -352,7 +352,7 @@ size_t CaptureSink::count(std::string_view text) const {
 }
 
 void CaptureSink::clear() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     records_.clear();
 }
 

@@ -31,6 +31,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/dispatch/ThreadSafety.h"
 #include "platform/value/Value.h"
 
 namespace corvane::log {
@@ -173,8 +174,8 @@ public:
 
 private:
     bool showPrivate_;
-    mutable std::mutex mutex_;
-    std::vector<Record> records_;
+    mutable Mutex mutex_;
+    std::vector<Record> records_ GUARDED_BY(mutex_);
 };
 
 }  // namespace corvane::log

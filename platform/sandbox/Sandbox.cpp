@@ -109,9 +109,9 @@ std::optional<std::string> issueFileReadExtension(const char* extensionClass, co
     }
     std::string target = path;
     if (flags & kCanonicalPath) {
-        char buf[PATH_MAX];
-        if (!realpath(path.c_str(), buf)) return std::nullopt;  // errno from realpath
-        target = buf;
+        auto canonical = layout::canonicalPath(path);
+        if (!canonical) return std::nullopt;  // errno from realpath
+        target = *canonical;
     } else {
         struct stat st {};
         if (::stat(path.c_str(), &st) != 0) return std::nullopt;

@@ -15,7 +15,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -64,8 +63,8 @@ public:
     std::string description() const;
 
 private:
-    friend class Registry;
     friend class Store;
+    friend PlugInRecordPtr makeRecord(const struct ScannedPlugIn& s, const ApplicationRecordPtr& app);
     UUID uuid_;
     std::string bundlePath_, identifier_, bundleIdentifier_, originalIdentifier_, bundleVersion_;
     Value plugin_, info_, entitlements_;
@@ -91,7 +90,6 @@ public:
     std::string description() const;
 
 private:
-    friend class Registry;
     friend class Store;
     friend class PlugInRecord;
     std::string bundlePath_, identifier_;
@@ -100,6 +98,8 @@ private:
     std::function<std::vector<PlugInRecordPtr>()> plugIns_;
 };
 
+// Told of installs and uninstalls, on the registry's event thread ("vantry.events"), one event at a
+// time and in order.
 class Observer {
 public:
     virtual ~Observer() = default;
@@ -108,6 +108,27 @@ public:
 };
 
 class Store;
+
+// An observer's subscription to a registry's events; destroying it (or cancel()) unsubscribes.
+// Once cancel() has returned, the observer is not called again and no call to it is still running
+// (called from inside the observer itself, it only stops later calls).
+class [[nodiscard]] Subscription {
+public:
+    Subscription() = default;
+    Subscription(Subscription&& other) noexcept;
+    Subscription& operator=(Subscription&& other) noexcept;
+    Subscription(const Subscription&) = delete;
+    Subscription& operator=(const Subscription&) = delete;
+    ~Subscription();
+
+    void cancel();
+
+private:
+    friend class Store;
+    Subscription(std::weak_ptr<Store> store, uint64_t id);
+    std::weak_ptr<Store> store_;
+    uint64_t id_ = 0;
+};
 
 class Registry {
 public:
@@ -136,7 +157,9 @@ public:
     // The paths registered so far, for rebuilding a damaged database.
     std::vector<std::string> registeredPaths();
 
-    void addObserver(std::shared_ptr<Observer> observer);
+    // Calls `observer` for every install and uninstall after this call until the subscription
+    // ends; the observer must outlive the subscription.
+    Subscription subscribe(Observer& observer);
     void dropCaches();
 
     // Moves the database at `path` aside (damaged or not) and registers again every path that was

@@ -1,0 +1,420 @@
+// A connection's state and its socket work: framing, writing with back-pressure, reading (by the
+// I/O thread or by a synchronous sender), delivery of events. Not part of the public interface.
+#pragma once
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <deque>
+#include <map>
+#include <set>
+
+#include "platform/rpx/Internal.h"
+#include "platform/rpx/Wire.h"
+
+namespace corvane::rpx {
+
+using namespace internal;
+
+struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
+    struct Outgoing {
+        std::string bytes;
+        size_t offset = 0;
+        std::vector<std::shared_ptr<FileDescriptor>> fds;  // sent with the first byte
+    };
+    // A completion without a queue is internal (a synchronous wait) and runs right where the
+    // reply is read, saving a thread hop.
+    struct Pending {
+        dispatch::QueuePtr queue;
+        std::function<void(const Reply&)> completion;
+
+        void complete(Reply reply) {
+            if (!queue) {
+                completion(reply);
+                return;
+            }
+            queue->async([c = std::move(completion), r = std::move(reply)] { c(r); });
+        }
+    };
+
+    Impl(int socket, dispatch::QueuePtr deliveryQueue, size_t maxFrame)
+        : fd(socket), delivery(std::move(deliveryQueue)), reader(maxFrame, kMaxDepth) {}
+    // Last owner: nobody else can hold the mutex.
+    ~Impl() NO_THREAD_SAFETY_ANALYSIS {
+        if (pollFd >= 0) ::close(pollFd);
+    }
+    Impl(const Impl&) = delete;
+    Impl& operator=(const Impl&) = delete;
+
+    Mutex mutex;
+    int fd GUARDED_BY(mutex);
+    const dispatch::QueuePtr delivery;
+    wire::FrameReader reader GUARDED_BY(mutex);
+    std::function<void(const Event&)> handler GUARDED_BY(mutex);
+    std::shared_ptr<void> context GUARDED_BY(mutex);
+    std::function<void(std::shared_ptr<void>)> finalizer GUARDED_BY(mutex);
+    bool resumed GUARDED_BY(mutex) = false;
+    bool invalid GUARDED_BY(mutex) = false;
+    bool readPaused GUARDED_BY(mutex) = false;
+    bool wantWrite GUARDED_BY(mutex) = false;
+    std::deque<Event> held GUARDED_BY(mutex);  // events before resume
+    // Inline delivery (Listener::setInlineDelivery): events wait in `ready` for a thread to run
+    // them; `running` says one does, so handlers never overlap. Set before start, then fixed.
+    bool inlineDelivery = false;
+    std::deque<Event> ready GUARDED_BY(mutex);
+    bool running GUARDED_BY(mutex) = false;
+    // A synchronous sender reads the socket itself while it waits, instead of being woken by the
+    // I/O thread, which leaves the socket alone meanwhile. One such reader at a time; it polls a
+    // duplicate of the socket, which stays open (and reports the hang-up) when the connection
+    // closes under it.
+    bool syncReader GUARDED_BY(mutex) = false;
+    int pollFd GUARDED_BY(mutex) = -1;
+    std::deque<Outgoing> out GUARDED_BY(mutex);
+    size_t outBytes GUARDED_BY(mutex) = 0;
+    std::map<uint64_t, Pending> pending GUARDED_BY(mutex);
+    uint64_t nextId GUARDED_BY(mutex) = 1;
+    // Events delivered but not handled, plus requests not yet answered.
+    size_t unfinished GUARDED_BY(mutex) = 0;
+    std::set<uint64_t> unanswered GUARDED_BY(mutex);
+    pid_t peerPid = 0;  // set before start, then fixed
+    // An accepted connection keeps itself alive until its invalid event has been delivered.
+    std::shared_ptr<Connection> self GUARDED_BY(mutex);
+
+    // While paused, neither input nor a half-close is asked for: epoll is level-triggered and
+    // would report them again and again. A peer that is gone entirely still shows as EPOLLHUP.
+    uint32_t interest() const REQUIRES(mutex) {
+        return (readPaused || syncReader ? 0u : static_cast<uint32_t>(EPOLLIN | EPOLLRDHUP)) |
+               (wantWrite ? static_cast<uint32_t>(EPOLLOUT) : 0u);
+    }
+
+    void updateInterest() REQUIRES(mutex) {
+        if (fd >= 0) IoLoop::shared().modify(fd, interest());
+    }
+
+    // Back-pressure: stop reading from a peer that does not keep up, resume when it has.
+    void checkPressure() REQUIRES(mutex) {
+        bool over = outBytes > kHighWaterBytes || unfinished > kMaxUnfinished;
+        bool under = outBytes <= kHighWaterBytes / 2 && unfinished <= kMaxUnfinished / 2;
+        if (!readPaused && over) {
+            readPaused = true;
+            updateInterest();
+        } else if (readPaused && under) {
+            readPaused = false;
+            updateInterest();
+            // Frames already read wait in the buffer; epoll will not mention them again.
+            drainFrames();
+        }
+    }
+
+    // Hands on the complete frames already read, as long as the peer keeps up. One read can hold
+    // thousands of small requests, so the pause is checked frame by frame.
+    void drainFrames() REQUIRES(mutex) {
+        wire::Frame frame;
+        std::string error;
+        while (!readPaused && !invalid) {
+            auto status = reader.next(frame, error);
+            if (status == wire::FrameReader::Status::NeedMore) return;
+            if (status == wire::FrameReader::Status::Error) {
+                log::error(rpxLog(), "rpx: closing connection to pid %d: %{public}s", peerPid, error);
+                closeLocked();
+                return;
+            }
+            handleFrame(std::move(frame));
+            checkPressure();
+        }
+    }
+
+    void postEvent(Event ev) REQUIRES(mutex) {
+        if (!resumed) {
+            held.push_back(std::move(ev));
+            return;
+        }
+        ++unfinished;
+        if (inlineDelivery) {
+            ready.push_back(std::move(ev));
+            return;
+        }
+        delivery->async([impl = shared_from_this(), ev = std::move(ev)] { impl->runHandler(ev); });
+    }
+
+    // Inline delivery: runs the ready events on this thread unless another thread already does (it
+    // will see them). Called without the mutex, after every operation that may have made an event
+    // ready.
+    void runReady() EXCLUDES(mutex) {
+        if (!inlineDelivery) return;
+        auto keep = shared_from_this();  // the last event may release the connection's own hold
+        mutex.lock();
+        if (!running) {
+            running = true;
+            while (!ready.empty()) {
+                Event ev = std::move(ready.front());
+                ready.pop_front();
+                mutex.unlock();
+                runHandler(ev);
+                mutex.lock();
+            }
+            running = false;
+        }
+        mutex.unlock();
+    }
+
+    void runHandler(const Event& ev) EXCLUDES(mutex) {
+        std::function<void(const Event&)> h;
+        {
+            MutexLock lock(mutex);
+            h = handler;
+        }
+        if (h) h(ev);
+        std::shared_ptr<Connection> last;
+        {
+            MutexLock lock(mutex);
+            if (unfinished) --unfinished;
+            if (ev.error == ErrorKind::ConnectionInvalid) {
+                // The last event: let go of the handler (and whatever it holds) and of ourselves.
+                handler = nullptr;
+                held.clear();
+                last = std::move(self);
+            } else if (!invalid) {
+                checkPressure();
+            }
+        }
+        // `last` may be the final owner of the connection; it goes here, outside the lock.
+    }
+
+    // Writes what the socket takes now.
+    void flush() REQUIRES(mutex) {
+        while (!out.empty() && fd >= 0) {
+            Outgoing& o = out.front();
+            struct iovec iov {o.bytes.data() + o.offset, o.bytes.size() - o.offset};
+            struct msghdr msg {};
+            msg.msg_iov = &iov;
+            msg.msg_iovlen = 1;
+            std::vector<char> control;
+            if (o.offset == 0 && !o.fds.empty()) {
+                control.resize(CMSG_SPACE(sizeof(int) * o.fds.size()));
+                msg.msg_control = control.data();
+                msg.msg_controllen = control.size();
+                struct cmsghdr* c = CMSG_FIRSTHDR(&msg);
+                c->cmsg_level = SOL_SOCKET;
+                c->cmsg_type = SCM_RIGHTS;
+                c->cmsg_len = CMSG_LEN(sizeof(int) * o.fds.size());
+                auto* slots = reinterpret_cast<int*>(CMSG_DATA(c));
+                for (size_t i = 0; i < o.fds.size(); ++i) slots[i] = o.fds[i]->get();
+            }
+            ssize_t n = sendmsg(fd, &msg, MSG_NOSIGNAL | MSG_DONTWAIT);
+            if (n < 0) {
+                if (errno == EINTR) continue;
+                if (errno == EAGAIN || errno == EWOULDBLOCK) break;
+                closeLocked();
+                return;
+            }
+            o.offset += static_cast<size_t>(n);
+            outBytes -= static_cast<size_t>(n);
+            if (o.offset == o.bytes.size()) {
+                out.pop_front();
+            } else {
+                o.fds.clear();  // they went with the first bytes
+            }
+        }
+        bool want = !out.empty() && fd >= 0;
+        if (want != wantWrite) {
+            wantWrite = want;
+            updateInterest();
+        }
+        if (fd >= 0) checkPressure();
+    }
+
+    bool sendFrame(wire::FrameKind kind, uint64_t id, const Value& body) REQUIRES(mutex) {
+        std::vector<int> raw;
+        auto bytes = wire::encodeFrame(wire::Frame{kind, id, body}, raw, kMaxDepth);
+        if (!bytes) {
+            log::error(rpxLog(), "rpx: message to pid %d nested too deeply; not sent", peerPid);
+            return false;
+        }
+        Outgoing o;
+        o.bytes = std::move(*bytes);
+        for (int f : raw) {
+            int copy = fcntl(f, F_DUPFD_CLOEXEC, 0);
+            if (copy < 0) {
+                log::error(rpxLog(), "rpx: cannot pass a descriptor to pid %d: %{public}s", peerPid,
+                           std::strerror(errno));
+                return false;
+            }
+            o.fds.push_back(std::make_shared<FileDescriptor>(copy));
+        }
+        if (invalid) return false;
+        outBytes += o.bytes.size();
+        out.push_back(std::move(o));
+        flush();
+        return true;
+    }
+
+    // The connection ends: no more I/O, pending replies fail, the invalid event is delivered.
+    void closeLocked() REQUIRES(mutex) {
+        if (invalid) return;
+        invalid = true;
+        if (fd >= 0) {
+            IoLoop::shared().remove(fd);
+            ::shutdown(fd, SHUT_RDWR);  // wakes a synchronous reader polling its duplicate
+            ::close(fd);
+            fd = -1;
+        }
+        out.clear();
+        outBytes = 0;
+        for (auto& [id, p] : pending) p.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
+        pending.clear();
+        {
+            MutexLock lock(gLiveMutex);
+            live().erase(shared_from_this());
+        }
+        Event ev;
+        ev.error = ErrorKind::ConnectionInvalid;
+        postEvent(std::move(ev));
+    }
+
+    enum class ReadStatus { More, Drained, Closed };
+
+    // One read from the socket and the frames it completes.
+    ReadStatus readOnce() REQUIRES(mutex) {
+        char buf[65536];
+        struct iovec iov {buf, sizeof buf};
+        alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * 64)];
+        struct msghdr msg {};
+        msg.msg_iov = &iov;
+        msg.msg_iovlen = 1;
+        msg.msg_control = control;
+        msg.msg_controllen = sizeof control;
+        ssize_t n = recvmsg(fd, &msg, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+        if (n < 0) {
+            if (errno == EINTR) return ReadStatus::More;
+            if (errno == EAGAIN || errno == EWOULDBLOCK) return ReadStatus::Drained;
+            closeLocked();
+            return ReadStatus::Closed;
+        }
+        for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
+            if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
+            size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+            auto* slots = reinterpret_cast<int*>(CMSG_DATA(c));
+            for (size_t i = 0; i < count; ++i) reader.appendFd(std::make_shared<FileDescriptor>(slots[i]));
+        }
+        if (msg.msg_flags & MSG_CTRUNC) {
+            log::error(rpxLog(), "rpx: closing connection to pid %d: too many descriptors", peerPid);
+            closeLocked();
+            return ReadStatus::Closed;
+        }
+        if (n == 0) {
+            closeLocked();
+            return ReadStatus::Closed;
+        }
+        reader.append(buf, static_cast<size_t>(n));
+        drainFrames();
+        return ReadStatus::More;
+    }
+
+    void onReadable() EXCLUDES(mutex) {
+        for (;;) {
+            MutexLock lock(mutex);
+            if (fd < 0 || readPaused || syncReader) return;
+            if (readOnce() != ReadStatus::More) return;
+        }
+    }
+
+    // Becomes the synchronous reader, if the connection allows one now.
+    bool claimSyncReader() REQUIRES(mutex) {
+        if (syncReader || fd < 0 || invalid || readPaused) return false;
+        if (pollFd < 0) pollFd = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+        if (pollFd < 0) return false;
+        syncReader = true;
+        updateInterest();
+        return true;
+    }
+
+    // The synchronous reader's loop: reads until `done` says the awaited reply came, the
+    // connection ends, or reading must pause (then the I/O thread takes over again).
+    void readAsSyncReader(const std::function<bool()>& done) EXCLUDES(mutex) {
+        int watched;
+        {
+            // Only this reader closes or replaces the duplicate, and not before it ends.
+            MutexLock lock(mutex);
+            watched = pollFd;
+        }
+        for (;;) {
+            if (done()) break;
+            struct pollfd p {watched, POLLIN, 0};
+            if (::poll(&p, 1, -1) < 0 && errno != EINTR) break;
+            bool stop;
+            {
+                MutexLock lock(mutex);
+                stop = fd < 0 || readPaused;
+                // Until the socket is empty, or the awaited reply has come (what follows it is
+                // the I/O thread's again).
+                while (!stop && !done()) {
+                    ReadStatus status = readOnce();
+                    if (status != ReadStatus::More) {
+                        stop = status == ReadStatus::Closed;
+                        break;
+                    }
+                    stop = fd < 0 || readPaused;
+                }
+            }
+            runReady();
+            if (stop) break;
+        }
+        MutexLock lock(mutex);
+        syncReader = false;
+        updateInterest();
+    }
+
+    void handleFrame(wire::Frame frame) REQUIRES(mutex) {
+        if (frame.kind == wire::FrameKind::Reply) {
+            auto it = pending.find(frame.id);
+            if (it == pending.end()) return;  // a reply nobody waits for any more
+            it->second.complete(Reply{std::nullopt, std::move(frame.body)});
+            pending.erase(it);
+            return;
+        }
+        Event ev;
+        ev.message = std::move(frame.body);
+        ev.messageId = frame.id;
+        ev.wantsReply = frame.kind == wire::FrameKind::Request;
+        if (ev.wantsReply) {
+            unanswered.insert(frame.id);
+            ++unfinished;
+        }
+        postEvent(std::move(ev));
+    }
+
+    void onEvents(uint32_t events) EXCLUDES(mutex) {
+        if (events & (EPOLLIN | EPOLLRDHUP | EPOLLHUP | EPOLLERR)) onReadable();
+        if (events & EPOLLOUT) {
+            MutexLock lock(mutex);
+            flush();
+        }
+        if (events & (EPOLLHUP | EPOLLERR)) {
+            MutexLock lock(mutex);
+            // Read what is left first (above), then end. A synchronous reader reads what is left
+            // itself and ends the connection when it reaches the end.
+            if (fd >= 0 && !(events & EPOLLIN) && !syncReader) closeLocked();
+        }
+        runReady();
+    }
+
+    void start() EXCLUDES(mutex) {
+        MutexLock lock(mutex);
+        if (fd < 0) return;
+        {
+            MutexLock liveLock(gLiveMutex);
+            live().insert(shared_from_this());
+        }
+        std::weak_ptr<Impl> weak = shared_from_this();
+        IoLoop::shared().add(fd, interest(), [weak](uint32_t events) {
+            if (auto impl = weak.lock()) impl->onEvents(events);
+        });
+    }
+};
+
+}  // namespace corvane::rpx

@@ -1,0 +1,131 @@
+// Reading bundles from disk at registration: the plug-in's metadata merged with its SDK, its
+// verified entitlements, its data container, its names, and a fingerprint of all of it.
+#include <sodium.h>
+#include <sys/stat.h>
+
+#include <cstdlib>
+
+#include "platform/codesign/CodeSign.h"
+#include "platform/containers/Containers.h"
+#include "platform/layout/Layout.h"
+#include "platform/plist/Plist.h"
+#include "platform/sdk/Sdk.h"
+#include "platform/vantry/Store.h"
+
+namespace corvane::vantry {
+
+namespace {
+
+std::string fileStamp(const std::string& path) {
+    struct stat st {};
+    if (::stat(path.c_str(), &st) != 0) return "-";
+    return std::to_string(st.st_size) + ":" + std::to_string(st.st_mtim.tv_sec) + "." +
+           std::to_string(st.st_mtim.tv_nsec);
+}
+
+// A stable digest (BLAKE2b), so a fingerprint stored by one build matches the next build's.
+std::string digest(std::string_view text) {
+    unsigned char hash[16];
+    crypto_generichash(hash, sizeof hash, reinterpret_cast<const unsigned char*>(text.data()), text.size(),
+                       nullptr, 0);
+    char hex[sizeof hash * 2 + 1];
+    sodium_bin2hex(hex, sizeof hex, hash, sizeof hash);
+    return hex;
+}
+
+// The user's languages, most preferred first: "de_DE", then "de".
+std::vector<std::string> languages() {
+    const char* value = nullptr;
+    for (const char* name : {"LC_ALL", "LC_MESSAGES", "LANG"}) {
+        const char* v = std::getenv(name);
+        if (v && *v) {
+            value = v;
+            break;
+        }
+    }
+    std::vector<std::string> out;
+    if (!value) return out;
+    std::string lang = value;
+    lang = lang.substr(0, lang.find_first_of(".@"));
+    if (lang.empty() || lang == "C" || lang == "POSIX") return out;
+    out.push_back(lang);
+    size_t underscore = lang.find('_');
+    if (underscore != std::string::npos) out.push_back(lang.substr(0, underscore));
+    return out;
+}
+
+}  // namespace
+
+LocalizedNames localizedNames(const std::string& bundle, const Value& info) {
+    Value table;
+    for (const auto& lang : languages()) {
+        auto t = plist::readFile(bundle + "/Names/" + lang + ".plist");
+        if (t && t->isDictionary()) {
+            table = *t;
+            break;
+        }
+    }
+    auto pick = [&](const char* key) {
+        auto v = stringAt(table, key);
+        return v ? v : stringAt(info, key);
+    };
+    auto display = pick("KFBundleDisplayName");
+    auto shortName = pick("KFBundleName");
+    return {display ? display : shortName, shortName};
+}
+
+Result<ScannedPlugIn> scanPlugIn(const std::string& path) {
+    Value info = [&] {
+        auto v = plist::readFile(path + "/Info.plist");
+        return v && v->isDictionary() ? *v : Value();
+    }();
+    if (info.isNull()) return refusal("malformed or missing Info.plist in " + path);
+    if (!info["KSExtension"].isDictionary()) return refusal("no plug-in dictionary (KSExtension) in " + path);
+    ScannedPlugIn s;
+    s.path = path;
+    s.bundleIdentifier = stringAt(info, "KFBundleIdentifier").value_or("");
+    auto extId = stringAt(info["KSExtension"], "KSExtensionIdentifier");
+    s.identifier = extId ? *extId : s.bundleIdentifier;
+    if (s.identifier.empty()) return refusal("plug-in without identifier: " + path);
+    s.bundleVersion = stringAt(info, "KFBundleVersion").value_or("");
+    auto resolved = sdk::resolve(info);
+    s.info = resolved.info;
+    s.plugin = resolved.plugin;
+    s.entitlements = codesign::entitlementsOfBundle(path);
+    std::string system = layout::systemRoot() + "/";
+    s.system = path.rfind(system, 0) == 0;
+    if (!(s.plugin["KSExtensionProtocol"] == Value("#Data"))) {
+        auto container = containers::lookupDataContainer(containers::kPlugInDataClass, s.identifier, true);
+        if (!container) return refusal("no data container for " + path + ": " + container.error().description());
+        s.container = *container;
+    }
+    LocalizedNames names = localizedNames(path, info);
+    s.name = names.display;
+    s.shortName = names.shortName;
+    std::string exe = path + "/" + stringAt(info, "KFBundleExecutable").value_or("");
+    s.fingerprint = digest(info.description() + "|" + s.entitlements.description() + "|" + fileStamp(exe) + "|" +
+                           s.name.value_or("") + "|" + s.shortName.value_or("") + "|" + s.plugin.description());
+    return s;
+}
+
+PlugInRecordPtr makeRecord(const ScannedPlugIn& s, const ApplicationRecordPtr& app) {
+    auto r = std::make_shared<PlugInRecord>();
+    r->uuid_ = UUID::random();
+    r->bundlePath_ = s.path;
+    r->identifier_ = s.identifier;
+    r->bundleIdentifier_ = s.bundleIdentifier;
+    r->originalIdentifier_ = s.bundleIdentifier.empty() ? s.identifier : s.bundleIdentifier;
+    r->bundleVersion_ = s.bundleVersion;
+    r->plugin_ = s.plugin;
+    r->info_ = s.info;
+    r->entitlements_ = s.entitlements;
+    r->registered_ = Date::now();
+    r->system_ = s.system;
+    r->application_ = app;
+    r->container_ = s.container;
+    r->localizedName_ = s.name;
+    r->localizedShortName_ = s.shortName;
+    return r;
+}
+
+}  // namespace corvane::vantry

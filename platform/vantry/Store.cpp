@@ -1,0 +1,459 @@
+// The store: the database's schema, reading records (with an in-memory cache kept fresh across
+// processes) and registration in one write transaction each.
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+
+#include "platform/bundle/Bundle.h"
+#include "platform/layout/Layout.h"
+#include "platform/plist/Plist.h"
+#include "platform/vantry/Store.h"
+
+namespace corvane::vantry {
+
+namespace {
+
+constexpr int kSchemaVersion = 1;
+constexpr int64_t kJournalKeepSeconds = 600;
+
+}  // namespace
+
+const log::Handle& vtLog() {
+    static const log::Handle h(kDomain, "vantry");
+    return h;
+}
+
+Error refusal(std::string text) { return Error{kDomain, 1, std::move(text)}; }
+
+std::optional<std::string> stringAt(const Value& v, std::string_view key) {
+    const Value* found = v.find(key);
+    if (found && found->isString()) return *found->asString();
+    return std::nullopt;
+}
+
+Result<std::shared_ptr<Store>> Store::open(const std::string& path) {
+    auto store = std::make_shared<Store>(path);
+    if (Status err = layout::makeDirectories(store->directory(), 0755); !err.ok()) return err.error();
+    if (sqlite3_open_v2(path.c_str(), &store->db_,
+                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_FULLMUTEX, nullptr) != SQLITE_OK)
+        return store->sqlError("opening the registry");
+    // A writer in another process holds the lock for a few milliseconds at most; wait that long,
+    // boundedly.
+    sqlite3_busy_timeout(store->db_, 5000);
+    if (Status err = store->exec("PRAGMA journal_mode=WAL"); !err.ok()) return err.error();
+    if (Status err = store->exec("PRAGMA foreign_keys=ON"); !err.ok()) return err.error();
+    if (Status err = store->migrate(); !err.ok()) return err.error();
+    return store;
+}
+
+Store::~Store() {
+    if (watcher_.joinable()) {
+        uint64_t one = 1;
+        (void)!::write(stopFd_, &one, sizeof one);
+        if (watcher_.get_id() == std::this_thread::get_id()) {
+            watcher_.detach();
+        } else {
+            watcher_.join();
+        }
+    }
+    if (stopFd_ >= 0) ::close(stopFd_);
+    sqlite3_close_v2(db_);
+}
+
+Error Store::sqlError(const char* what) const {
+    int rc = sqlite3_errcode(db_);
+    std::string text = std::string(what) + ": " + sqlite3_errmsg(db_);
+    if (rc == SQLITE_CORRUPT || rc == SQLITE_NOTADB)
+        text = "registry database " + path_ + " is damaged (" + sqlite3_errmsg(db_) + "); run `vantry rebuild`";
+    return Error{kDomain, rc, text};
+}
+
+Status Store::exec(const char* sql) {
+    char* msg = nullptr;
+    if (sqlite3_exec(db_, sql, nullptr, nullptr, &msg) != SQLITE_OK) {
+        sqlite3_free(msg);
+        return sqlError(sql);
+    }
+    return {};
+}
+
+Status Store::migrate() {
+    if (Status err = exec("CREATE TABLE IF NOT EXISTS meta (key TEXT PRIMARY KEY, value TEXT)"); !err.ok()) return err;
+    Statement q(db_, "SELECT value FROM meta WHERE key = 'schema'");
+    if (!q) return sqlError("reading the schema version");
+    int version = q.step() == SQLITE_ROW ? std::atoi(q.text(0).c_str()) : 0;
+    if (version > kSchemaVersion)
+        return refusal("registry database " + path_ + " is of a newer release (schema " + std::to_string(version) + ")");
+    if (version == kSchemaVersion) return {};
+    // Version 0 -> 1: the first schema.
+    return exec(
+        "BEGIN;"
+        "CREATE TABLE applications (path TEXT PRIMARY KEY, identifier TEXT NOT NULL, record BLOB NOT NULL,"
+        "  fingerprint TEXT NOT NULL);"
+        "CREATE TABLE plugins (uuid TEXT PRIMARY KEY, path TEXT UNIQUE NOT NULL,"
+        "  app_path TEXT REFERENCES applications(path) ON DELETE CASCADE,"
+        "  identifier TEXT NOT NULL, entitlements BLOB NOT NULL, record BLOB NOT NULL,"
+        "  k_id_kind INTEGER, k_id TEXT, k_point_kind INTEGER, k_point TEXT, k_name_kind INTEGER, k_name TEXT,"
+        "  fingerprint TEXT NOT NULL);"
+        "CREATE INDEX plugins_app ON plugins(app_path);"
+        "CREATE INDEX plugins_k_id ON plugins(k_id_kind, k_id);"
+        "CREATE INDEX plugins_k_point ON plugins(k_point_kind, k_point);"
+        "CREATE INDEX plugins_k_name ON plugins(k_name_kind, k_name);"
+        "CREATE TABLE journal (seq INTEGER PRIMARY KEY AUTOINCREMENT, kind INTEGER NOT NULL,"
+        "  records BLOB NOT NULL, at INTEGER NOT NULL);"
+        "INSERT OR REPLACE INTO meta VALUES ('schema', '1');"
+        "COMMIT;");
+}
+
+void Store::checkFreshness() {
+    Statement q(db_, "PRAGMA data_version");
+    int64_t v = q && q.step() == SQLITE_ROW ? q.integer(0) : -2;
+    if (v != dataVersion_) {
+        byUUID_.clear();
+        apps_.clear();
+        dataVersion_ = v;
+    }
+}
+
+ApplicationRecordPtr Store::appFromRow(const std::string& appPath) {
+    auto it = apps_.find(appPath);
+    if (it != apps_.end()) return it->second;
+    Statement q(db_, "SELECT record FROM applications WHERE path = ?");
+    q.bind(1, appPath);
+    if (q.step() != SQLITE_ROW) return nullptr;
+    auto v = plist::parse(q.blob(0));
+    if (!v) return nullptr;
+    auto app = std::make_shared<ApplicationRecord>();
+    app->bundlePath_ = appPath;
+    app->identifier_ = stringAt(*v, "identifier").value_or("");
+    app->localizedName_ = stringAt(*v, "name");
+    app->receipt_ = stringAt(*v, "receipt");
+    app->placeholder_ = (*v)["placeholder"].isTrue();
+    std::weak_ptr<Store> weak = weak_from_this();
+    app->plugIns_ = [weak, appPath] {
+        auto store = weak.lock();
+        return store ? store->plugInsOf(appPath) : std::vector<PlugInRecordPtr>{};
+    };
+    apps_[appPath] = app;
+    return app;
+}
+
+PlugInRecordPtr Store::recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath) {
+    auto uuid = UUID::parse(uuidText);
+    if (!uuid) return nullptr;
+    auto it = byUUID_.find(*uuid);
+    if (it != byUUID_.end()) return it->second;
+    auto v = plist::parse(blob);
+    if (!v) return nullptr;
+    ApplicationRecordPtr app = appPath.empty() ? nullptr : appFromRow(appPath);
+    auto r = PlugInRecord::deserialize(*v, app);
+    if (r) byUUID_[*uuid] = r;
+    return r;
+}
+
+std::vector<PlugInRecordPtr> Store::selectPlugIns(const std::string& where, const std::vector<std::string>& args) {
+    MutexLock lock(mutex_);
+    checkFreshness();
+    Statement q(db_, ("SELECT uuid, record, ifnull(app_path, '') FROM plugins " + where).c_str());
+    for (size_t i = 0; i < args.size(); ++i) q.bind(static_cast<int>(i + 1), args[i]);
+    std::vector<PlugInRecordPtr> out;
+    while (q && q.step() == SQLITE_ROW)
+        if (auto r = recordFromRow(q.text(0), q.blob(1), q.text(2))) out.push_back(std::move(r));
+    return out;
+}
+
+std::vector<PlugInRecordPtr> Store::plugInsOf(const std::string& appPath) {
+    return selectPlugIns("WHERE app_path = ? ORDER BY path", {appPath});
+}
+
+PlugInRecordPtr Store::plugInForUUID(const UUID& uuid) {
+    {
+        MutexLock lock(mutex_);
+        checkFreshness();
+        auto it = byUUID_.find(uuid);
+        if (it != byUUID_.end()) return it->second;
+    }
+    auto found = selectPlugIns("WHERE uuid = ?", {uuid.string()});
+    return found.empty() ? nullptr : found.front();
+}
+
+ApplicationRecordPtr Store::applicationForPath(const std::string& path) {
+    MutexLock lock(mutex_);
+    checkFreshness();
+    return appFromRow(path);
+}
+
+std::vector<std::string> Store::registeredPaths() {
+    MutexLock lock(mutex_);
+    Statement q(db_, "SELECT path FROM applications UNION SELECT path FROM plugins WHERE app_path IS NULL ORDER BY 1");
+    std::vector<std::string> out;
+    while (q && q.step() == SQLITE_ROW) out.push_back(q.text(0));
+    return out;
+}
+
+void Store::dropCaches() {
+    MutexLock lock(mutex_);
+    byUUID_.clear();
+    apps_.clear();
+}
+
+// ---- registration
+
+Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint) {
+    Statement ins(db_,
+                  "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
+                  " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
+    if (!ins) return sqlError("preparing an insert");
+    auto record = plist::toXML(r->serialize());
+    auto ents = plist::toXML(r->entitlements());
+    if (!record || !ents) return refusal("plug-in metadata without property-list form in " + r->bundlePath());
+    ins.bind(1, r->uuid().string());
+    ins.bind(2, r->bundlePath());
+    if (appPath.empty()) {
+        ins.bindNull(3);
+    } else {
+        ins.bind(3, appPath);
+    }
+    ins.bind(4, r->identifier());
+    ins.bindBlob(5, ents->data(), ents->size());
+    ins.bindBlob(6, record->data(), record->size());
+    for (int k = 0; k < 3; ++k) {
+        Subject subject = k == 0 ? Subject{SubjectKind::Text, r->identifier()}
+                                 : subjectOf(r->pluginDictionary(), r->infoDictionary(), kIndexedKeys[k].key);
+        ins.bind(7 + 2 * k, static_cast<int64_t>(subject.kind));
+        if (subject.kind == SubjectKind::Text) {
+            ins.bind(8 + 2 * k, versionKey(subject.text));
+        } else {
+            ins.bindNull(8 + 2 * k);
+        }
+    }
+    ins.bind(13, fingerprint);
+    if (ins.step() != SQLITE_DONE) return sqlError("recording a plug-in");
+    return {};
+}
+
+Status Store::journal(JournalKind kind, const std::vector<PlugInRecordPtr>& records) {
+    if (records.empty()) return {};
+    Array list;
+    for (const auto& r : records) list.push_back(r->serialize());
+    auto xml = plist::toXML(Value(std::move(list)));
+    if (!xml) return xml.error();
+    Statement ins(db_, "INSERT INTO journal (kind, records, at) VALUES (?, ?, ?)");
+    ins.bind(1, static_cast<int64_t>(kind));
+    ins.bindBlob(2, xml->data(), xml->size());
+    ins.bind(3, Date::now().wholeSeconds());
+    if (ins.step() != SQLITE_DONE) return sqlError("writing the journal");
+    Statement prune(db_, "DELETE FROM journal WHERE at < ?");
+    prune.bind(1, Date::now().wholeSeconds() - kJournalKeepSeconds);
+    prune.step();
+    return {};
+}
+
+std::map<std::string, StoredPlugIn> Store::existing(const char* where, const std::string& arg) {
+    Statement q(db_, (std::string("SELECT path, uuid, fingerprint FROM plugins WHERE ") + where).c_str());
+    q.bind(1, arg);
+    std::map<std::string, StoredPlugIn> out;
+    while (q && q.step() == SQLITE_ROW) out[q.text(0)] = StoredPlugIn{q.text(1), q.text(2)};
+    return out;
+}
+
+PlugInRecordPtr Store::recordByUUIDText(const std::string& uuid) {
+    Statement q(db_, "SELECT uuid, record, ifnull(app_path, '') FROM plugins WHERE uuid = ?");
+    q.bind(1, uuid);
+    if (q.step() != SQLITE_ROW) return nullptr;
+    return recordFromRow(q.text(0), q.blob(1), q.text(2));
+}
+
+Status Store::deletePlugIn(const std::string& uuid) {
+    Statement del(db_, "DELETE FROM plugins WHERE uuid = ?");
+    del.bind(1, uuid);
+    if (del.step() != SQLITE_DONE) return sqlError("removing a plug-in");
+    return {};
+}
+
+void Store::wake() {
+    int fd = ::open(wakePath().c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    if (fd >= 0) {
+        (void)!::write(fd, "1", 1);
+        ::close(fd);
+    }
+}
+
+void Store::rememberPaths() {
+    Statement q(db_, "SELECT path FROM applications UNION SELECT path FROM plugins WHERE app_path IS NULL ORDER BY 1");
+    std::string list;
+    while (q && q.step() == SQLITE_ROW) list += q.text(0) + "\n";
+    (void)plist::writeFileAtomically(pathsFile(), list, 0644);
+}
+
+Status Store::write(const WriteBody& body) {
+    MutexLock lock(mutex_);
+    checkFreshness();
+    if (Status err = exec("BEGIN IMMEDIATE"); !err.ok()) return err;
+    std::vector<PlugInRecordPtr> installed;
+    std::vector<PlugInRecordPtr> uninstalled;
+    Status status = body(installed, uninstalled);
+    if (status.ok()) status = journal(JournalKind::Uninstall, uninstalled);
+    if (status.ok()) status = journal(JournalKind::Install, installed);
+    if (!status.ok() || (installed.empty() && uninstalled.empty() && !changedOther_)) {
+        (void)exec("ROLLBACK");
+        changedOther_ = false;
+        return status;
+    }
+    changedOther_ = false;
+    if (Status committed = exec("COMMIT"); !committed.ok()) {
+        (void)exec("ROLLBACK");
+        return committed;
+    }
+    byUUID_.clear();
+    apps_.clear();
+    rememberPaths();
+    wake();
+    return {};
+}
+
+Status Store::registerBundle(const std::string& given, bool placeholder) {
+    auto path = layout::canonicalPath(given);
+    struct stat st {};
+    if (!path || ::stat(path->c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return refusal("not a bundle: " + given);
+    auto info = plist::readFile(*path + "/Info.plist");
+    if (!info || !info->isDictionary()) return refusal("malformed or missing Info.plist in " + *path);
+    if ((*info)["KSExtension"].isDictionary()) return registerPlugIn(*path);
+    return registerApplication(*path, *info, placeholder);
+}
+
+Status Store::registerPlugIn(const std::string& path) {
+    auto scanned = scanPlugIn(path);
+    if (!scanned) return scanned.error();
+    return write([&](auto& installed, auto& uninstalled) -> Status {
+        mutex_.assertHeld();
+        auto old = existing("path = ?", path);
+        if (!old.empty() && old.begin()->second.fingerprint == scanned->fingerprint) return {};
+        if (!old.empty()) {
+            if (auto r = recordByUUIDText(old.begin()->second.uuid)) uninstalled.push_back(r);
+            if (Status err = deletePlugIn(old.begin()->second.uuid); !err.ok()) return err;
+        }
+        auto r = makeRecord(*scanned, nullptr);
+        if (Status err = insertPlugIn(r, "", scanned->fingerprint); !err.ok()) return err;
+        installed.push_back(r);
+        return {};
+    });
+}
+
+Status Store::registerApplication(const std::string& path, const Value& info, bool placeholder) {
+    auto appId = stringAt(info, "KFBundleIdentifier");
+    if (!appId) return refusal("application without identifier (KFBundleIdentifier): " + path);
+    // Scan every plug-in first: a bundle that cannot be read leaves the database as it was.
+    std::vector<ScannedPlugIn> scanned;
+    std::string plugInsDir = path + "/PlugIns";
+    if (DIR* d = opendir(plugInsDir.c_str())) {
+        std::vector<std::string> names;
+        while (struct dirent* e = readdir(d)) {
+            std::string n = e->d_name;
+            if (n.size() > 6 && n.substr(n.size() - 6) == ".appex") names.push_back(n);
+        }
+        closedir(d);
+        std::sort(names.begin(), names.end());
+        for (const auto& n : names) {
+            auto p = layout::canonicalPath(plugInsDir + "/" + n);
+            if (!p) {
+                return refusal((errno == ELOOP ? "symbolic link loop under PlugIns/: " : "unreadable plug-in: ") +
+                               plugInsDir + "/" + n);
+            }
+            auto s = scanPlugIn(*p);
+            if (!s) return s.error();
+            scanned.push_back(std::move(*s));
+        }
+    }
+    LocalizedNames names = localizedNames(path, info);
+    Dictionary appRecord{{"identifier", *appId}, {"placeholder", placeholder}};
+    if (names.display) appRecord.emplace("name", *names.display);
+    std::string receipt = path + "/" + bundle::kReceiptFileName;
+    struct stat st {};
+    if (::stat(receipt.c_str(), &st) == 0 && S_ISREG(st.st_mode)) appRecord.emplace("receipt", receipt);
+    std::string appFingerprint = Value(appRecord).description();
+
+    return write([&](auto& installed, auto& uninstalled) -> Status {
+        mutex_.assertHeld();
+        Statement old(db_, "SELECT fingerprint FROM applications WHERE path = ?");
+        old.bind(1, path);
+        bool appChanged = old.step() != SQLITE_ROW || old.text(0) != appFingerprint;
+        if (appChanged) {
+            auto xml = plist::toXML(Value(appRecord));
+            if (!xml) return xml.error();
+            Statement up(db_,
+                         "INSERT INTO applications (path, identifier, record, fingerprint) VALUES (?,?,?,?) "
+                         "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, "
+                         "record = excluded.record, fingerprint = excluded.fingerprint");
+            up.bind(1, path);
+            up.bind(2, *appId);
+            up.bindBlob(3, xml->data(), xml->size());
+            up.bind(4, appFingerprint);
+            if (up.step() != SQLITE_DONE) return sqlError("recording an application");
+            apps_.erase(path);
+            changedOther_ = true;
+        }
+        auto before = existing("app_path = ?", path);
+        ApplicationRecordPtr app = appFromRow(path);
+        // Plug-ins that went away or changed are uninstalled; new and changed ones installed;
+        // unchanged ones keep their UUIDs, unless the application's own record changed (they
+        // carry it).
+        for (const auto& entry : before) {
+            const std::string& p = entry.first;
+            const auto& row = entry.second;
+            auto same = std::find_if(scanned.begin(), scanned.end(), [&](const ScannedPlugIn& s) {
+                return s.path == p && s.fingerprint == row.fingerprint && !appChanged;
+            });
+            if (same != scanned.end()) continue;
+            if (auto r = recordByUUIDText(row.uuid)) uninstalled.push_back(r);
+            if (Status err = deletePlugIn(row.uuid); !err.ok()) return err;
+        }
+        for (const auto& s : scanned) {
+            auto it = before.find(s.path);
+            if (it != before.end() && it->second.fingerprint == s.fingerprint && !appChanged) continue;
+            auto r = makeRecord(s, app);
+            if (Status err = insertPlugIn(r, path, s.fingerprint); !err.ok()) {
+                if (sqlite3_errcode(db_) == SQLITE_CONSTRAINT)
+                    return refusal(s.path + " is already registered elsewhere");
+                return err;
+            }
+            installed.push_back(r);
+        }
+        return {};
+    });
+}
+
+Status Store::unregisterBundle(const std::string& given) {
+    std::vector<std::string> candidates{given};
+    if (auto p = layout::canonicalPath(given); p && *p != given) candidates.insert(candidates.begin(), *p);
+    return write([&](auto&, auto& uninstalled) -> Status {
+        mutex_.assertHeld();
+        for (const auto& path : candidates) {
+            auto plugins = existing("app_path = ?", path);
+            Statement app(db_, "SELECT 1 FROM applications WHERE path = ?");
+            app.bind(1, path);
+            bool isApp = app.step() == SQLITE_ROW;
+            if (!isApp) plugins = existing("path = ?", path);
+            if (!isApp && plugins.empty()) continue;
+            for (const auto& [p, row] : plugins) {
+                if (auto r = recordByUUIDText(row.uuid)) uninstalled.push_back(r);
+                if (Status err = deletePlugIn(row.uuid); !err.ok()) return err;
+            }
+            if (isApp) {
+                Statement del(db_, "DELETE FROM applications WHERE path = ?");
+                del.bind(1, path);
+                if (del.step() != SQLITE_DONE) return sqlError("removing an application");
+                changedOther_ = true;
+            }
+            return {};
+        }
+        return refusal("not registered: " + given);
+    });
+}
+
+}  // namespace corvane::vantry

@@ -1,0 +1,201 @@
+// The registry's implementation, shared by its files; not part of the public interface.
+#pragma once
+
+#include <sqlite3.h>
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
+#include "platform/dispatch/ThreadSafety.h"
+#include "platform/log/Log.h"
+#include "platform/vantry/Vantry.h"
+
+namespace corvane::vantry {
+
+inline constexpr const char* kDomain = "com.corvane.vantry";
+
+const log::Handle& vtLog();
+// A registration the registry refuses, with the reason.
+Error refusal(std::string text);
+// The string at `key` of a dictionary, or nullopt.
+std::optional<std::string> stringAt(const Value& v, std::string_view key);
+
+// ---- SQLite
+
+// One prepared statement; an empty one (a failed prepare) steps to an error.
+struct Statement {
+    sqlite3_stmt* s = nullptr;
+    Statement(sqlite3* db, const char* sql) { sqlite3_prepare_v2(db, sql, -1, &s, nullptr); }
+    ~Statement() { sqlite3_finalize(s); }
+    Statement(const Statement&) = delete;
+    Statement& operator=(const Statement&) = delete;
+    explicit operator bool() const { return s != nullptr; }
+    void bind(int i, const std::string& v) { sqlite3_bind_text(s, i, v.data(), static_cast<int>(v.size()), SQLITE_TRANSIENT); }
+    void bind(int i, int64_t v) { sqlite3_bind_int64(s, i, v); }
+    void bindNull(int i) { sqlite3_bind_null(s, i); }
+    void bindBlob(int i, const void* p, size_t n) { sqlite3_bind_blob(s, i, p, static_cast<int>(n), SQLITE_TRANSIENT); }
+    int step() { return sqlite3_step(s); }
+    std::string text(int i) const {
+        const auto* t = sqlite3_column_text(s, i);
+        return t ? std::string(reinterpret_cast<const char*>(t), static_cast<size_t>(sqlite3_column_bytes(s, i))) : std::string();
+    }
+    std::string_view blob(int i) const {
+        return {static_cast<const char*>(sqlite3_column_blob(s, i)), static_cast<size_t>(sqlite3_column_bytes(s, i))};
+    }
+    int64_t integer(int i) const { return sqlite3_column_int64(s, i); }
+};
+
+// ---- indexed keys and the numeric-aware key
+
+// What the exact pattern test of a key reads from a plug-in: the attribute of that name, else the
+// Info.plist entry; "KSExtensionIdentifier" is the plug-in identifier. Stored as an integer.
+enum class SubjectKind : int64_t { Absent = 0, Text = 1, Other = 2 };
+struct Subject {
+    SubjectKind kind = SubjectKind::Absent;
+    std::string text;  // when kind is Text
+};
+Subject subjectOf(const Value& plugin, const Value& info, const std::string& key);
+
+// The keys with an index, and their columns (each with a "<column>_kind" beside it).
+struct IndexedKey {
+    const char* key;
+    const char* column;
+};
+inline constexpr IndexedKey kIndexedKeys[] = {{"KSExtensionIdentifier", "k_id"},
+                                              {"KSExtensionPointIdentifier", "k_point"},
+                                              {"KSExtensionPointName", "k_name"}};
+
+// Equal under the numeric-aware version comparison exactly when equal after this: leading zeros of
+// every run of digits dropped (one digit kept).
+std::string versionKey(std::string_view s);
+
+// ---- scanning bundles
+
+// One plug-in as read from disk, before it has a UUID.
+struct ScannedPlugIn {
+    std::string path, identifier, bundleIdentifier, bundleVersion;
+    std::string fingerprint;  // changes whenever anything the record holds changes
+    Value info, plugin, entitlements;
+    bool system = false;
+    std::optional<std::string> container, name, shortName;
+};
+
+struct LocalizedNames {
+    std::optional<std::string> display, shortName;
+};
+
+// Reads one plug-in bundle. Refused when it cannot be read or has no identifier.
+Result<ScannedPlugIn> scanPlugIn(const std::string& path);
+// The display and short names of a bundle in the user's language.
+LocalizedNames localizedNames(const std::string& bundle, const Value& info);
+// A new record (with a fresh UUID) for a scanned plug-in.
+PlugInRecordPtr makeRecord(const ScannedPlugIn& s, const ApplicationRecordPtr& app);
+
+// ---- the store
+
+// The kind of a journal entry, as stored.
+enum class JournalKind : int64_t { Install = 1, Uninstall = 2 };
+
+// A plug-in row as registration compares it.
+struct StoredPlugIn {
+    std::string uuid;
+    std::string fingerprint;
+};
+
+// The database and the records built from it. The SQLite handle is opened in serialized mode; the
+// records built from it, and every multi-statement use of it, are guarded by `mutex_`.
+class Store : public std::enable_shared_from_this<Store> {
+public:
+    static Result<std::shared_ptr<Store>> open(const std::string& path);
+    explicit Store(std::string path) : path_(std::move(path)) {}
+    ~Store();
+    Store(const Store&) = delete;
+    Store& operator=(const Store&) = delete;
+
+    const std::string& path() const { return path_; }
+
+    // Reads.
+    PlugInRecordPtr plugInForUUID(const UUID& uuid) EXCLUDES(mutex_);
+    ApplicationRecordPtr applicationForPath(const std::string& path) EXCLUDES(mutex_);
+    std::vector<PlugInRecordPtr> selectPlugIns(const std::string& where, const std::vector<std::string>& args)
+        EXCLUDES(mutex_);
+    std::vector<PlugInRecordPtr> plugInsOf(const std::string& appPath) EXCLUDES(mutex_);
+    std::vector<PlugInRecordPtr> query(const Value& pattern,
+                                       const std::function<bool(const std::string&, const Value&)>& filter)
+        EXCLUDES(mutex_);
+    std::vector<std::string> registeredPaths() EXCLUDES(mutex_);
+    void dropCaches() EXCLUDES(mutex_);
+
+    // Writes.
+    Status registerBundle(const std::string& given, bool placeholder) EXCLUDES(mutex_);
+    Status unregisterBundle(const std::string& given) EXCLUDES(mutex_);
+
+    // Events (Events.cpp).
+    Subscription subscribe(Observer& observer) EXCLUDES(observersMutex_);
+    void unsubscribe(uint64_t id) EXCLUDES(observersMutex_, deliveryMutex_);
+
+private:
+    using WriteBody = std::function<Status(std::vector<PlugInRecordPtr>& installed,
+                                           std::vector<PlugInRecordPtr>& uninstalled)>;
+
+    std::string directory() const { return path_.substr(0, path_.rfind('/')); }
+    std::string wakePath() const { return path_ + ".events"; }
+    std::string pathsFile() const { return path_ + ".paths"; }
+
+    Error sqlError(const char* what) const;
+    Status exec(const char* sql);
+    Status migrate();
+    void checkFreshness() REQUIRES(mutex_);
+    ApplicationRecordPtr appFromRow(const std::string& appPath) REQUIRES(mutex_);
+    PlugInRecordPtr recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath)
+        REQUIRES(mutex_);
+    Status insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint)
+        REQUIRES(mutex_);
+    Status journal(JournalKind kind, const std::vector<PlugInRecordPtr>& records) REQUIRES(mutex_);
+    // Plug-ins at the given condition, by path.
+    std::map<std::string, StoredPlugIn> existing(const char* where, const std::string& arg) REQUIRES(mutex_);
+    PlugInRecordPtr recordByUUIDText(const std::string& uuid) REQUIRES(mutex_);
+    Status deletePlugIn(const std::string& uuid) REQUIRES(mutex_);
+    void wake();
+    void rememberPaths() REQUIRES(mutex_);
+    // Runs `body` in one write transaction, under the mutex; on success records journal entries,
+    // remembers the registered paths and wakes observers.
+    Status write(const WriteBody& body) EXCLUDES(mutex_);
+    Status registerPlugIn(const std::string& path) EXCLUDES(mutex_);
+    Status registerApplication(const std::string& path, const Value& info, bool placeholder) EXCLUDES(mutex_);
+
+    void startWatcher() REQUIRES(observersMutex_);
+    void deliverNewEvents() EXCLUDES(mutex_, observersMutex_);
+
+    const std::string path_;
+    sqlite3* db_ = nullptr;
+    Mutex mutex_;
+    int64_t dataVersion_ GUARDED_BY(mutex_) = -1;
+    std::unordered_map<UUID, PlugInRecordPtr, UUIDHash> byUUID_ GUARDED_BY(mutex_);
+    std::map<std::string, ApplicationRecordPtr> apps_ GUARDED_BY(mutex_);
+    // A write that changed rows without plug-in events (an application alone).
+    bool changedOther_ GUARDED_BY(mutex_) = false;
+    int64_t lastSeq_ GUARDED_BY(mutex_) = 0;
+
+    // Observers are called on the thread "vantry.events", one round of events at a time, while
+    // `deliveryMutex_` is held; `observersMutex_` guards the list.
+    Mutex observersMutex_;
+    Mutex deliveryMutex_;
+    std::map<uint64_t, Observer*> observers_ GUARDED_BY(observersMutex_);
+    uint64_t nextObserver_ GUARDED_BY(observersMutex_) = 1;
+    bool watching_ GUARDED_BY(observersMutex_) = false;
+    std::thread watcher_;
+    std::atomic<std::thread::id> watcherId_{};
+    int stopFd_ = -1;
+};
+
+}  // namespace corvane::vantry
