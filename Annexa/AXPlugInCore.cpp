@@ -118,10 +118,9 @@ void AXPlugInCore::updateFromForm(const Value& f) {
     setAnnotations(f[form::kAnnotations].isDictionary() ? f[form::kAnnotations] : Value());
 }
 
-Value AXPlugInCore::exportForm(Error* error) const {
-    auto missing = [&](const char* what) {
-        if (error) *error = makeErrorWithFormat(AXErrorCode::PlugInUnusable, "cannot export plug-in: missing %s", what);
-        return Value();
+Result<Value> AXPlugInCore::exportForm() const {
+    auto missing = [](const char* what) {
+        return makeErrorWithFormat(AXErrorCode::PlugInUnusable, "cannot export plug-in: missing %s", what);
     };
     Value info = bundleInfoDictionary();
     Value plugin = plugInDictionary();
@@ -129,14 +128,18 @@ Value AXPlugInCore::exportForm(Error* error) const {
     auto original = originalIdentifier();
     auto ident = identifier();
     auto id = uuid();
-    if (!info.isDictionary()) return missing("bundle metadata");
-    if (!plugin.isDictionary()) return missing("plug-in dictionary");
-    if (!ver.isString()) return missing("version");
+    if (info.isNull()) return missing("bundle metadata");
+    if (plugin.isNull()) return missing("plug-in dictionary");
+    if (ver.isNull()) return missing("version");
     if (!original) return missing("original identifier");
     if (!ident || !id) return missing("identifier");
 
-    Dictionary bundleInfo = *info.asDictionary();
-    bundleInfo.erase(keys::kInfoPlistURL);
+    Value bundleInfo = info;
+    if (const Dictionary* entries = info.asDictionary(); entries && entries->count(keys::kInfoPlistURL)) {
+        Dictionary copy = *entries;
+        copy.erase(keys::kInfoPlistURL);
+        bundleInfo = Value(std::move(copy));
+    }
     Value annotationsValue = annotations();
     Dictionary f{
         {form::kHubProtocolVersion, Value(uint64_t{hubProtocolVersion()})},
@@ -145,7 +148,7 @@ Value AXPlugInCore::exportForm(Error* error) const {
         {form::kIdentifier, Value(*ident)},
         {form::kOriginalIdentifier, Value(*original)},
         {form::kVersion, ver},
-        {form::kBundleInfo, Value(std::move(bundleInfo))},
+        {form::kBundleInfo, bundleInfo},
         {form::kInfo, plugin},
         {form::kUUID, Value(id->string())},
         {form::kLastModified, Value(int64_t{lastModified()})},

@@ -121,9 +121,10 @@ public:
     bool setupWithForm(const Value& form);
     // Replaces the annotations by the form's "annotations" (absent clears them).
     void updateFromForm(const Value& form);
-    // The record as a form (`export:`, a C++ keyword). Without one of the always-present values it
-    // returns null and sets `error` (code 12).
-    Value exportForm(Error* error = nullptr) const;
+    // The record as a form (`export:`, a C++ keyword). Values are exported as they are, whatever
+    // their type; only a missing always-present value (original identifier, version, bundle
+    // metadata, plug-in dictionary) fails, with code 12.
+    Result<Value> exportForm() const;
 
     // ---- SDK resolution
     void resolveSDK();

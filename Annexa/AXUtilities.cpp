@@ -1,5 +1,6 @@
 #include "Annexa/AXUtilities.h"
 
+#include <cstdlib>
 #include <memory>
 #include <mutex>
 
@@ -11,6 +12,12 @@ Error makeError(AXErrorCode code, const char* text) {
     Error e{kAnnexaErrorDomain, errorCodeValue(code), std::nullopt};
     if (text) e.text = text;
     return e;
+}
+
+int64_t integerValueOf(const Value& value) {
+    if (value.isNumber()) return *value.int64Value();
+    if (const std::string* text = value.asString()) return std::strtoll(text->c_str(), nullptr, 10);
+    return 0;
 }
 
 Dictionary dictionaryChanging(const Dictionary& dictionary, const std::string& key,

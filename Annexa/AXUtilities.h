@@ -40,6 +40,10 @@ Dictionary dictionaryChanging(const Value& dictionary, const std::string& key, c
 Dictionary dictionaryChanging(const Dictionary& dictionary, const std::string& key,
                               const Value& value);
 
+// The integer value of a stored value: a number's (doubles truncated), a text's leading decimal
+// digits as strtoll reads them (0 without any), and 0 for anything else.
+int64_t integerValueOf(const Value& value);
+
 enum class Ordering { Ascending = -1, Same = 0, Descending = 1 };
 
 // Compares version strings: runs of decimal digits compare by numeric value (10 after 9, 1.10

@@ -25,9 +25,9 @@ std::shared_ptr<AXDPlugIn> AXDPlugIn::initWithVTData(const corvane::vantry::Plug
     p->setOriginalIdentifier(r->originalIdentifier());
     p->setLastModified(static_cast<int32_t>(r->registrationDate().wholeSeconds()));
     p->setOnSystemVolume(r->onSystemVolume());
-    const Value& hub = r->pluginDictionary()[keys::kHubProtocolVersion];
-    if (hub.isNumber()) {
-        p->setHubProtocolVersion(static_cast<uint32_t>(*hub.uint64Value()));
+    // Present, it is used whatever its type ("3" is 3); absent, the Info.plist decides.
+    if (const Value* hub = r->pluginDictionary().find(keys::kHubProtocolVersion)) {
+        p->setHubProtocolVersion(static_cast<uint32_t>(integerValueOf(*hub)));
     } else {
         p->setHubProtocolVersion(p->infoKey(keys::kOldStyle).isNull() ? 2 : 1);
     }

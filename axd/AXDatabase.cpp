@@ -1,5 +1,7 @@
 #include "axd/AXDatabase.h"
 
+#include <cstdlib>
+
 #include "platform/notify/Notify.h"
 
 namespace annexa {
@@ -105,6 +107,10 @@ Status AXDatabase::removePlugIn(const std::string& path) {
     return makeError(AXErrorCode::RegistryRefused, "Vantry failed to deregister the plug-in");
 }
 
+uint32_t AXDatabase::cacheLimitFromText(const char* text) {
+    return static_cast<uint32_t>(std::strtol(text, nullptr, 10));
+}
+
 Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {
     syncQueue_.assertNotCurrent();
     return syncQueue_.syncResult([&] {
@@ -128,7 +134,7 @@ void AXDatabase::autoElect(const AXDPlugIn& plugIn) {
     Value current = annotations_->annotationForPlugIn(plugIn);
     const Value* election = current.find(keys::kElection);
     // An election already made is never overridden.
-    if (election && election->int64Value().value_or(0) != 0) return;
+    if (election && integerValueOf(*election) != 0) return;
     annotations_->setAnnotationForPlugIn(Value(dictionaryChanging(current, keys::kElection, Value(1))), plugIn);
 }
 

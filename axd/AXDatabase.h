@@ -65,6 +65,9 @@ public:
     // Not owned.
     void setDelegate(AXDatabaseDelegate* delegate) { delegate_.store(delegate); }
     uint32_t cacheLimit() const { return cacheLimit_.load(); }
+    // The limit that the daemon's -c text gives: a decimal number read as strtol reads it
+    // (leading blanks and a sign allowed), 0 when the text has no leading digits.
+    static uint32_t cacheLimitFromText(const char* text);
     void setCacheLimit(uint32_t limit) { cacheLimit_.store(limit); }
     corvane::vantry::Registry& workspace() const { return *workspace_; }
     corvane::dispatch::Queue& databaseQueue() const RETURN_CAPABILITY(syncQueue_) { return syncQueue_; }

@@ -32,9 +32,7 @@ int main(int argc, char** argv) {
     while ((opt = getopt(argc, argv, "c:d:S:v")) != -1) {
         switch (opt) {
             case 'c':
-                // A decimal number read as strtol reads it (leading blanks and a sign allowed);
-                // text without leading digits gives 0.
-                cacheLimit = static_cast<uint32_t>(std::strtol(optarg, nullptr, 10));
+                cacheLimit = annexa::AXDatabase::cacheLimitFromText(optarg);
                 break;
             case 'd': database = optarg; break;
             case 'S': serviceName = optarg; break;

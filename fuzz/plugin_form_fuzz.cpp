@@ -15,9 +15,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     (void)record->isData();
     (void)record->isDedicated();
     record->updateFromForm(*form);
-    corvane::Value exported = record->exportForm();
-    if (exported.isNull()) return 0;
-    auto again = annexa::AXPlugInCore::initWithForm(exported);
+    auto exported = record->exportForm();
+    if (!exported) return 0;
+    auto again = annexa::AXPlugInCore::initWithForm(*exported);
     if (!again || !(*again == *record)) std::abort();
     return 0;
 }

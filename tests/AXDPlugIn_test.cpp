@@ -61,8 +61,9 @@ TEST(AXDPlugIn, BuiltFromTheRegistryRecordAndAnsweringFromIt) {
     EXPECT_FALSE(p->localizedShortName());  // not cached: asked again next time
     p->setLocalizedShortName(std::string("Sh"));
     EXPECT_EQ(p->localizedShortName(), std::optional<std::string>("Sh"));
-    Value form = p->exportForm();
-    ASSERT_TRUE(form.isDictionary());
+    auto exported = p->exportForm();
+    ASSERT_TRUE(exported);
+    Value form = *exported;
     EXPECT_EQ(form["localizedContainingDisplayName"], Value("Example"));
 
     struct Hub {
@@ -73,6 +74,9 @@ TEST(AXDPlugIn, BuiltFromTheRegistryRecordAndAnsweringFromIt) {
         {{}, 2},
         {{{"info", dict({{"Annexa", dict({})}})}}, 1},
         {{{"plugin", dict({{"KSExtensionAttributes", dict({})}, {"HubProtocolVersion", 3u}})}}, 3},
+        // Present but not a number: its integer value, never the default.
+        {{{"plugin", dict({{"KSExtensionAttributes", dict({})}, {"HubProtocolVersion", "3"}})}}, 3},
+        {{{"plugin", dict({{"KSExtensionAttributes", dict({})}, {"HubProtocolVersion", "x"}})}}, 0},
     };
     for (const auto& h : hubs) {
         auto q = AXDPlugIn::initWithVTData(record(h.changes));

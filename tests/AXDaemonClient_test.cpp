@@ -185,9 +185,7 @@ TEST(AXDaemonClient, NoDaemonMeansAnErrorReplyAndALogLine) {
     ASSERT_FALSE(s.ok());
     EXPECT_EQ(s.error().code, 4);
     EXPECT_EQ(s.error().description(), "Connection invalid");
-    for (int i = 0; i < 200 && !capture.contains("Communications error: Connection invalid"); ++i)
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    EXPECT_TRUE(capture.contains("Communications error: Connection invalid"));
+    EXPECT_TRUE(axtest::eventually([&] { return capture.contains("Communications error: Connection invalid"); }));
 }
 
 TEST(AXDaemonClient, ConvertersWorkOnlyAtVersionThree) {

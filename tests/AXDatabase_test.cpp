@@ -119,6 +119,13 @@ TEST(AXDatabase, LookupsBuildRecordsOnceAndServeThemFromTheCache) {
     EXPECT_EQ(db.removePlugIn(f.root / "never").error().text, "Vantry failed to deregister the plug-in");
 }
 
+TEST(AXDatabase, CacheLimitTextIsReadFromItsLeadingDigits) {
+    const std::pair<const char*, uint32_t> cases[] = {
+        {"5", 5}, {" 5", 5}, {"+5", 5}, {"12abc", 12}, {"abc", 0}, {"", 0}, {"0", 0}, {"-0", 0}, {"007", 7},
+    };
+    for (const auto& [text, limit] : cases) EXPECT_EQ(AXDatabase::cacheLimitFromText(text), limit) << '"' << text << '"';
+}
+
 TEST(AXDatabase, TheCacheIsClearedWhenAnInsertionFindsItOverItsLimit) {
     Fixture f;
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
@@ -170,6 +177,9 @@ TEST(AXDatabase, AutoElectionIsWrittenOnceAndNeverOverridesAnElection) {
         {dict({{"election", 0}, {"extension", e}}), dict({{"election", 1}, {"extension", e}})},
         {dict({{"election", 2}}), dict({{"election", 2}})},
         {dict({{"election", -1}}), dict({{"election", -1}})},
+        // An election stored as text counts by its integer value.
+        {dict({{"election", "2"}}), dict({{"election", "2"}})},
+        {dict({{"election", "0"}}), dict({{"election", 1}})},
     };
     for (const auto& c : cases) {
         AXDatabase db(nullptr, f.registry());
@@ -211,8 +221,7 @@ TEST(AXDatabase, UninstallDropsTheCacheAndTellsTheDelegateOnceWithEveryRecord) {
 
     // Reinstalled under a new UUID, the annotation is still there; the install only logs.
     ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
-    for (int i = 0; i < 500 && capture.count("plug-in INSTALLED:") < 3; ++i)
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_TRUE(axtest::eventually([&] { return capture.count("plug-in INSTALLED:") >= 3; }));
     EXPECT_EQ(capture.count("plug-in INSTALLED:"), 3u);
     auto again = db.findPlugInAtPath(f.plain);
     ASSERT_TRUE(again);

@@ -54,9 +54,9 @@ public:
 
 TEST(AXPlugInCore, ExportThenRebuildGivesAnEqualRecord) {
     auto r = fullRecord();
-    annexa::Error error;
-    Value f = r->exportForm(&error);
-    ASSERT_TRUE(f.isDictionary()) << error.description();
+    auto exported = r->exportForm();
+    ASSERT_TRUE(exported) << exported.error().description();
+    Value f = *exported;
     EXPECT_FALSE(f["bundleInfo"].has("KFBundleInfoPlistURL"));
     EXPECT_EQ(f["version"], Value("2.1"));
     EXPECT_EQ(f["uuid"], Value(r->uuid()->string()));
@@ -81,15 +81,16 @@ TEST(AXPlugInCore, ExportThenRebuildGivesAnEqualRecord) {
     EXPECT_EQ(back->plugInDictionary(), r->bundleInfoDictionary()["KSExtension"]);
     EXPECT_EQ(back->version(), Value("2.1"));
     // The rebuilt record exports the same form.
-    EXPECT_EQ(back->exportForm(), f);
+    EXPECT_EQ(*back->exportForm(), f);
 }
 
 TEST(AXPlugInCore, FormReaderDefaultsAndOddValues) {
     auto r = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/System/P.appex"),
                                                              appexInfo(), Value(), std::nullopt);
     r->setOriginalIdentifier(std::string("p"));
-    Value f = r->exportForm();
-    ASSERT_TRUE(f.isDictionary());
+    auto exported = r->exportForm();
+    ASSERT_TRUE(exported);
+    Value f = *exported;
     EXPECT_EQ(f["annotations"], dict({}));
     EXPECT_FALSE(f.has("containingPath"));
     EXPECT_FALSE(f.has("entitlements"));
@@ -125,15 +126,25 @@ TEST(AXPlugInCore, FormReaderDefaultsAndOddValues) {
 TEST(AXPlugInCore, ExportNeedsEveryAlwaysPresentValue) {
     auto r = fullRecord();
     r->setOriginalIdentifier(std::nullopt);
-    annexa::Error error;
-    EXPECT_TRUE(r->exportForm(&error).isNull());
-    EXPECT_EQ(error.code, 12);
-    EXPECT_EQ(error.text, "cannot export plug-in: missing original identifier");
+    auto refused = r->exportForm();
+    ASSERT_FALSE(refused);
+    EXPECT_EQ(refused.error().code, 12);
+    EXPECT_EQ(refused.error().text, "cannot export plug-in: missing original identifier");
     auto bare = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/p"), Value(),
                                                                 dict({}), std::nullopt);
     bare->setOriginalIdentifier(std::string("p"));
-    EXPECT_TRUE(bare->exportForm(&error).isNull());
-    EXPECT_EQ(error.text, "cannot export plug-in: missing bundle metadata");
+    auto noMetadata = bare->exportForm();
+    ASSERT_FALSE(noMetadata);
+    EXPECT_EQ(noMetadata.error().text, "cannot export plug-in: missing bundle metadata");
+    // Present values of an unexpected type are exported as they are: a numeric version too.
+    auto numeric = fullRecord();
+    Value current = numeric->plugInDictionary();
+    Dictionary plugin = *current.asDictionary();
+    plugin["KSExtensionAttributes"] = dict({{"KSExtensionVersion", 7}});
+    numeric->setPlugInDictionary(Value(plugin));
+    auto exported = numeric->exportForm();
+    ASSERT_TRUE(exported) << exported.error().description();
+    EXPECT_EQ((*exported)["version"], Value(7));
 }
 
 TEST(AXPlugInCore, DiagnoseReportsTheFirstProblemInOrder) {

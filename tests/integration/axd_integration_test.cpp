@@ -40,8 +40,7 @@ struct Daemon {
         args.insert(args.begin(), axtest::binary("axd"));
         axd = std::make_unique<axtest::Process>(args, std::map<std::string, std::string>{
                                                           {"CORVANE_LOG", "debug"}, {"CORVANE_LOG_SINK", "stderr"}, {"CORVANE_LOG_PRIVATE", "1"}});
-        for (int i = 0; i < 500 && !axtest::exists(rpx::endpointPath("com.corvane.annexa.axd")); ++i)
-            std::this_thread::sleep_for(10ms);
+        axtest::eventually([] { return axtest::exists(rpx::endpointPath("com.corvane.annexa.axd")); });
     }
     ~Daemon() {
         axd->signal(SIGTERM);
@@ -305,8 +304,7 @@ TEST(Axd, CommandLineAndTermination) {
     d.axd->signal(SIGTERM);
     EXPECT_EQ(d.axd->wait(5s), 0);
     EXPECT_NE(d.axd->err().find("termination imminent"), std::string::npos);
-    for (int i = 0; i < 200 && !invalid; ++i) std::this_thread::sleep_for(10ms);
-    EXPECT_TRUE(invalid);
+    EXPECT_TRUE(axtest::eventually([&] { return invalid.load(); }));
     // A second daemon on a served endpoint cannot construct its server.
     Daemon first;
     auto second = axtest::run({axtest::binary("axd")}, {{"CORVANE_LOG_SINK", "stderr"}});

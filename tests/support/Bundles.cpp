@@ -13,7 +13,7 @@ std::string makeBundle(const std::string& parent, const std::string& name, const
                        const std::string& executableSource) {
     std::string path = parent + "/" + name;
     std::filesystem::create_directories(path);
-    corvane::plist::writeXMLFile(path + "/Info.plist", info);
+    if (!corvane::plist::writeXMLFile(path + "/Info.plist", info).ok()) std::abort();
     if (!executableSource.empty()) {
         const std::string* exe = info["KFBundleExecutable"].asString();
         std::string target = path + "/" + (exe ? *exe : "executable");

@@ -146,22 +146,21 @@ void Process::signal(int sig) {
 std::string Process::out() const { return readFile(files_ / "out"); }
 std::string Process::err() const { return readFile(files_ / "err"); }
 
-bool Process::waitForErr(const std::string& text, std::chrono::milliseconds timeout) const {
+bool eventually(const std::function<bool()>& predicate, std::chrono::milliseconds timeout) {
     auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-        if (err().find(text) != std::string::npos) return true;
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    while (!predicate()) {
+        if (std::chrono::steady_clock::now() >= deadline) return predicate();
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
     }
-    return false;
+    return true;
+}
+
+bool Process::waitForErr(const std::string& text, std::chrono::milliseconds timeout) const {
+    return eventually([&] { return err().find(text) != std::string::npos; }, timeout);
 }
 
 bool Process::waitForOut(const std::string& text, std::chrono::milliseconds timeout) const {
-    auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-        if (out().find(text) != std::string::npos) return true;
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return false;
+    return eventually([&] { return out().find(text) != std::string::npos; }, timeout);
 }
 
 RunResult run(std::vector<std::string> argv, std::map<std::string, std::string> env,

@@ -4,6 +4,7 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
@@ -37,6 +38,10 @@ private:
     TempDir dir_;
     std::optional<std::string> previous_;
 };
+
+// Polls `predicate` every few milliseconds until it holds or `timeout` passes; its last answer.
+bool eventually(const std::function<bool()>& predicate,
+                std::chrono::milliseconds timeout = std::chrono::seconds(10));
 
 // Path of a program of this build (build/bin/NAME).
 std::string binary(const std::string& name);
