@@ -54,7 +54,7 @@ void AXDaemonClient::removePlugIns(const std::vector<std::string>& paths, Comple
     send(Value(requestPaths(request::kRemove, paths)), std::move(reply));
 }
 
-void AXDaemonClient::bulkPlugins(uint64_t flags, Completion reply) {
+void AXDaemonClient::bulkPlugIns(uint64_t flags, Completion reply) {
     Dictionary m = request(request::kBulk);
     m[message::kFlags] = Value(flags);
     send(Value(std::move(m)), std::move(reply));
@@ -81,7 +81,7 @@ void AXDaemonClient::matchPlugIns(const Value& rules, uint64_t flags, Completion
     send(Value(std::move(m)), std::move(reply));
 }
 
-void AXDaemonClient::setPluginAnnotations(const std::vector<UUID>& uuids, const Value& annotations,
+void AXDaemonClient::setPlugInAnnotations(const std::vector<UUID>& uuids, const Value& annotations,
                                           Completion reply) {
     Dictionary m = request(request::kAnnotate);
     setUuids(m, uuids);
@@ -89,13 +89,13 @@ void AXDaemonClient::setPluginAnnotations(const std::vector<UUID>& uuids, const 
     send(Value(std::move(m)), std::move(reply));
 }
 
-void AXDaemonClient::bulkSetPluginAnnotations(const Value& annotations, Completion reply) {
+void AXDaemonClient::bulkSetPlugInAnnotations(const Value& annotations, Completion reply) {
     Dictionary m = request(request::kBulkAnnotate);
     m[message::kAnnotations] = convertValueToMessage(annotations);
     send(Value(std::move(m)), std::move(reply));
 }
 
-void AXDaemonClient::holdPlugins(const std::vector<std::string>& paths, uint64_t flags, Completion reply) {
+void AXDaemonClient::holdPlugIns(const std::vector<std::string>& paths, uint64_t flags, Completion reply) {
     Dictionary m = requestPaths(request::kLock, paths);
     m[message::kFlags] = Value(flags);
     send(Value(std::move(m)), std::move(reply));

@@ -30,13 +30,13 @@ public:
 
     void addPlugIns(const std::vector<std::string>& paths, Completion reply);
     void removePlugIns(const std::vector<std::string>& paths, Completion reply);
-    void bulkPlugins(uint64_t flags, Completion reply);
+    void bulkPlugIns(uint64_t flags, Completion reply);
     void readyPlugIns(const std::vector<UUID>& uuids, uint64_t flags, Completion reply);
     void accessPlugIns(const std::vector<UUID>& uuids, uint64_t flags, Completion reply);
     void matchPlugIns(const Value& rules, uint64_t flags, Completion reply);
-    void setPluginAnnotations(const std::vector<UUID>& uuids, const Value& annotations, Completion reply);
-    void bulkSetPluginAnnotations(const Value& annotations, Completion reply);
-    void holdPlugins(const std::vector<std::string>& paths, uint64_t flags, Completion reply);
+    void setPlugInAnnotations(const std::vector<UUID>& uuids, const Value& annotations, Completion reply);
+    void bulkSetPlugInAnnotations(const Value& annotations, Completion reply);
+    void holdPlugIns(const std::vector<std::string>& paths, uint64_t flags, Completion reply);
     void releaseHold(const UUID& token, Completion reply);
     void copyReceipt(Completion reply);
 

@@ -33,19 +33,16 @@ AXPlugInCore::~AXPlugInCore() = default;
 
 // ---- set-up
 
-std::shared_ptr<AXPlugInCore> AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(
-    const std::optional<std::string>& name, const std::optional<std::string>& url,
-    const Value& bundleInfo, const Value& info, const std::optional<UUID>& uuid) {
+std::shared_ptr<AXPlugInCore> AXPlugInCore::fromSetup(const AXPlugInSetup& setup) {
     auto record = std::make_shared<AXPlugInCore>();
-    if (!record->setupWithNameUrlBundleInfoInfoUuid(name, url, bundleInfo, info, uuid)) return nullptr;
-    if (record->plugInDictionary().isNull()) record->setPlugInDictionary(info);
+    if (!record->setup(setup)) return nullptr;
+    if (record->plugInDictionary().isNull()) record->setPlugInDictionary(setup.info);
     return record;
 }
 
-bool AXPlugInCore::setupWithNameUrlBundleInfoInfoUuid(const std::optional<std::string>& name,
-                                                      const std::optional<std::string>& url,
-                                                      const Value& bundleInfo, const Value& /*info*/,
-                                                      const std::optional<UUID>& uuid) {
+bool AXPlugInCore::setup(const AXPlugInSetup& setup) {
+    const auto& [name, url, bundleInfo, info, uuid] = setup;
+    (void)info;  // the plug-in dictionary comes from the bundle metadata here
     if (!url) return false;
     if (!name) {
         log::error(logOps(), "missing identifier in plug-in at %@", *url);
@@ -94,8 +91,7 @@ bool AXPlugInCore::setupWithForm(const Value& f) {
         if (auto parsed = UUID::parse(*text)) uuid = *parsed;
     }
     const Value& bundleInfo = f[form::kBundleInfo].isDictionary() ? f[form::kBundleInfo] : Value::null();
-    if (!setupWithNameUrlBundleInfoInfoUuid(stringOf(f[form::kIdentifier]), stringOf(f[form::kPath]),
-                                            bundleInfo, f[form::kInfo], uuid))
+    if (!setup({.name = stringOf(f[form::kIdentifier]), .url = stringOf(f[form::kPath]), .bundleInfo = bundleInfo, .info = f[form::kInfo], .uuid = uuid}))
         return false;
     const Value& hub = f[form::kHubProtocolVersion];
     setHubProtocolVersion(hub.isNumber() ? static_cast<uint32_t>(*hub.uint64Value()) : 1);

@@ -4,7 +4,7 @@
 // Two dictionaries carry the description: the bundle metadata (the bundle's whole Info.plist) and
 // the plug-in dictionary (its "KSExtension" entry, which holds the attributes under
 // "KSExtensionAttributes"). A record is built from a name, a location and bundle metadata
-// (initWithNameUrlBundleInfoInfoUuid), from a plug-in form received over the wire (initWithForm),
+// (fromSetup), from a plug-in form received over the wire (initWithForm),
 // or in the daemon from the application registry's record (a subclass). Two records are equal
 // exactly when their UUIDs are equal.
 //
@@ -57,7 +57,7 @@ inline constexpr const char* kUUIDMatch = "com.corvane.uuid";
 inline constexpr const char* kDataProtocol = "#Data";
 inline constexpr const char* kDefaultSpec = "KSObject";
 inline constexpr const char* kManagerEntitlement = "com.corvane.private.annexa.manager";
-inline constexpr const char* kAllowedPluginsEntitlement = "com.corvane.developer.annexa.allowedplugins";
+inline constexpr const char* kAllowedPlugInsEntitlement = "com.corvane.developer.annexa.allowedplugins";
 inline constexpr const char* kReplaceEntitlement = "com.corvane.developer.replace-plugin";
 inline constexpr const char* kAutoElectEntitlement = "com.corvane.developer.auto-elect-plugin";
 inline constexpr const char* kElection = "election";
@@ -94,6 +94,15 @@ inline constexpr const char* kOverriding = "overriding";
 // Thread-safe: object-valued fields are read and written whole under the record's lock, so a
 // reader never sees half a value and keeps a consistent one after a concurrent change; scalars are
 // atomics.
+// What a record is set up from. Without a uuid the record gets a random one.
+struct AXPlugInSetup {
+    std::optional<std::string> name{};
+    std::optional<std::string> url{};  // the bundle's location
+    Value bundleInfo{};                 // the bundle metadata (Info.plist)
+    Value info{};                       // the plug-in dictionary, when the metadata has none
+    std::optional<UUID> uuid{};
+};
+
 class AXPlugInCore {
 public:
     // `init`: an empty record.
@@ -102,15 +111,13 @@ public:
     AXPlugInCore(const AXPlugInCore&) = delete;
     AXPlugInCore& operator=(const AXPlugInCore&) = delete;
 
-    // A record set up from a name, a location and bundle metadata; null when set-up fails. When the
-    // bundle metadata gave no plug-in dictionary, `info` becomes it.
-    static std::shared_ptr<AXPlugInCore> initWithNameUrlBundleInfoInfoUuid(
-        const std::optional<std::string>& name, const std::optional<std::string>& url,
-        const Value& bundleInfo, const Value& info, const std::optional<UUID>& uuid);
-    bool setupWithNameUrlBundleInfoInfoUuid(const std::optional<std::string>& name,
-                                            const std::optional<std::string>& url,
-                                            const Value& bundleInfo, const Value& info,
-                                            const std::optional<UUID>& uuid);
+    // A record set up from a name, a location and bundle metadata (the design's
+    // `initWithName:url:bundleInfo:info:uuid:`); null when set-up fails. When the bundle metadata
+    // gave no plug-in dictionary, `info` becomes it.
+    static std::shared_ptr<AXPlugInCore> fromSetup(const AXPlugInSetup& setup);
+    // `setupWithName:url:bundleInfo:info:uuid:`: false without a location or a name, or when the
+    // bundle metadata is malformed.
+    bool setup(const AXPlugInSetup& setup);
     bool setDictionaries(const Value& bundleInfo);
     // A hook for subclasses; the shared code returns its argument.
     virtual Value normalizeInfoDictionary(const Value& bundleInfo);

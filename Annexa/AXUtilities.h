@@ -40,6 +40,9 @@ Dictionary dictionaryChanging(const Value& dictionary, const std::string& key, c
 Dictionary dictionaryChanging(const Dictionary& dictionary, const std::string& key,
                               const Value& value);
 
+// Whether an entitlement's value grants it: present and not false (by the number-boolean rule).
+inline bool entitlementGranted(const Value& value) { return !value.isNull() && !value.isFalse(); }
+
 // The integer value of a stored value: a number's (doubles truncated), a text's leading decimal
 // digits as strtoll reads them (0 without any), and 0 for anything else.
 int64_t integerValueOf(const Value& value);

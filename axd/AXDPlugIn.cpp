@@ -11,14 +11,14 @@ namespace annexa {
 namespace log = corvane::log;
 using corvane::vantry::Scope;
 
-std::shared_ptr<AXDPlugIn> AXDPlugIn::initWithVTData(const corvane::vantry::PlugInRecordPtr& r) {
+std::shared_ptr<AXDPlugIn> AXDPlugIn::fromRegistryRecord(const corvane::vantry::PlugInRecordPtr& r) {
     if (!r || r->bundlePath().empty()) return nullptr;
     auto p = std::make_shared<AXDPlugIn>();
     // The registry record answers every lookup, so it is in place before anything asks.
     p->setVtproxy(r);
     std::optional<std::string> name;
     if (!r->identifier().empty()) name = r->identifier();
-    if (!p->setupWithNameUrlBundleInfoInfoUuid(name, r->bundlePath(), Value(), r->pluginDictionary(), r->uuid()))
+    if (!p->setup({.name = name, .url = r->bundlePath(), .info = r->pluginDictionary(), .uuid = r->uuid()}))
         return nullptr;
     p->setPlugInDictionary(r->pluginDictionary());
     p->setEntitlements(r->entitlements());
@@ -110,10 +110,7 @@ Status AXDPlugIn::diagnose() const {
 
 Value AXDPlugIn::valueForEntitlement(const std::string& key) const { return entitlements()[key]; }
 
-bool AXDPlugIn::hasEntitlement(const std::string& key) const {
-    Value v = valueForEntitlement(key);
-    return !v.isNull() && !v.isFalse();
-}
+bool AXDPlugIn::hasEntitlement(const std::string& key) const { return entitlementGranted(valueForEntitlement(key)); }
 
 std::string AXDPlugIn::annotationKey() const {
     Value replaced = valueForEntitlement(keys::kReplaceEntitlement);

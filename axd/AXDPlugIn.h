@@ -18,7 +18,7 @@ class AXDPlugIn : public AXPlugInCore {
 public:
     // A record for the registry's record, or null: no bundle location, no identifier, or a
     // misconfigured plug-in (logged).
-    static std::shared_ptr<AXDPlugIn> initWithVTData(const corvane::vantry::PlugInRecordPtr& record);
+    static std::shared_ptr<AXDPlugIn> fromRegistryRecord(const corvane::vantry::PlugInRecordPtr& record);
 
     Value infoKey(std::string_view key) const override;
     Value pluginKey(std::string_view key) const override;

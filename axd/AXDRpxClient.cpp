@@ -64,8 +64,7 @@ Value AXDRpxClient::entitlementValueForKey(const std::string& key) const {
 }
 
 bool AXDRpxClient::hasEntitlement(const std::string& key) const {
-    Value v = entitlementValueForKey(key);
-    return !v.isNull() && !v.isFalse();
+    return entitlementGranted(entitlementValueForKey(key));
 }
 
 void AXDRpxClient::dying() { log::debug(logOps(), "client %d termination imminent", pid_); }

@@ -34,8 +34,7 @@ AXDServer::AXDServer(const char* database, std::shared_ptr<corvane::vantry::Regi
     : AXDatabase(database, std::move(registry)),
       rpxQueue_(Queue::create("rpx")),
       mainQueue_(Queue::create("service", corvane::dispatch::QoS::UserInitiated)),
-      syncQueue_(Queue::create("serverSync")),
-      holdQueue_(*syncQueue_) {}
+      syncQueue_(Queue::create("serverSync")) {}
 
 std::shared_ptr<AXDServer> AXDServer::initForService(const std::string& serviceName, const char* database,
                                                      std::shared_ptr<corvane::vantry::Registry> registry) {
@@ -70,16 +69,16 @@ void AXDServer::run() {
 void AXDServer::submitWork(std::function<void()> work) { mainQueue_->async(std::move(work)); }
 
 void AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
-    holdQueue_.sync([&] {
-        holdQueue_.assertCurrent();
+    syncQueue_->sync([&] {
+        syncQueue_->assertCurrent();
         holds_.push_back(std::move(hold));
     });
     (void)corvane::notify::post(kAnnotationChangeNotification);
 }
 
 void AXDServer::unholdToken(const UUID& token) {
-    holdQueue_.sync([&] {
-        holdQueue_.assertCurrent();
+    syncQueue_->sync([&] {
+        syncQueue_->assertCurrent();
         for (auto it = holds_.begin(); it != holds_.end(); ++it) {
             if ((*it)->uuid() != token) continue;
             log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token.string());
@@ -91,8 +90,8 @@ void AXDServer::unholdToken(const UUID& token) {
 }
 
 void AXDServer::unholdClient(const AXDRpxClient* client) {
-    holdQueue_.sync([&] {
-        holdQueue_.assertCurrent();
+    syncQueue_->sync([&] {
+        syncQueue_->assertCurrent();
         for (;;) {
             auto it = std::find_if(holds_.begin(), holds_.end(),
                                    [&](const auto& h) { return h->heldBy(client); });
@@ -106,15 +105,15 @@ void AXDServer::unholdClient(const AXDRpxClient* client) {
 }
 
 bool AXDServer::holdOnPlugIn(const AXDPlugIn& plugIn) {
-    return holdQueue_.syncResult([&] {
-        holdQueue_.assertCurrent();
+    return syncQueue_->syncResult([&] {
+        syncQueue_->assertCurrent();
         return std::any_of(holds_.begin(), holds_.end(), [&](const auto& h) { return h->blocks(plugIn); });
     });
 }
 
 size_t AXDServer::holdCount() {
-    return holdQueue_.syncResult([&] {
-        holdQueue_.assertCurrent();
+    return syncQueue_->syncResult([&] {
+        syncQueue_->assertCurrent();
         return holds_.size();
     });
 }

@@ -75,9 +75,8 @@ private:
     corvane::dispatch::QueuePtr mainQueue_;
     std::shared_ptr<corvane::rpx::Listener> service_;
     std::unique_ptr<AXDUserPrefs> userPrefs_;
-    corvane::dispatch::QueuePtr syncQueue_;
-    corvane::dispatch::Queue& holdQueue_;
-    std::vector<std::shared_ptr<AXDPlugInHold>> holds_ GUARDED_BY(holdQueue_);
+    const corvane::dispatch::QueuePtr syncQueue_;
+    std::vector<std::shared_ptr<AXDPlugInHold>> holds_ GUARDED_BY(*syncQueue_);
 };
 
 }  // namespace annexa

@@ -11,12 +11,11 @@ using corvane::vantry::PlugInRecordPtr;
 
 AXDatabase::AXDatabase(const char* database, std::shared_ptr<corvane::vantry::Registry> workspace)
     : workspace_(std::move(workspace)),
-      sync_(corvane::dispatch::Queue::create("AXDatabase")),
-      syncQueue_(*sync_) {
+      databaseQueue_(corvane::dispatch::Queue::create("AXDatabase")) {
     // Made before the queue serves anything; nothing else can see it yet.
     auto store = std::make_unique<AXDAnnotationStore>(database);
-    syncQueue_.sync([&] {
-        syncQueue_.assertCurrent();
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
         annotations_ = std::move(store);
     });
     subscription_ = workspace_->subscribe(*this);
@@ -25,10 +24,10 @@ AXDatabase::AXDatabase(const char* database, std::shared_ptr<corvane::vantry::Re
 AXDatabase::~AXDatabase() = default;
 
 AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
-    syncQueue_.assertNotCurrent();
+    databaseQueue_->assertNotCurrent();
     AXDPlugInPtr result;
-    syncQueue_.sync([&] {
-        syncQueue_.assertCurrent();
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
         auto it = cache_.find(record->uuid());
         result = it != cache_.end() ? it->second : createPlugInForProxy(record);
     });
@@ -36,8 +35,8 @@ AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
 }
 
 AXDPlugInPtr AXDatabase::createPlugInForProxy(const PlugInRecordPtr& record) {
-    syncQueue_.assertCurrent();
-    AXDPlugInPtr plugIn = AXDPlugIn::initWithVTData(record);
+    databaseQueue_->assertCurrent();
+    AXDPlugInPtr plugIn = AXDPlugIn::fromRegistryRecord(record);
     if (!plugIn) return nullptr;
     // The record is stored only once built, and elected first when it asks for that.
     if (plugIn->hasEntitlement(keys::kAutoElectEntitlement)) autoElect(*plugIn);
@@ -47,7 +46,7 @@ AXDPlugInPtr AXDatabase::createPlugInForProxy(const PlugInRecordPtr& record) {
 }
 
 void AXDatabase::purgeCachesToLimit(int32_t limit) {
-    syncQueue_.assertCurrent();
+    databaseQueue_->assertCurrent();
     if (cache_.size() <= static_cast<uint32_t>(limit)) return;
     log::info(logOps(), "purging cache for %d > %d", static_cast<int>(cache_.size()), limit);
     cache_.clear();
@@ -55,10 +54,10 @@ void AXDatabase::purgeCachesToLimit(int32_t limit) {
 }
 
 AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) {
-    syncQueue_.assertNotCurrent();
+    databaseQueue_->assertNotCurrent();
     AXDPlugInPtr result;
-    syncQueue_.sync([&] {
-        syncQueue_.assertCurrent();
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
         auto it = cache_.find(uuid);
         if (it != cache_.end()) {
             result = it->second;
@@ -112,17 +111,17 @@ uint32_t AXDatabase::cacheLimitFromText(const char* text) {
 }
 
 Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {
-    syncQueue_.assertNotCurrent();
-    return syncQueue_.syncResult([&] {
-        syncQueue_.assertCurrent();
+    databaseQueue_->assertNotCurrent();
+    return databaseQueue_->syncResult([&] {
+        databaseQueue_->assertCurrent();
         return annotations_->annotationForPlugIn(plugIn);
     });
 }
 
 void AXDatabase::setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn) {
-    syncQueue_.assertNotCurrent();
-    syncQueue_.sync([&] {
-        syncQueue_.assertCurrent();
+    databaseQueue_->assertNotCurrent();
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
         annotations_->setAnnotationForPlugIn(annotation, plugIn);
     });
 }
@@ -130,7 +129,7 @@ void AXDatabase::setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn
 void AXDatabase::notifyAnnotationChange() { (void)corvane::notify::post(kAnnotationChangeNotification); }
 
 void AXDatabase::autoElect(const AXDPlugIn& plugIn) {
-    syncQueue_.assertCurrent();
+    databaseQueue_->assertCurrent();
     Value current = annotations_->annotationForPlugIn(plugIn);
     const Value* election = current.find(keys::kElection);
     // An election already made is never overridden.
@@ -146,9 +145,9 @@ void AXDatabase::pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) 
 }
 
 void AXDatabase::pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) {
-    syncQueue_.assertNotCurrent();
-    syncQueue_.sync([&] {
-        syncQueue_.assertCurrent();
+    databaseQueue_->assertNotCurrent();
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
         for (const auto& r : records) {
             log::notice(logOps(), "plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", r->bundleIdentifier(),
                         r->identifier(), r->bundleVersion(), r->uuid().string(), r->bundlePath());
@@ -159,15 +158,15 @@ void AXDatabase::pluginsWillUninstall(const std::vector<PlugInRecordPtr>& record
 }
 
 size_t AXDatabase::cacheCount() {
-    return syncQueue_.syncResult([&] {
-        syncQueue_.assertCurrent();
+    return databaseQueue_->syncResult([&] {
+        databaseQueue_->assertCurrent();
         return cache_.size();
     });
 }
 
 std::string AXDatabase::annotationsURL() {
-    return syncQueue_.syncResult([&] {
-        syncQueue_.assertCurrent();
+    return databaseQueue_->syncResult([&] {
+        databaseQueue_->assertCurrent();
         return annotations_->annotationsURL();
     });
 }

@@ -44,8 +44,8 @@ public:
     AXDatabase& operator=(const AXDatabase&) = delete;
 
     AXDPlugInPtr plugInForProxy(const corvane::vantry::PlugInRecordPtr& record);
-    AXDPlugInPtr createPlugInForProxy(const corvane::vantry::PlugInRecordPtr& record) REQUIRES(syncQueue_);
-    void purgeCachesToLimit(int32_t limit) REQUIRES(syncQueue_);
+    AXDPlugInPtr createPlugInForProxy(const corvane::vantry::PlugInRecordPtr& record) REQUIRES(*databaseQueue_);
+    void purgeCachesToLimit(int32_t limit) REQUIRES(*databaseQueue_);
     AXDPlugInPtr findPlugIn(const UUID& uuid);
     AXDPlugInPtr findPlugInAtPath(const std::string& path);
     // Null (not empty) when the application has no plug-ins or is not known.
@@ -56,7 +56,7 @@ public:
     Value annotationForPlugIn(const AXDPlugIn& plugIn);
     void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
     void notifyAnnotationChange();
-    void autoElect(const AXDPlugIn& plugIn) REQUIRES(syncQueue_);
+    void autoElect(const AXDPlugIn& plugIn) REQUIRES(*databaseQueue_);
     // The registry's events, on its event thread.
     void pluginsDidInstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;
     void pluginsWillUninstall(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;
@@ -70,7 +70,7 @@ public:
     static uint32_t cacheLimitFromText(const char* text);
     void setCacheLimit(uint32_t limit) { cacheLimit_.store(limit); }
     corvane::vantry::Registry& workspace() const { return *workspace_; }
-    corvane::dispatch::Queue& databaseQueue() const RETURN_CAPABILITY(syncQueue_) { return syncQueue_; }
+    corvane::dispatch::Queue& databaseQueue() const RETURN_CAPABILITY(*databaseQueue_) { return *databaseQueue_; }
     // The number of cached records (read on the database queue).
     size_t cacheCount();
     // The annotation file's location.
@@ -81,10 +81,9 @@ private:
     std::atomic<AXDatabaseDelegate*> delegate_{nullptr};
     std::atomic<uint32_t> cacheLimit_{0};
     const std::shared_ptr<corvane::vantry::Registry> workspace_;
-    corvane::dispatch::QueuePtr sync_;
-    corvane::dispatch::Queue& syncQueue_;
-    std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(syncQueue_);
-    std::unordered_map<UUID, AXDPlugInPtr, corvane::UUIDHash> cache_ GUARDED_BY(syncQueue_);
+    const corvane::dispatch::QueuePtr databaseQueue_;
+    std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(*databaseQueue_);
+    std::unordered_map<UUID, AXDPlugInPtr, corvane::UUIDHash> cache_ GUARDED_BY(*databaseQueue_);
     // Last, so that it ends first: no event reaches a database being destroyed.
     corvane::vantry::Subscription subscription_;
 };

@@ -48,7 +48,7 @@ vantry::PlugInRecordPtr record(Dictionary changes = {}) {
 }  // namespace
 
 TEST(AXDPlugIn, BuiltFromTheRegistryRecordAndAnsweringFromIt) {
-    auto p = AXDPlugIn::initWithVTData(record());
+    auto p = AXDPlugIn::fromRegistryRecord(record());
     ASSERT_TRUE(p);
     EXPECT_EQ(p->identifier(), std::optional<std::string>("com.example.share"));
     EXPECT_EQ(p->originalIdentifier(), std::optional<std::string>("com.example.app.share"));
@@ -79,12 +79,12 @@ TEST(AXDPlugIn, BuiltFromTheRegistryRecordAndAnsweringFromIt) {
         {{{"plugin", dict({{"KSExtensionAttributes", dict({})}, {"HubProtocolVersion", "x"}})}}, 0},
     };
     for (const auto& h : hubs) {
-        auto q = AXDPlugIn::initWithVTData(record(h.changes));
+        auto q = AXDPlugIn::fromRegistryRecord(record(h.changes));
         ASSERT_TRUE(q);
         EXPECT_EQ(q->hubProtocolVersion(), h.expected);
     }
     log::CaptureSink capture;
-    EXPECT_FALSE(AXDPlugIn::initWithVTData(record({{"identifier", ""}})));
+    EXPECT_FALSE(AXDPlugIn::fromRegistryRecord(record({{"identifier", ""}})));
     EXPECT_TRUE(capture.contains("missing identifier in plug-in at /Apps/Example.app/PlugIns/Share.appex"));
 }
 
@@ -111,7 +111,7 @@ TEST(AXDPlugIn, DaemonDiagnoseRefusesWhatCannotRun) {
     };
     for (const auto& c : cases) {
         log::CaptureSink capture;
-        auto p = AXDPlugIn::initWithVTData(record(c.changes));
+        auto p = AXDPlugIn::fromRegistryRecord(record(c.changes));
         if (!c.error) {
             EXPECT_TRUE(p) << c.name;
         } else {
@@ -138,7 +138,7 @@ TEST(AXDPlugIn, EntitlementsAndTheAnnotationKey) {
     };
     for (const auto& c : cases) {
         Value ents = c.value.isNull() ? dict({}) : dict({{"com.corvane.developer.replace-plugin", c.value}});
-        auto p = AXDPlugIn::initWithVTData(record({{"entitlements", ents}}));
+        auto p = AXDPlugIn::fromRegistryRecord(record({{"entitlements", ents}}));
         EXPECT_EQ(p->hasEntitlement("com.corvane.developer.replace-plugin"), c.held) << c.value.description();
         EXPECT_EQ(p->annotationKey(), c.annotationKey) << c.value.description();
     }
@@ -157,7 +157,7 @@ TEST(AXDPlugIn, ResourceTokensInTheForm) {
         return dict({{"KSExtensionProtocol", "P"}, {"KSExtensionAttributes", dict({})}, {"Shared", s}});
     };
 
-    auto ext = AXDPlugIn::initWithVTData(record({{"path", appex}, {"plugin", pluginWith(shared)}}));
+    auto ext = AXDPlugIn::fromRegistryRecord(record({{"path", appex}, {"plugin", pluginWith(shared)}}));
     Dictionary form;
     ext->augmentForm(form);
     const Dictionary* tokens = form["extensions"].asDictionary();
@@ -169,7 +169,7 @@ TEST(AXDPlugIn, ResourceTokensInTheForm) {
     EXPECT_TRUE(corvane::sandbox::verifyToken(*token));
 
     log::CaptureSink capture;
-    auto tool = AXDPlugIn::initWithVTData(record({{"path", bundle}, {"plugin", pluginWith(shared)}}));
+    auto tool = AXDPlugIn::fromRegistryRecord(record({{"path", bundle}, {"plugin", pluginWith(shared)}}));
     ASSERT_TRUE(tool);
     Dictionary toolForm;
     tool->augmentForm(toolForm);
@@ -181,7 +181,7 @@ TEST(AXDPlugIn, ResourceTokensInTheForm) {
                                  ": No such file or directory"));
     EXPECT_EQ(tool->issueResourceExtensions(Value("Resources/x")).size(), 1u);
 
-    auto none = AXDPlugIn::initWithVTData(
+    auto none = AXDPlugIn::fromRegistryRecord(
         record({{"path", bundle}, {"plugin", dict({{"KSExtensionProtocol", "P"}, {"KSExtensionAttributes", dict({})}})}}));
     Dictionary untouched;
     none->augmentForm(untouched);

@@ -94,7 +94,7 @@ TEST(AXDaemonClient, EveryOperationSendsItsRequestKeyForKey) {
          dict({{"request", "add"}, {"version", version}, {"paths", paths}})},
         {"remove", [&](auto done) { client.removePlugIns({"/a.app", "/b.appex"}, done); },
          dict({{"request", "remove"}, {"version", version}, {"paths", paths}})},
-        {"bulk", [&](auto done) { client.bulkPlugins(7, done); },
+        {"bulk", [&](auto done) { client.bulkPlugIns(7, done); },
          dict({{"request", "bulk"}, {"version", version}, {"flags", uint64_t{7}}})},
         {"ready", [&](auto done) { client.readyPlugIns({a, b}, 1, done); },
          dict({{"request", "ready"}, {"version", version}, {"flags", uint64_t{1}}, {"uuids", uuids}})},
@@ -103,13 +103,13 @@ TEST(AXDaemonClient, EveryOperationSendsItsRequestKeyForKey) {
         {"match", [&](auto done) { client.matchPlugIns(rules, 3, done); },
          dict({{"request", "match"}, {"version", version}, {"rules", *AXDaemonClient::convertToRPX(rules, 3)},
                {"flags", uint64_t{3}}})},
-        {"annotate", [&](auto done) { client.setPluginAnnotations({a, b}, annotations, done); },
+        {"annotate", [&](auto done) { client.setPlugInAnnotations({a, b}, annotations, done); },
          dict({{"request", "annotate"}, {"version", version}, {"uuids", uuids},
                {"annotations", *AXDaemonClient::convertToRPX(annotations, 3)}})},
-        {"bulk-annotate", [&](auto done) { client.bulkSetPluginAnnotations(annotations, done); },
+        {"bulk-annotate", [&](auto done) { client.bulkSetPlugInAnnotations(annotations, done); },
          dict({{"request", "bulk-annotate"}, {"version", version},
                {"annotations", *AXDaemonClient::convertToRPX(annotations, 3)}})},
-        {"hold", [&](auto done) { client.holdPlugins({"/a.app", "/b.appex"}, 0, done); },
+        {"hold", [&](auto done) { client.holdPlugIns({"/a.app", "/b.appex"}, 0, done); },
          dict({{"request", "lock"}, {"version", version}, {"paths", paths}, {"flags", uint64_t{0}}})},
         {"release", [&](auto done) { client.releaseHold(a, done); },
          dict({{"request", "lock"}, {"version", version}, {"uuids", Value(Array{Value(a)})}})},
@@ -130,7 +130,7 @@ TEST(AXDaemonClient, CompletionsRunOnTheReplyQueueInOrder) {
     std::vector<int> order;
     std::vector<std::string> queues;
     for (int i = 0; i < 20; ++i) {
-        client.bulkPlugins(0, [&, i](const Reply& r) {
+        client.bulkPlugIns(0, [&, i](const Reply& r) {
             EXPECT_EQ(r.value, dict({{"fine", true}}));
             std::lock_guard lock(m);
             order.push_back(i);

@@ -184,7 +184,7 @@ TEST(AXDatabase, AutoElectionIsWrittenOnceAndNeverOverridesAnElection) {
     for (const auto& c : cases) {
         AXDatabase db(nullptr, f.registry());
         auto record = f.registry()->plugInForPath(f.auto_);
-        auto p = AXDPlugIn::initWithVTData(record);
+        auto p = AXDPlugIn::fromRegistryRecord(record);
         db.setAnnotationForPlugIn(Value(), *p);
         db.setAnnotationForPlugIn(c.stored, *p);
         db.findPlugIn(*p->uuid());  // a fresh database builds the record: auto-election runs

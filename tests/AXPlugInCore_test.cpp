@@ -22,9 +22,7 @@ Value appexInfo() {
 }
 
 std::shared_ptr<AXPlugInCore> fullRecord() {
-    auto r = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(
-        std::string("com.example.app.share"), std::string("/Apps/Example.app/PlugIns/Share.appex"),
-        appexInfo(), Value(), UUID::random());
+    auto r = AXPlugInCore::fromSetup({.name = "com.example.app.share", .url = "/Apps/Example.app/PlugIns/Share.appex", .bundleInfo = appexInfo(), .uuid = UUID::random()});
     r->setOriginalIdentifier(std::string("com.example.app.share.original"));
     r->setContainingUrl(std::string("/Apps/Example.app"));
     r->setEntitlements(dict({{"com.corvane.developer.replace-plugin", "com.example.old"}}));
@@ -85,8 +83,7 @@ TEST(AXPlugInCore, ExportThenRebuildGivesAnEqualRecord) {
 }
 
 TEST(AXPlugInCore, FormReaderDefaultsAndOddValues) {
-    auto r = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/System/P.appex"),
-                                                             appexInfo(), Value(), std::nullopt);
+    auto r = AXPlugInCore::fromSetup({.name = "p", .url = "/System/P.appex", .bundleInfo = appexInfo()});
     r->setOriginalIdentifier(std::string("p"));
     auto exported = r->exportForm();
     ASSERT_TRUE(exported);
@@ -130,8 +127,7 @@ TEST(AXPlugInCore, ExportNeedsEveryAlwaysPresentValue) {
     ASSERT_FALSE(refused);
     EXPECT_EQ(refused.error().code, 12);
     EXPECT_EQ(refused.error().text, "cannot export plug-in: missing original identifier");
-    auto bare = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/p"), Value(),
-                                                                dict({}), std::nullopt);
+    auto bare = AXPlugInCore::fromSetup({.name = "p", .url = "/p", .info = dict({})});
     bare->setOriginalIdentifier(std::string("p"));
     auto noMetadata = bare->exportForm();
     ASSERT_FALSE(noMetadata);
@@ -168,9 +164,7 @@ TEST(AXPlugInCore, DiagnoseReportsTheFirstProblemInOrder) {
         {"/a/P.bundle", dict({{"KSExtensionAttributes", dict({})}, {"KSExtensionProtocol", "#Data"}}), nullptr},
     };
     for (const auto& c : cases) {
-        auto r = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string(c.path),
-                                                                 dict({{"KSExtension", c.plugin}}), Value(),
-                                                                 std::nullopt);
+        auto r = AXPlugInCore::fromSetup({.name = "p", .url = std::string(c.path), .bundleInfo = dict({{"KSExtension", c.plugin}})});
         ASSERT_TRUE(r);
         corvane::Status usable = r->diagnose();
         if (!c.expected) {
@@ -189,9 +183,7 @@ TEST(AXPlugInCore, DiagnoseReportsTheFirstProblemInOrder) {
 
 TEST(AXPlugInCore, DerivedProperties) {
     auto make = [](const char* path, Value plugin) {
-        return AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string(path),
-                                                               dict({{"KSExtension", plugin}}), Value(),
-                                                               std::nullopt);
+        return AXPlugInCore::fromSetup({.name = "p", .url = std::string(path), .bundleInfo = dict({{"KSExtension", plugin}})});
     };
     auto appex = make("/a/P.appex", dict({}));
     EXPECT_TRUE(appex->isAppExtension());
@@ -215,48 +207,38 @@ TEST(AXPlugInCore, DerivedProperties) {
 
 TEST(AXPlugInCore, SetupRulesAndTheirLogLines) {
     log::CaptureSink capture;
-    EXPECT_FALSE(AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::nullopt, Value(),
-                                                                 Value(), std::nullopt));
+    EXPECT_FALSE(AXPlugInCore::fromSetup({.name = "p"}));
     EXPECT_TRUE(capture.records().empty());  // no url: no message
-    EXPECT_FALSE(AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::nullopt, std::string("/x"), Value(),
-                                                                 Value(), std::nullopt));
+    EXPECT_FALSE(AXPlugInCore::fromSetup({.url = "/x"}));
     EXPECT_TRUE(capture.contains("missing identifier in plug-in at /x"));
     for (const Value& bad : {dict({{"KSExtension", "string"}}), dict({}), Value("not a dictionary")}) {
         capture.clear();
-        EXPECT_FALSE(AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/x"), bad,
-                                                                     Value(), std::nullopt));
+        EXPECT_FALSE(AXPlugInCore::fromSetup({.name = "p", .url = "/x", .bundleInfo = bad}));
         EXPECT_TRUE(capture.contains("malformed plug-in dictionary in plug-in p at /x: ")) << bad.description();
     }
     capture.clear();
-    auto multi = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(
-        std::string("p"), std::string("/x"), dict({{"KSExtension", dict({{"Multiple", true}})}}), Value(),
-        std::nullopt);
+    auto multi = AXPlugInCore::fromSetup({.name = "p", .url = "/x", .bundleInfo = dict({{"KSExtension", dict({{"Multiple", true}})}})});
     ASSERT_TRUE(multi);
     EXPECT_EQ(capture.count("multiplexed plug-ins (Multiple key) obsolete and ignored"), 1u);
 
     // Without bundle metadata, `info` becomes the plug-in dictionary; set-up alone does not.
     Value info = dict({{"KSExtensionProtocol", "X"}});
-    auto noMetadata = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/x"),
-                                                                      Value(), info, std::nullopt);
+    auto noMetadata = AXPlugInCore::fromSetup({.name = "p", .url = "/x", .info = info});
     ASSERT_TRUE(noMetadata);
     EXPECT_EQ(noMetadata->plugInDictionary(), info);
     EXPECT_TRUE(noMetadata->infoKey("KSExtension").isNull());
     AXPlugInCore plain;
-    EXPECT_TRUE(plain.setupWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/x"), Value(), info,
-                                                         std::nullopt));
+    EXPECT_TRUE(plain.setup({.name = "p", .url = "/x", .info = info}));
     EXPECT_TRUE(plain.plugInDictionary().isNull());
     // Fresh UUIDs differ; a given one is kept.
-    auto a = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/x"), Value(),
-                                                             info, std::nullopt);
+    auto a = AXPlugInCore::fromSetup({.name = "p", .url = "/x", .info = info});
     EXPECT_FALSE(*a == *noMetadata);
 }
 
 TEST(AXPlugInCore, IdentityAndAnnotations) {
     UUID u = UUID::random();
-    auto a = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("a"), std::string("/a"), Value(),
-                                                             dict({}), u);
-    auto b = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("b"), std::string("/b"),
-                                                             dict({{"KSExtension", dict({})}}), Value(), u);
+    auto a = AXPlugInCore::fromSetup({.name = "a", .url = "/a", .info = dict({}), .uuid = u});
+    auto b = AXPlugInCore::fromSetup({.name = "b", .url = "/b", .bundleInfo = dict({{"KSExtension", dict({})}}), .uuid = u});
     EXPECT_TRUE(*a == *b);
     EXPECT_EQ(a->hash(), b->hash());
     a->setAnnotationValue("election", 1);
@@ -272,11 +254,7 @@ TEST(AXPlugInCore, IdentityAndAnnotations) {
 TEST(AXPlugInCore, SdkResolutionFollowsTheLookupsAndTheRecordsSource) {
     axtest::PlatformRoot root;
     log::CaptureSink capture;
-    auto r = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(
-        std::string("p"), std::string("/x/P.appex"),
-        dict({{"KFBundleShortVersionString", "3"},
-              {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.corvane.unregistered"}})}}),
-        Value(), std::nullopt);
+    auto r = AXPlugInCore::fromSetup({.name = "p", .url = "/x/P.appex", .bundleInfo = dict({{"KFBundleShortVersionString", "3"}, {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.corvane.unregistered"}})}})});
     r->resolveSDK();
     EXPECT_TRUE(capture.contains("plug-in sdk \"com.corvane.unregistered\" not registered"));
     EXPECT_EQ(r->version(), Value("3"));
@@ -285,8 +263,7 @@ TEST(AXPlugInCore, SdkResolutionFollowsTheLookupsAndTheRecordsSource) {
     o.plugin = dict({{"KSExtensionPointIdentifier", "com.corvane.x"}, {"KSExtensionProtocol", "P"},
                      {"KSExtensionAttributes", dict({})}});
     o.sdk = dict({{"KSExtension", dict({{"KSExtensionAttributes", dict({{"KSExtensionPointName", "X"}})}})}});
-    ASSERT_TRUE(o.setupWithNameUrlBundleInfoInfoUuid(std::string("o"), std::string("/x/O.appex"),
-                                                     dict({{"KSExtension", dict({})}}), Value(), std::nullopt));
+    ASSERT_TRUE(o.setup({.name = "o", .url = "/x/O.appex", .bundleInfo = dict({{"KSExtension", dict({})}})}));
     EXPECT_EQ(o.protocolSpec(), Value("P"));  // derived properties follow the override
     EXPECT_TRUE(o.diagnose().ok());
     o.resolveSDK();
@@ -296,9 +273,7 @@ TEST(AXPlugInCore, SdkResolutionFollowsTheLookupsAndTheRecordsSource) {
     EXPECT_EQ(o.plugInDictionary()["KSExtensionAttributes"]["KSExtensionVersion"], Value("9.9"));
 
     capture.clear();
-    auto invalid = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(
-        std::string("p"), std::string("/x/P.appex"),
-        dict({{"KSExtension", dict({{"KSExtensionPointIdentifier", 7}})}}), Value(), std::nullopt);
+    auto invalid = AXPlugInCore::fromSetup({.name = "p", .url = "/x/P.appex", .bundleInfo = dict({{"KSExtension", dict({{"KSExtensionPointIdentifier", 7}})}})});
     invalid->resolveSDK();
     EXPECT_TRUE(capture.contains("invalid SDK key:7"));
     EXPECT_FALSE(invalid->plugInDictionary().has("KSExtensionAttributes"));
@@ -309,8 +284,7 @@ TEST(AXPlugInCoreDeathTest, BrokenPreconditionsAbort) {
     EXPECT_DEATH(AXPlugInCore().resolveSDK(), "cannot resolve SDK without materialized Info.plist");
     EXPECT_DEATH(
         {
-            auto r = AXPlugInCore::initWithNameUrlBundleInfoInfoUuid(std::string("p"), std::string("/x"),
-                                                                     Value(), dict({}), std::nullopt);
+            auto r = AXPlugInCore::fromSetup({.name = "p", .url = "/x", .info = dict({})});
             (void)r->oldStyle();
         },
         "unknown plug-in configuration style");

@@ -150,7 +150,7 @@ int main(int argc, char** argv) {
         if (uuids.empty()) return usageError("annotate needs at least one UUID");
         AXDaemonClient client(service);
         auto reply =
-            client.wait([&](auto done) { client.setPluginAnnotations(uuids, Value(annotations), done); });
+            client.wait([&](auto done) { client.setPlugInAnnotations(uuids, Value(annotations), done); });
         return finish(reply, service);
     }
     if (command == "bulk-annotate") {
@@ -161,7 +161,7 @@ int main(int argc, char** argv) {
             return kDataError;
         }
         AXDaemonClient client(service);
-        auto reply = client.wait([&](auto done) { client.bulkSetPluginAnnotations(*table, done); });
+        auto reply = client.wait([&](auto done) { client.bulkSetPlugInAnnotations(*table, done); });
         return finish(reply, service);
     }
     return usageError("unknown command " + command);

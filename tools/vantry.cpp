@@ -25,58 +25,6 @@ const char* kUsage =
     "       vantry rebuild                            move a damaged database aside and register again\n"
     "The registry lives under the platform root (CORVANE_ROOT).\n";
 
-// JSON for tools that read it: dates as RFC 3339 text, data and UUIDs as strings.
-void json(std::string& out, const Value& v) {
-    using K = Value::Kind;
-    switch (v.kind()) {
-        case K::Null: out += "null"; break;
-        case K::Bool: out += *v.boolValue() ? "true" : "false"; break;
-        case K::Int64: out += std::to_string(*v.int64Value()); break;
-        case K::UInt64: out += std::to_string(*v.uint64Value()); break;
-        case K::Double: {
-            // JSON has no infinities or not-a-number; those print as null.
-            double d = *v.doubleValue();
-            char buf[32];
-            std::snprintf(buf, sizeof buf, "%.17g", d);
-            out += std::isfinite(d) ? buf : "null";
-            break;
-        }
-        case K::String: appendJsonString(out, *v.asString()); break;
-        case K::UUID: appendJsonString(out, v.asUUID()->string()); break;
-        case K::Date:
-        case K::Data:
-        case K::Fd: {
-            std::string d = v.description();
-            appendJsonString(out, d[0] == '@' ? d.substr(1) : d);
-            break;
-        }
-        case K::Array: {
-            out.push_back('[');
-            bool first = true;
-            for (const Value& e : *v.asArray()) {
-                if (!first) out.push_back(',');
-                first = false;
-                json(out, e);
-            }
-            out.push_back(']');
-            break;
-        }
-        case K::Dictionary: {
-            out.push_back('{');
-            bool first = true;
-            for (const auto& [k, e] : *v.asDictionary()) {
-                if (!first) out.push_back(',');
-                first = false;
-                appendJsonString(out, k);
-                out.push_back(':');
-                json(out, e);
-            }
-            out.push_back('}');
-            break;
-        }
-    }
-}
-
 Value recordValue(const PlugInRecordPtr& r) {
     Value v = r->serialize();
     return v;
@@ -170,9 +118,7 @@ int main(int argc, char** argv) {
         if (asJson) {
             Array list;
             for (const auto& r : plugins) list.push_back(recordValue(r));
-            std::string out;
-            json(out, Value(std::move(list)));
-            std::printf("%s\n", out.c_str());
+            std::printf("%s\n", Value(std::move(list)).json().c_str());
             return 0;
         }
         std::string lastApp = "-";
@@ -198,12 +144,7 @@ int main(int argc, char** argv) {
             std::fprintf(stderr, "vantry: no plug-in %s\n", operands[0].c_str());
             return 1;
         }
-        std::string out;
-        if (asJson) {
-            json(out, recordValue(r));
-        } else {
-            out = recordValue(r).description();
-        }
+        std::string out = asJson ? recordValue(r).json() : recordValue(r).description();
         std::printf("%s\n", out.c_str());
         return 0;
     }

@@ -102,7 +102,7 @@ int64_t annexa_annotate(annexa_client* client, const char* const* uuids, size_t 
     auto value = corvane::Value::parse(annotations);
     if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
     AXDaemonClient& c = client->client;
-    return finish(c.wait([&](AXDaemonClient::Completion done) { c.setPluginAnnotations(list, *value, std::move(done)); }),
+    return finish(c.wait([&](AXDaemonClient::Completion done) { c.setPlugInAnnotations(list, *value, std::move(done)); }),
                   error_text);
 }
 
@@ -111,7 +111,7 @@ int64_t annexa_bulk_annotate(annexa_client* client, const char* annotations, cha
     auto value = corvane::Value::parse(annotations);
     if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
     AXDaemonClient& c = client->client;
-    return finish(c.wait([&](AXDaemonClient::Completion done) { c.bulkSetPluginAnnotations(*value, std::move(done)); }),
+    return finish(c.wait([&](AXDaemonClient::Completion done) { c.bulkSetPlugInAnnotations(*value, std::move(done)); }),
                   error_text);
 }
 

@@ -175,6 +175,9 @@ public:
 
     // The text notation (docs/rpx-wire.md): round-trips through parse().
     std::string description() const;
+    // JSON, for tools that print records: a UUID, data, a date or a descriptor is its text-notation
+    // form as a string (a date without the "@"), a non-finite double is null.
+    std::string json() const;
     // Reads one value in the text notation; nullopt on anything malformed or trailing text.
     static std::optional<Value> parse(std::string_view text);
 

@@ -107,8 +107,19 @@ void appendDate(std::string& out, Date date) {
     out.push_back('Z');
 }
 
-void describe(std::string& out, const Value& v) {
+// The text notation, or JSON: the same walk, with JSON's forms for what JSON has no literal of (a
+// UUID, data, a date or a descriptor is the text notation's form as a string, "@" dropped from a
+// date; an unsigned integer has no "u"; a non-finite double is null).
+enum class Notation { Text, Json };
+
+void write(std::string& out, const Value& v, Notation notation) {
     using K = Value::Kind;
+    const bool json = notation == Notation::Json;
+    auto asJsonString = [&](const Value& scalar) {
+        std::string text;
+        write(text, scalar, Notation::Text);
+        appendJsonString(out, text[0] == '@' ? std::string_view(text).substr(1) : std::string_view(text));
+    };
     char buf[48];
     switch (v.kind()) {
         case K::Null: out += "null"; break;
@@ -118,12 +129,21 @@ void describe(std::string& out, const Value& v) {
             out += buf;
             break;
         case K::UInt64:
-            std::snprintf(buf, sizeof buf, "%" PRIu64 "u", *v.uint64Value());
+            std::snprintf(buf, sizeof buf, json ? "%" PRIu64 : "%" PRIu64 "u", *v.uint64Value());
             out += buf;
             break;
-        case K::Double: appendDouble(out, *v.doubleValue()); break;
+        case K::Double:
+            if (json) {
+                double d = *v.doubleValue();
+                std::snprintf(buf, sizeof buf, "%.17g", d);
+                out += std::isfinite(d) ? buf : "null";
+            } else {
+                appendDouble(out, *v.doubleValue());
+            }
+            break;
         case K::String: appendJsonString(out, *v.asString()); break;
         case K::Data: {
+            if (json) return asJsonString(v);
             static const char* hex = "0123456789abcdef";
             out.push_back('<');
             for (uint8_t b : *v.asData()) {
@@ -133,16 +153,25 @@ void describe(std::string& out, const Value& v) {
             out.push_back('>');
             break;
         }
-        case K::Date: appendDate(out, *v.asDate()); break;
-        case K::UUID: out += "uuid(" + v.asUUID()->string() + ")"; break;
-        case K::Fd: out += "fd(" + std::to_string((*v.asFd())->get()) + ")"; break;
+        case K::Date:
+            if (json) return asJsonString(v);
+            appendDate(out, *v.asDate());
+            break;
+        case K::UUID:
+            if (json) return appendJsonString(out, v.asUUID()->string());
+            out += "uuid(" + v.asUUID()->string() + ")";
+            break;
+        case K::Fd:
+            if (json) return asJsonString(v);
+            out += "fd(" + std::to_string((*v.asFd())->get()) + ")";
+            break;
         case K::Array: {
             out.push_back('[');
             bool first = true;
             for (const Value& e : *v.asArray()) {
-                if (!first) out += ", ";
+                if (!first) out += json ? "," : ", ";
                 first = false;
-                describe(out, e);
+                write(out, e, notation);
             }
             out.push_back(']');
             break;
@@ -151,11 +180,11 @@ void describe(std::string& out, const Value& v) {
             out.push_back('{');
             bool first = true;
             for (const auto& [key, e] : *v.asDictionary()) {
-                if (!first) out += ", ";
+                if (!first) out += json ? "," : ", ";
                 first = false;
                 appendJsonString(out, key);
-                out += ": ";
-                describe(out, e);
+                out += json ? ":" : ": ";
+                write(out, e, notation);
             }
             out.push_back('}');
             break;
@@ -489,7 +518,13 @@ private:
 
 std::string Value::description() const {
     std::string out;
-    describe(out, *this);
+    write(out, *this, Notation::Text);
+    return out;
+}
+
+std::string Value::json() const {
+    std::string out;
+    write(out, *this, Notation::Json);
     return out;
 }
 
