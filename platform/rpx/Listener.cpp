@@ -84,12 +84,22 @@ Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, disp
             return Error{kPosixErrorDomain, EADDRINUSE,
                          "endpoint \"" + name + "\" is already served by another process"};
     }
-    ::unlink(path.c_str());
+    // The socket is bound under a private name and renamed into place once it listens, so the
+    // endpoint's name never shows a socket that refuses connections (a client or a second daemon
+    // would take it for a dead one).
+    std::string staging = dir + "/." + name + "." + std::to_string(::getpid());
+    struct sockaddr_un stagingAddr {};
+    stagingAddr.sun_family = AF_UNIX;
+    if (staging.size() >= sizeof stagingAddr.sun_path) return Error::posix(ENAMETOOLONG, staging);
+    std::memcpy(stagingAddr.sun_path, staging.c_str(), staging.size() + 1);
+    ::unlink(staging.c_str());
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
     if (fd < 0) return Error::posix(errno, "socket");
-    if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 || listen(fd, 128) != 0) {
+    if (bind(fd, reinterpret_cast<sockaddr*>(&stagingAddr), sizeof stagingAddr) != 0 || listen(fd, 128) != 0 ||
+        ::rename(staging.c_str(), path.c_str()) != 0) {
         int err = errno;
         ::close(fd);
+        ::unlink(staging.c_str());
         return Error::posix(err, path);
     }
     auto impl = std::make_shared<Impl>();
