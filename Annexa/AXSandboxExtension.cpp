@@ -4,7 +4,7 @@
 
 namespace annexa {
 
-std::optional<std::string> issueReadExtensionForURL(const std::string& path) {
+Result<std::string> issueReadExtensionForURL(const std::string& path) {
     return corvane::sandbox::issueFileReadExtension(corvane::sandbox::kReadOnlyClass, path,
                                                     corvane::sandbox::kCanonicalPath);
 }

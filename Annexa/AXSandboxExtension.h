@@ -11,8 +11,8 @@
 
 namespace annexa {
 
-// A read-only token for the path (resolved to its canonical form), or nullopt with errno set.
-std::optional<std::string> issueReadExtensionForURL(const std::string& path);
+// A read-only token for the path (resolved to its canonical form), or the POSIX error that refused it.
+Result<std::string> issueReadExtensionForURL(const std::string& path);
 
 // Thread-safe fields; consume and expel are meant for one queue at a time.
 class AXSandboxExtension {

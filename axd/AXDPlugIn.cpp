@@ -142,7 +142,7 @@ Dictionary AXDPlugIn::issueResourceExtensions(const Value& resources) const {
             result.insert_or_assign(*name, Value(*token));
         } else {
             log::info(logOps(), "failed to make extension for %@ in plug-in at %@: %{public}s", resource, path(),
-                      std::strerror(errno));
+                      token.error().description());
         }
     }
     return result;

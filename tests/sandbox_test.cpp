@@ -48,12 +48,12 @@ TEST(Sandbox, IssuingNamesTheCanonicalPath) {
     stat((root.path() + "/home/.local/share/corvane/sandbox/token.key").c_str(), &st);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
 
-    errno = 0;
-    EXPECT_FALSE(sb::issueFileReadExtension(sb::kReadOnlyClass, root / "missing", sb::kCanonicalPath));
-    EXPECT_EQ(errno, ENOENT);
-    errno = 0;
-    EXPECT_FALSE(sb::issueFileReadExtension("com.corvane.sandbox.read-write", root / "dir/file", sb::kCanonicalPath));
-    EXPECT_EQ(errno, EINVAL);
+    auto missing = sb::issueFileReadExtension(sb::kReadOnlyClass, root / "missing", sb::kCanonicalPath);
+    ASSERT_FALSE(missing);
+    EXPECT_EQ(missing.error().code, ENOENT);
+    auto otherClass = sb::issueFileReadExtension("com.corvane.sandbox.read-write", root / "dir/file", sb::kCanonicalPath);
+    ASSERT_FALSE(otherClass);
+    EXPECT_EQ(otherClass.error().code, EINVAL);
 }
 
 TEST(Sandbox, ForgedAlteredOrTruncatedTokensAreRefused) {

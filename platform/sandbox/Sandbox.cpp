@@ -101,26 +101,19 @@ std::string nsLink(const std::string& proc, const char* ns) {
 
 }  // namespace
 
-std::optional<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path,
-                                                  unsigned flags) {
-    if (!extensionClass || std::strcmp(extensionClass, kReadOnlyClass) != 0) {
-        errno = EINVAL;
-        return std::nullopt;
-    }
+Result<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path, unsigned flags) {
+    if (!extensionClass || std::strcmp(extensionClass, kReadOnlyClass) != 0) return Error::posix(EINVAL);
     std::string target = path;
     if (flags & kCanonicalPath) {
         auto canonical = layout::canonicalPath(path);
-        if (!canonical) return std::nullopt;  // errno from realpath
+        if (!canonical) return Error::posix(errno);
         target = *canonical;
     } else {
         struct stat st {};
-        if (::stat(path.c_str(), &st) != 0) return std::nullopt;
+        if (::stat(path.c_str(), &st) != 0) return Error::posix(errno);
     }
     auto key = secretKey();
-    if (!key) {
-        errno = EACCES;
-        return std::nullopt;
-    }
+    if (!key) return Error::posix(EACCES);
     Bytes mac = macOf(*key, extensionClass, target);
     return std::string(extensionClass) + ";" + hex(target.data(), target.size()) + ";" +
            hex(mac.data(), mac.size());

@@ -29,10 +29,9 @@ inline constexpr const char* kReadOnlyClass = "com.corvane.sandbox.read-only";
 inline constexpr unsigned kCanonicalPath = 1;
 inline constexpr const char* kBrokerEndpoint = "com.corvane.sandbox";
 
-// Issues a token; nullopt with errno set when the class is unknown (EINVAL) or the path cannot be
-// resolved or does not exist (the system's error).
-std::optional<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path,
-                                                  unsigned flags);
+// Issues a token. Refused with a POSIX error when the class is unknown (EINVAL), the path cannot be
+// resolved or does not exist (the system's error), or this user has no token key (EACCES).
+Result<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path, unsigned flags);
 
 struct Token {
     std::string extensionClass;
