@@ -5,6 +5,7 @@
 #include <condition_variable>
 
 #include <filesystem>
+#include <functional>
 #include <fstream>
 
 #include "platform/codesign/CodeSign.h"
@@ -142,6 +143,48 @@ TEST(CodeSign, BundlesKeepTheirSignatureInside) {
     appendByte(app + "/app");
     EXPECT_EQ(codesign::entitlementsOfBundle(app), dict({}));
     EXPECT_NE(axtest::run({axtest::binary("axsign"), "verify", app}).status, 0);
+}
+
+// A bundle without executable (a data plug-in) is signed over its contents: any file added, changed
+// or removed afterwards breaks the signature. Unsigned, it is said once per identity of its files.
+TEST(CodeSign, DataBundlesAreSignedOverTheirContents) {
+    axtest::PlatformRoot root;
+    Keys keys(root.path());
+    auto dataInfo = [](const std::string& identifier) {
+        Value full = axtest::plugInInfo(identifier, dict({{"KSExtensionProtocol", "#Data"}}));
+        Dictionary info = *full.asDictionary();
+        info.erase("KFBundleExecutable");
+        return Value(info);
+    };
+    std::string data = axtest::makeBundle(root.path(), "Data.appex", dataInfo("com.example.data"), "");
+    axtest::writeFile(data + "/Resources/table.txt", "rows");
+    corvane::Status signedData = codesign::sign(data, keys.trusted, std::nullopt, kEntitlements);
+    ASSERT_TRUE(signedData.ok()) << signedData.error().description();
+    auto v = codesign::verifyBundle(data);
+    EXPECT_TRUE(v.valid) << v.reason;
+    EXPECT_EQ(v.identifier, "com.example.data");
+    EXPECT_EQ(codesign::entitlementsOfBundle(data), kEntitlements);
+    EXPECT_EQ(axtest::run({axtest::binary("axsign"), "verify", data}).status, 0);
+
+    const std::pair<const char*, std::function<void()>> changes[] = {
+        {"a resource changed", [&] { axtest::writeFile(data + "/Resources/table.txt", "other rows"); }},
+        {"a file added", [&] { axtest::writeFile(data + "/Resources/extra.txt", "x"); }},
+        {"a file removed", [&] { std::filesystem::remove(data + "/Resources/table.txt"); }},
+    };
+    for (const auto& [name, change] : changes) {
+        axtest::writeFile(data + "/Resources/table.txt", "rows");
+        std::filesystem::remove(data + "/Resources/extra.txt");
+        ASSERT_TRUE(codesign::verifyBundle(data).valid) << name;
+        change();
+        auto after = codesign::verifyBundle(data);
+        EXPECT_FALSE(after.valid) << name;
+        EXPECT_EQ(after.reason, "bundle changed since it was signed") << name;
+    }
+
+    std::string plain = axtest::makeBundle(root.path(), "Plain.appex", dataInfo("com.example.plain"), "");
+    log::CaptureSink capture;
+    for (int i = 0; i < 3; ++i) EXPECT_EQ(codesign::verifyBundle(plain).reason, "unsigned");
+    EXPECT_EQ(capture.count("no entitlements for "), 1u);
 }
 
 TEST(CodeSign, EntitlementsOfARunningProcessThroughItsConnection) {

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstring>
+#include <algorithm>
 #include <map>
 #include <mutex>
 #include <tuple>
@@ -66,13 +67,17 @@ std::optional<Bytes> unhex(std::string_view text) {
 
 Error signError(std::string text) { return Error{kDomain, 1, std::move(text)}; }
 
-// The bytes a signature covers.
-Bytes signedMessage(const std::string& identifier, const Bytes& executableHash, const Bytes& entitlements) {
+// The bytes a signature covers. The prefix names what the hash covers, so an executable's signature
+// can never pass for a contents signature or the other way round.
+Bytes signedMessage(const std::string& identifier, SignatureFile::Covers covers, const Bytes& hash,
+                    const Bytes& entitlements) {
     Bytes entHash(crypto_hash_sha256_BYTES);
     crypto_hash_sha256(entHash.data(), entitlements.data(), entitlements.size());
-    std::string prefix = "corvane code signature 1\n" + identifier + "\n";
+    std::string prefix = std::string(covers == SignatureFile::Covers::Executable ? "corvane code signature 1\n"
+                                                                                 : "corvane contents signature 1\n") +
+                         identifier + "\n";
     Bytes m(prefix.begin(), prefix.end());
-    m.insert(m.end(), executableHash.begin(), executableHash.end());
+    m.insert(m.end(), hash.begin(), hash.end());
     m.insert(m.end(), entHash.begin(), entHash.end());
     return m;
 }
@@ -91,6 +96,60 @@ std::optional<Bytes> hashFd(int fd) {
         if (n == 0) break;
         crypto_hash_sha256_update(&state, buf, static_cast<unsigned long long>(n));
         offset += n;
+    }
+    Bytes out(crypto_hash_sha256_BYTES);
+    crypto_hash_sha256_final(&state, out.data());
+    return out;
+}
+
+// The SHA-256 of a bundle's contents: every entry under it in byte order of its relative path, a
+// file as its path and the SHA-256 of its bytes, a link as its path and target, a directory as its
+// path; the signature file at the root is left out.
+std::optional<Bytes> contentsHash(const std::string& bundlePath) {
+    std::vector<std::string> entries;
+    std::vector<std::string> pending{""};
+    while (!pending.empty()) {
+        std::string rel = pending.back();
+        pending.pop_back();
+        DIR* d = opendir((bundlePath + "/" + rel).c_str());
+        if (!d) return std::nullopt;
+        while (struct dirent* e = readdir(d)) {
+            std::string name = e->d_name;
+            if (name == "." || name == "..") continue;
+            std::string child = rel.empty() ? name : rel + "/" + name;
+            if (child == bundle::kSignatureFileName) continue;
+            entries.push_back(child);
+            struct stat st {};
+            if (::lstat((bundlePath + "/" + child).c_str(), &st) == 0 && S_ISDIR(st.st_mode)) pending.push_back(child);
+        }
+        closedir(d);
+    }
+    std::sort(entries.begin(), entries.end());
+    crypto_hash_sha256_state state;
+    crypto_hash_sha256_init(&state);
+    auto feed = [&](char kind, const std::string& text) {
+        std::string record = std::string(1, kind) + text + '\0';
+        crypto_hash_sha256_update(&state, reinterpret_cast<const unsigned char*>(record.data()), record.size());
+    };
+    for (const auto& rel : entries) {
+        std::string full = bundlePath + "/" + rel;
+        struct stat st {};
+        if (::lstat(full.c_str(), &st) != 0) return std::nullopt;
+        if (S_ISDIR(st.st_mode)) {
+            feed('D', rel);
+        } else if (S_ISLNK(st.st_mode)) {
+            char target[4096];
+            ssize_t n = readlink(full.c_str(), target, sizeof target);
+            if (n < 0) return std::nullopt;
+            feed('L', rel + '\0' + std::string(target, static_cast<size_t>(n)));
+        } else if (S_ISREG(st.st_mode)) {
+            int fd = ::open(full.c_str(), O_RDONLY | O_CLOEXEC);
+            if (fd < 0) return std::nullopt;
+            auto fileHash = hashFd(fd);
+            ::close(fd);
+            if (!fileHash) return std::nullopt;
+            feed('F', rel + '\0' + hex(*fileHash));
+        }
     }
     Bytes out(crypto_hash_sha256_BYTES);
     crypto_hash_sha256_final(&state, out.data());
@@ -139,6 +198,21 @@ Verification invalid(const std::string& path, std::string reason, bool unsignedC
     return v;
 }
 
+// The verification of a file without a signature, logged once for each identity of the file.
+Verification unsignedFile(const struct stat& st, const std::string& path) {
+    auto key = std::make_pair(idOf(st), FileId{});
+    {
+        MutexLock lock(gCacheMutex);
+        auto it = cache().find(key);
+        if (it != cache().end()) return it->second;
+    }
+    Verification v = invalid(path, "unsigned", true);
+    MutexLock lock(gCacheMutex);
+    if (cache().size() >= kCacheLimit) cache().clear();
+    cache().emplace(key, v);
+    return v;
+}
+
 // Verifies the open executable `exeFd` (named `path`) against its signature file.
 Verification verifyOpened(int exeFd, const std::string& path) {
     if (!sodiumReady()) return invalid(path, "no crypto library");
@@ -146,7 +220,7 @@ Verification verifyOpened(int exeFd, const std::string& path) {
     if (fstat(exeFd, &exeStat) != 0 || !S_ISREG(exeStat.st_mode)) return invalid(path, "not a file");
     std::string sigPath = signaturePath(path);
     int sigFd = ::open(sigPath.c_str(), O_RDONLY | O_CLOEXEC);
-    if (sigFd < 0) return invalid(path, "unsigned", true);
+    if (sigFd < 0) return unsignedFile(exeStat, path);
     struct stat sigStat {};
     fstat(sigFd, &sigStat);
     auto key = std::make_pair(idOf(exeStat), idOf(sigStat));
@@ -168,11 +242,13 @@ Verification verifyOpened(int exeFd, const std::string& path) {
     auto file = parseSignature(bytes);
     if (!file) {
         v = invalid(path, "signature unreadable");
+    } else if (file->covers != SignatureFile::Covers::Executable) {
+        v = invalid(path, "the signature covers a bundle's contents, not an executable");
     } else if (!signatureVerifies(*file)) {
         v = invalid(path, "signature does not verify");
     } else if (!trusted(file->signer)) {
         v = invalid(path, "signed by an untrusted key " + hex(file->signer));
-    } else if (auto h = hashFd(exeFd); !h || *h != file->executableHash) {
+    } else if (auto h = hashFd(exeFd); !h || *h != file->hash) {
         v = invalid(path, "executable changed since it was signed");
     } else {
         auto ents = plist::parse(std::string_view(reinterpret_cast<const char*>(file->entitlementsBytes.data()),
@@ -189,6 +265,35 @@ Verification verifyOpened(int exeFd, const std::string& path) {
     MutexLock lock(gCacheMutex);
     if (cache().size() >= kCacheLimit) cache().clear();
     cache().emplace(key, v);
+    return v;
+}
+
+// A bundle without executable: its signature covers its contents. Not cached, since any file of the
+// bundle may change; such bundles are small.
+Verification verifyContents(const std::string& bundlePath) {
+    if (!sodiumReady()) return invalid(bundlePath, "no crypto library");
+    auto bytes = plist::readWholeFile(bundlePath + "/" + bundle::kSignatureFileName);
+    if (!bytes) {
+        struct stat st {};
+        std::string info = bundlePath + "/Info.plist";
+        if (::stat(info.c_str(), &st) != 0) return invalid(bundlePath, "unsigned", true);
+        return unsignedFile(st, bundlePath);
+    }
+    auto file = parseSignature(*bytes);
+    if (!file) return invalid(bundlePath, "signature unreadable");
+    if (file->covers != SignatureFile::Covers::Contents) return invalid(bundlePath, "bundle without executable");
+    if (!signatureVerifies(*file)) return invalid(bundlePath, "signature does not verify");
+    if (!trusted(file->signer)) return invalid(bundlePath, "signed by an untrusted key " + hex(file->signer));
+    auto h = contentsHash(bundlePath);
+    if (!h || *h != file->hash) return invalid(bundlePath, "bundle changed since it was signed");
+    auto ents = plist::parse(std::string_view(reinterpret_cast<const char*>(file->entitlementsBytes.data()),
+                                              file->entitlementsBytes.size()));
+    if (!ents || !ents->isDictionary()) return invalid(bundlePath, "entitlements unreadable");
+    Verification v;
+    v.valid = true;
+    v.identifier = file->identifier;
+    v.signer = hex(file->signer);
+    v.entitlements = *ents;
     return v;
 }
 
@@ -212,9 +317,9 @@ Verification verifyExecutable(const std::string& path) {
 
 Verification verifyBundle(const std::string& bundlePath) {
     auto b = bundle::Bundle::openPath(bundlePath);
-    auto exe = b ? b->property(bundle::kPropertyExecutablePath) : std::nullopt;
-    if (!exe) return invalid(bundlePath, "bundle without executable");
-    return verifyExecutable(*exe);
+    if (!b) return invalid(bundlePath, "not a bundle");
+    if (auto exe = b->property(bundle::kPropertyExecutablePath)) return verifyExecutable(*exe);
+    return verifyContents(*b->property(bundle::kPropertyBundlePath));
 }
 
 Value entitlementsOfExecutable(const std::string& path) { return verifyExecutable(path).entitlements; }
@@ -294,12 +399,17 @@ Status sign(const std::string& path, const KeyPair& keys, std::optional<std::str
                 const Value& entitlements) {
     if (!sodiumReady()) return signError("no crypto library");
     std::string exe = path;
+    auto covers = SignatureFile::Covers::Executable;
     struct stat st {};
     if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
         auto b = bundle::Bundle::openPath(path);
-        auto named = b ? b->property(bundle::kPropertyExecutablePath) : std::nullopt;
-        if (!named) return signError(path + ": bundle without executable");
-        exe = *named;
+        if (!b) return signError(path + ": not a bundle");
+        auto named = b->property(bundle::kPropertyExecutablePath);
+        if (named) {
+            exe = *named;
+        } else {
+            covers = SignatureFile::Covers::Contents;
+        }
         if (!identifier) {
             Value info = b->infoDictionary();
             if (const std::string* id = info["KFBundleIdentifier"].asString()) identifier = *id;
@@ -307,20 +417,27 @@ Status sign(const std::string& path, const KeyPair& keys, std::optional<std::str
     }
     if (!identifier) identifier = exe.substr(exe.rfind('/') + 1);
     if (!entitlements.isDictionary()) return signError("entitlements must be a dictionary");
-    int fd = ::open(exe.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return Error::posix(errno, exe);
-    auto hash = hashFd(fd);
-    ::close(fd);
-    if (!hash) return Error::posix(EIO, exe);
+    std::optional<Bytes> hash;
+    if (covers == SignatureFile::Covers::Contents) {
+        hash = contentsHash(path);
+        if (!hash) return Error::posix(EIO, path);
+    } else {
+        int fd = ::open(exe.c_str(), O_RDONLY | O_CLOEXEC);
+        if (fd < 0) return Error::posix(errno, exe);
+        hash = hashFd(fd);
+        ::close(fd);
+        if (!hash) return Error::posix(EIO, exe);
+    }
     auto xml = plist::toXML(entitlements);
     if (!xml) return xml.error();
     Bytes entBytes(xml->begin(), xml->end());
-    Bytes message = signedMessage(*identifier, *hash, entBytes);
+    Bytes message = signedMessage(*identifier, covers, *hash, entBytes);
     Bytes signature(crypto_sign_BYTES);
     crypto_sign_detached(signature.data(), nullptr, message.data(), message.size(), keys.secretKey.data());
     Value file = dict({{"format", kFormat},
                        {"identifier", *identifier},
-                       {"executable-sha256", Value::data(*hash)},
+                       {covers == SignatureFile::Covers::Executable ? "executable-sha256" : "contents-sha256",
+                        Value::data(*hash)},
                        {"entitlements", Value::data(entBytes)},
                        {"signer", Value::data(keys.publicKey)},
                        {"signature", Value::data(signature)}});
@@ -333,7 +450,11 @@ std::optional<SignatureFile> parseSignature(std::string_view bytes) {
     auto v = plist::parse(bytes);
     if (!v || !v->isDictionary() || !((*v)["format"] == Value(kFormat))) return std::nullopt;
     const std::string* identifier = (*v)["identifier"].asString();
-    const Bytes* hash = (*v)["executable-sha256"].asData();
+    const Bytes* executableHash = (*v)["executable-sha256"].asData();
+    const Bytes* contentsHashBytes = (*v)["contents-sha256"].asData();
+    // Exactly one of the two.
+    if ((executableHash != nullptr) == (contentsHashBytes != nullptr)) return std::nullopt;
+    const Bytes* hash = executableHash ? executableHash : contentsHashBytes;
     const Bytes* ents = (*v)["entitlements"].asData();
     const Bytes* signer = (*v)["signer"].asData();
     const Bytes* signature = (*v)["signature"].asData();
@@ -341,12 +462,14 @@ std::optional<SignatureFile> parseSignature(std::string_view bytes) {
     if (hash->size() != crypto_hash_sha256_BYTES || signer->size() != crypto_sign_PUBLICKEYBYTES ||
         signature->size() != crypto_sign_BYTES)
         return std::nullopt;
-    return SignatureFile{*identifier, *hash, *ents, *signer, *signature};
+    return SignatureFile{*identifier,
+                         executableHash ? SignatureFile::Covers::Executable : SignatureFile::Covers::Contents,
+                         *hash, *ents, *signer, *signature};
 }
 
 bool signatureVerifies(const SignatureFile& file) {
     if (!sodiumReady()) return false;
-    Bytes message = signedMessage(file.identifier, file.executableHash, file.entitlementsBytes);
+    Bytes message = signedMessage(file.identifier, file.covers, file.hash, file.entitlementsBytes);
     return crypto_sign_verify_detached(file.signature.data(), message.data(), message.size(),
                                        file.signer.data()) == 0;
 }

@@ -36,7 +36,7 @@ struct Verification {
 // The verification of an executable: its bundle's signature when a bundle names it as its
 // executable, else its detached signature.
 Verification verifyExecutable(const std::string& path);
-// The verification of a bundle's executable.
+// The verification of a bundle's executable, or of its contents when it has none.
 Verification verifyBundle(const std::string& bundlePath);
 // The verified entitlements (a dictionary, empty when there are none).
 Value entitlementsOfExecutable(const std::string& path);
@@ -73,8 +73,9 @@ std::string trustDirectory();
 // Installs a public key file in the trust directory.
 Status trustKey(const std::string& publicKeyPath);
 
-// Signs a bundle (its executable) or a bare executable. Without an identifier, the bundle's
-// KFBundleIdentifier or the executable's file name is used.
+// Signs a bundle (its executable, or its contents when it has no executable, as a data plug-in) or a
+// bare executable. Without an identifier, the bundle's KFBundleIdentifier or the executable's file
+// name is used.
 Status sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
                 const Value& entitlements);
 
@@ -85,7 +86,10 @@ std::string signaturePath(const std::string& path);
 
 struct SignatureFile {
     std::string identifier;
-    Bytes executableHash;  // SHA-256
+    // What the hash covers: the executable file, or (for a bundle without executable) the bundle's
+    // contents: every file, link and directory under it but the signature itself.
+    enum class Covers { Executable, Contents } covers = Covers::Executable;
+    Bytes hash;               // SHA-256
     Bytes entitlementsBytes;  // an XML property list
     Bytes signer;             // ed25519 public key
     Bytes signature;          // ed25519 signature

@@ -1,0 +1,57 @@
+// The command-line convention every tool of the project follows (docs/tools.md): subcommands,
+// `--help` on each, options spelled out and checked, and exit statuses from sysexits.h.
+//
+// A tool describes each subcommand with a Spec and hands it the words after the subcommand; parse()
+// answers the options and operands, or the exit status when the tool is to stop (0 after printing
+// the help, 64 after printing a usage error).
+#pragma once
+
+#include <cstddef>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace corvane::cli {
+
+// Exit statuses (sysexits.h).
+enum ExitStatus : int {
+    kSuccess = 0,
+    kFailure = 1,        // anything not listed below
+    kUsage = 64,         // a bad command line
+    kDataError = 65,     // input that cannot be read or used
+    kUnavailable = 69,   // a service that cannot be reached
+    kNoPermission = 77,  // refused for lack of an entitlement
+};
+
+struct Spec {
+    std::string usage;                  // "keygen --out KEY [--force]", after the tool's name
+    std::vector<std::string> flags;     // options without a value ("--json")
+    std::vector<std::string> valued;    // options that take one value ("--out"); may repeat
+    size_t minOperands = 0;
+    size_t maxOperands = static_cast<size_t>(-1);
+};
+
+struct Parsed {
+    std::map<std::string, std::vector<std::string>> options;  // flags hold one empty value per use
+    std::vector<std::string> operands;
+
+    bool has(const std::string& option) const { return options.count(option) > 0; }
+    // The last value given for the option.
+    std::optional<std::string> value(const std::string& option) const;
+};
+
+// Parses `args` (the words after the subcommand). "--" ends the options; "-" alone is an operand.
+// Unknown options, missing values and a wrong number of operands are usage errors.
+struct Outcome {
+    std::optional<Parsed> parsed;
+    int exitStatus = kSuccess;  // when `parsed` is empty
+};
+Outcome parse(const std::string& tool, const Spec& spec, const std::vector<std::string>& args);
+
+// Prints "<tool>: <message>" and the usage line(s) on standard error; returns kUsage.
+int usageError(const std::string& tool, const std::string& message, const std::string& usage);
+// Prints "<tool>: <message>" on standard error; returns `status`.
+int fail(const std::string& tool, const std::string& message, int status = kFailure);
+
+}  // namespace corvane::cli
