@@ -20,6 +20,7 @@ namespace {
 }  // namespace
 
 int main(int argc, char** argv) {
+    log::setStandardErrorFallback(true);
     // Before any thread starts: SIGTERM becomes "termination imminent" for every client.
     corvane::rpx::handleTermination();
     log::info(annexa::logOps(), "axd is launching");

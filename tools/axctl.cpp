@@ -1,27 +1,33 @@
 // axctl: talks to axd. `send` is the raw form (any message in the text notation); the other
-// commands are friendly forms of the requests. See docs/axctl.md.
+// commands are friendly forms of the requests. See docs/axctl.md and docs/tools.md.
 #include <unistd.h>
 
 #include <cstdio>
-#include <cstring>
 #include <iostream>
 #include <iterator>
-#include <optional>
-#include <sstream>
 #include <string>
 #include <vector>
 
 #include "Annexa/AXDaemonClient.h"
+#include "platform/log/Log.h"
 #include "platform/plist/Plist.h"
+#include "platform/vantry/Vantry.h"
+#include "tools/cli/Cli.h"
 
 using annexa::AXDaemonClient;
 using corvane::Value;
+namespace cli = corvane::cli;
 
 namespace {
 
-constexpr int kUsage = 64;
-constexpr int kDataError = 65;
-constexpr int kUnavailable = 69;
+constexpr const char* kTool = "axctl";
+
+const cli::Spec kSend{"[-S servicename] send [FILE]", {}, {}, 0, 1};
+const cli::Spec kAdd{"[-S servicename] add PATH...", {}, {}, 1};
+const cli::Spec kRemove{"[-S servicename] remove PATH...", {}, {}, 1};
+const cli::Spec kAnnotate{"[-S servicename] annotate [--election N] [--extension FILE.plist] UUID...", {},
+                          {"--election", "--extension"}, 1};
+const cli::Spec kBulkAnnotate{"[-S servicename] bulk-annotate FILE.plist", {}, {}, 1, 1};
 
 const char* kHelp =
     "usage: axctl [-S servicename] COMMAND [ARGS]\n"
@@ -33,14 +39,10 @@ const char* kHelp =
     "                                               set the user's choices about plug-ins\n"
     "  bulk-annotate FILE.plist                     set each plug-in's extension dictionary:\n"
     "                                               FILE.plist maps UUID texts to dictionaries\n"
-    "The service name defaults to com.corvane.annexa.axd. Exit status: 0 success, 1 the daemon\n"
-    "refused (its error text on standard error), 64 usage, 65 unreadable input, 69 daemon not\n"
-    "reachable. See docs/axctl.md.\n";
-
-int usageError(const std::string& text) {
-    std::fprintf(stderr, "axctl: %s\n%s", text.c_str(), kHelp);
-    return kUsage;
-}
+    "The service name defaults to com.corvane.annexa.axd. COMMAND --help shows one command's usage.\n"
+    "Exit status: 0 success, 1 the daemon refused (its error text on standard error), 64 usage,\n"
+    "65 unreadable input, 69 daemon not reachable, 77 refused for lack of an entitlement.\n"
+    "See docs/axctl.md.\n";
 
 std::string absolute(const std::string& path) {
     if (!path.empty() && path[0] == '/') return path;
@@ -49,120 +51,133 @@ std::string absolute(const std::string& path) {
     return std::string(cwd) + "/" + path;
 }
 
+int unreachable(const corvane::rpx::Reply& reply, const std::string& service) {
+    return cli::fail(kTool, "cannot reach the daemon at " + service + ": " + reply.description(), cli::kUnavailable);
+}
+
 // Prints the daemon's answer and turns it into an exit status.
 int finish(const corvane::rpx::Reply& reply, const std::string& service) {
-    if (!reply.ok()) {
-        std::fprintf(stderr, "axctl: cannot reach the daemon at %s: %s\n", service.c_str(), reply.description().c_str());
-        return kUnavailable;
-    }
+    if (!reply.ok()) return unreachable(reply, service);
     corvane::Status status = AXDaemonClient::errorInReply(reply);
-    if (!status.ok()) {
-        std::fprintf(stderr, "axctl: %s (error %lld)\n", status.error().description().c_str(),
-                     static_cast<long long>(status.error().code));
-        return 1;
+    if (status.ok()) return cli::kSuccess;
+    const corvane::Error& error = status.error();
+    int exit = error.code == annexa::errorCodeValue(annexa::AXErrorCode::NotEntitled) ? cli::kNoPermission
+                                                                                     : cli::kFailure;
+    return cli::fail(kTool, error.description() + " (error " + std::to_string(error.code) + ")", exit);
+}
+
+int send(const std::string& service, const cli::Parsed& p) {
+    std::string text;
+    if (p.operands.empty() || p.operands[0] == "-") {
+        text.assign(std::istreambuf_iterator<char>(std::cin), std::istreambuf_iterator<char>());
+    } else {
+        auto bytes = corvane::plist::readWholeFile(p.operands[0]);
+        if (!bytes) return cli::fail(kTool, bytes.error().description(), cli::kDataError);
+        text = *bytes;
     }
-    return 0;
+    auto message = Value::parseReporting(text);
+    if (!message) {
+        return cli::fail(kTool, "the input is not one value in the text notation (docs/rpx-wire.md): " +
+                                    message.error().description(),
+                         cli::kDataError);
+    }
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.send(*message, done); });
+    if (!reply.ok()) return unreachable(reply, service);
+    std::printf("%s\n", reply.value.description().c_str());
+    return cli::kSuccess;
+}
+
+int addOrRemove(const std::string& service, bool add, const cli::Parsed& p) {
+    std::vector<std::string> paths;
+    for (const auto& a : p.operands) paths.push_back(absolute(a));
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) {
+        if (add) {
+            client.addPlugIns(paths, done);
+        } else {
+            client.removePlugIns(paths, done);
+        }
+    });
+    int status = finish(reply, service);
+    if (add && status == cli::kFailure) {
+        // The reply's text is fixed; the registry's reading of the bundles here says why.
+        for (const auto& path : paths) {
+            if (corvane::Status readable = corvane::vantry::Registry::checkBundle(path); !readable.ok())
+                std::fprintf(stderr, "axctl: %s\n", readable.error().description().c_str());
+        }
+    }
+    return status;
+}
+
+int annotate(const std::string& service, const cli::Parsed& p) {
+    annexa::Dictionary annotations;
+    if (auto election = p.value("--election")) {
+        char* end = nullptr;
+        long long n = std::strtoll(election->c_str(), &end, 10);
+        if (election->empty() || !end || *end) return cli::usageError(kTool, "--election needs an integer", kAnnotate.usage);
+        annotations["election"] = Value(static_cast<int64_t>(n));
+    }
+    if (auto file = p.value("--extension")) {
+        auto ext = corvane::plist::readFile(*file);
+        if (!ext || !ext->isDictionary()) return cli::fail(kTool, *file + " is not a property-list dictionary", cli::kDataError);
+        annotations["extension"] = *ext;
+    }
+    std::vector<corvane::UUID> uuids;
+    for (const auto& text : p.operands) {
+        auto uuid = corvane::UUID::parse(text);
+        if (!uuid) return cli::usageError(kTool, "not a UUID: " + text, kAnnotate.usage);
+        uuids.push_back(*uuid);
+    }
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.setPlugInAnnotations(uuids, Value(annotations), done); });
+    return finish(reply, service);
+}
+
+int bulkAnnotate(const std::string& service, const cli::Parsed& p) {
+    auto table = corvane::plist::readFile(p.operands[0]);
+    if (!table || !table->isDictionary())
+        return cli::fail(kTool, p.operands[0] + " is not a property-list dictionary", cli::kDataError);
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.bulkSetPlugInAnnotations(*table, done); });
+    return finish(reply, service);
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
+    corvane::log::setStandardErrorFallback(true);
     std::vector<std::string> args(argv + 1, argv + argc);
     std::string service = annexa::kDefaultServiceName;
-    if (args.size() >= 2 && args[0] == "-S") {
+    if (!args.empty() && args[0] == "-S") {
+        if (args.size() < 2) return cli::usageError(kTool, "option -S needs a value", "[-S servicename] COMMAND [ARGS]");
         service = args[1];
         args.erase(args.begin(), args.begin() + 2);
     }
-    if (args.empty()) return usageError("no command");
-    for (const auto& a : args) {
-        if (a == "--help" || a == "-h") {
-            std::fputs(kHelp, stdout);
-            return 0;
-        }
+    if (args.empty()) return cli::usageError(kTool, "no command", "[-S servicename] COMMAND [ARGS]");
+    if (args[0] == "--help" || args[0] == "-h") {
+        std::fputs(kHelp, stdout);
+        return cli::kSuccess;
     }
     std::string command = args[0];
     args.erase(args.begin());
-
-    if (command == "send") {
-        if (args.size() > 1) return usageError("send takes at most one FILE");
-        std::string text;
-        if (args.empty() || args[0] == "-") {
-            text.assign(std::istreambuf_iterator<char>(std::cin), std::istreambuf_iterator<char>());
-        } else {
-            auto bytes = corvane::plist::readWholeFile(args[0]);
-            if (!bytes) {
-                std::fprintf(stderr, "axctl: %s\n", bytes.error().description().c_str());
-                return kDataError;
-            }
-            text = *bytes;
-        }
-        auto message = Value::parse(text);
-        if (!message) {
-            std::fprintf(stderr, "axctl: the input is not one value in the text notation (docs/rpx-wire.md)\n");
-            return kDataError;
-        }
-        AXDaemonClient client(service);
-        auto reply = client.wait([&](auto done) { client.send(*message, done); });
-        if (!reply.ok()) {
-            std::fprintf(stderr, "axctl: cannot reach the daemon at %s: %s\n", service.c_str(),
-                         reply.description().c_str());
-            return kUnavailable;
-        }
-        std::printf("%s\n", reply.value.description().c_str());
-        return 0;
+    struct Entry {
+        const char* name;
+        const cli::Spec* spec;
+        int (*run)(const std::string&, const cli::Parsed&);
+    };
+    const Entry commands[] = {
+        {"send", &kSend, send},
+        {"add", &kAdd, [](const std::string& s, const cli::Parsed& p) { return addOrRemove(s, true, p); }},
+        {"remove", &kRemove, [](const std::string& s, const cli::Parsed& p) { return addOrRemove(s, false, p); }},
+        {"annotate", &kAnnotate, annotate},
+        {"bulk-annotate", &kBulkAnnotate, bulkAnnotate},
+    };
+    for (const auto& c : commands) {
+        if (command != c.name) continue;
+        cli::Outcome parsed = cli::parse(kTool, *c.spec, args);
+        return parsed.parsed ? c.run(service, *parsed.parsed) : parsed.exitStatus;
     }
-    if (command == "add" || command == "remove") {
-        if (args.empty()) return usageError(command + " needs at least one PATH");
-        std::vector<std::string> paths;
-        for (const auto& a : args) paths.push_back(absolute(a));
-        AXDaemonClient client(service);
-        auto reply = client.wait([&](auto done) {
-            if (command == "add") {
-                client.addPlugIns(paths, done);
-            } else {
-                client.removePlugIns(paths, done);
-            }
-        });
-        return finish(reply, service);
-    }
-    if (command == "annotate") {
-        annexa::Dictionary annotations;
-        std::vector<corvane::UUID> uuids;
-        for (size_t i = 0; i < args.size(); ++i) {
-            if (args[i] == "--election" && i + 1 < args.size()) {
-                char* end = nullptr;
-                long long n = std::strtoll(args[++i].c_str(), &end, 10);
-                if (!end || *end) return usageError("--election needs an integer");
-                annotations["election"] = Value(static_cast<int64_t>(n));
-            } else if (args[i] == "--extension" && i + 1 < args.size()) {
-                auto ext = corvane::plist::readFile(args[++i]);
-                if (!ext || !ext->isDictionary()) {
-                    std::fprintf(stderr, "axctl: %s is not a property-list dictionary\n", args[i].c_str());
-                    return kDataError;
-                }
-                annotations["extension"] = *ext;
-            } else if (auto uuid = corvane::UUID::parse(args[i])) {
-                uuids.push_back(*uuid);
-            } else {
-                return usageError("not a UUID: " + args[i]);
-            }
-        }
-        if (uuids.empty()) return usageError("annotate needs at least one UUID");
-        AXDaemonClient client(service);
-        auto reply =
-            client.wait([&](auto done) { client.setPlugInAnnotations(uuids, Value(annotations), done); });
-        return finish(reply, service);
-    }
-    if (command == "bulk-annotate") {
-        if (args.size() != 1) return usageError("bulk-annotate needs one FILE.plist");
-        auto table = corvane::plist::readFile(args[0]);
-        if (!table || !table->isDictionary()) {
-            std::fprintf(stderr, "axctl: %s is not a property-list dictionary\n", args[0].c_str());
-            return kDataError;
-        }
-        AXDaemonClient client(service);
-        auto reply = client.wait([&](auto done) { client.bulkSetPlugInAnnotations(*table, done); });
-        return finish(reply, service);
-    }
-    return usageError("unknown command " + command);
+    std::fprintf(stderr, "axctl: unknown command %s\n%s", command.c_str(), kHelp);
+    return cli::kUsage;
 }

@@ -1,38 +1,39 @@
 // axsign: makes signing keys, trusts them, signs bundles and executables with entitlements, and
-// shows or verifies signatures. See docs/code-signing.md.
+// shows or verifies signatures. See docs/code-signing.md and docs/tools.md.
 #include <sys/stat.h>
 
 #include <cstdio>
-#include <cstring>
 #include <string>
 #include <vector>
 
 #include "platform/codesign/CodeSign.h"
+#include "platform/log/Log.h"
 #include "platform/plist/Plist.h"
+#include "tools/cli/Cli.h"
 
 using namespace corvane;
+namespace cli = corvane::cli;
 
 namespace {
 
+constexpr const char* kTool = "axsign";
+
+const cli::Spec kKeygen{"keygen --out KEY [--force]", {"--force"}, {"--out"}, 0, 0};
+const cli::Spec kTrust{"trust KEY.pub", {}, {}, 1, 1};
+const cli::Spec kSign{"sign --key KEY [--identifier ID] [--entitlements FILE.plist] PATH", {},
+                      {"--key", "--identifier", "--entitlements"}, 1, 1};
+const cli::Spec kShow{"show PATH", {}, {}, 1, 1};
+const cli::Spec kVerify{"verify PATH", {}, {}, 1, 1};
+
 const char* kUsage =
-    "usage: axsign keygen --out KEY\n"
+    "usage: axsign keygen --out KEY [--force]\n"
     "       axsign trust KEY.pub\n"
     "       axsign sign --key KEY [--identifier ID] [--entitlements FILE.plist] PATH\n"
     "       axsign show PATH\n"
     "       axsign verify PATH\n"
     "PATH is a bundle directory or an executable. Keys: KEY holds the secret key (mode 0600),\n"
-    "KEY.pub the public key; `trust` installs a public key in the platform's trust directory.\n";
-
-int fail(const std::string& text) {
-    std::fprintf(stderr, "axsign: %s\n", text.c_str());
-    return 1;
-}
-
-bool wantsHelp(const std::vector<std::string>& args) {
-    for (const auto& a : args)
-        if (a == "--help" || a == "-h") return true;
-    return false;
-}
+    "KEY.pub the public key; `trust` installs a public key in the platform's trust directory.\n"
+    "COMMAND --help shows one command's usage. See docs/code-signing.md.\n";
 
 codesign::Verification verify(const std::string& path) {
     struct stat st {};
@@ -40,77 +41,98 @@ codesign::Verification verify(const std::string& path) {
     return codesign::verifyExecutable(path);
 }
 
+bool exists(const std::string& path) {
+    struct stat st {};
+    return ::lstat(path.c_str(), &st) == 0;
+}
+
+int keygen(const cli::Parsed& p) {
+    auto out = p.value("--out");
+    if (!out) return cli::usageError(kTool, "keygen needs --out KEY", kKeygen.usage);
+    // A new key in place of an old one leaves everything signed with the old one untrusted.
+    if (!p.has("--force") && (exists(*out) || exists(*out + ".pub")))
+        return cli::fail(kTool, *out + " exists; --force replaces it (what it signed will no longer verify)");
+    if (Status written = codesign::writeKeyPair(*out, codesign::generateKey()); !written.ok())
+        return cli::fail(kTool, written.error().description());
+    std::printf("wrote %s and %s.pub\n", out->c_str(), out->c_str());
+    return cli::kSuccess;
+}
+
+int trust(const cli::Parsed& p) {
+    const std::string& key = p.operands[0];
+    if (auto read = codesign::readPublicKey(key); !read) return cli::fail(kTool, read.error().description(), cli::kDataError);
+    if (Status trusted = codesign::trustKey(key); !trusted.ok()) return cli::fail(kTool, trusted.error().description());
+    std::printf("trusted %s in %s\n", key.c_str(), codesign::trustDirectory().c_str());
+    return cli::kSuccess;
+}
+
+int sign(const cli::Parsed& p) {
+    auto key = p.value("--key");
+    if (!key) return cli::usageError(kTool, "sign needs --key KEY", kSign.usage);
+    Value entitlements = Value(Dictionary{});
+    if (auto file = p.value("--entitlements")) {
+        auto e = plist::readFile(*file);
+        if (!e || !e->isDictionary())
+            return cli::fail(kTool, *file + ": " + (e ? "not a dictionary" : e.error().description()), cli::kDataError);
+        entitlements = *e;
+    }
+    auto keys = codesign::readSecretKey(*key);
+    if (!keys) return cli::fail(kTool, keys.error().description(), cli::kDataError);
+    const std::string& path = p.operands[0];
+    if (Status made = codesign::sign(path, *keys, p.value("--identifier"), entitlements); !made.ok())
+        return cli::fail(kTool, made.error().description());
+    std::printf("signed %s\n", path.c_str());
+    return cli::kSuccess;
+}
+
+int show(const cli::Parsed& p) {
+    const std::string& path = p.operands[0];
+    codesign::Verification v = verify(path);
+    auto bytes = plist::readWholeFile(codesign::signaturePath(path));
+    auto file = bytes ? codesign::parseSignature(*bytes) : std::nullopt;
+    std::printf("path: %s\nsignature: %s\n", path.c_str(), codesign::signaturePath(path).c_str());
+    if (file) std::printf("identifier: %s\n", file->identifier.c_str());
+    std::printf("signer: %s\nverifies: %s\n", v.valid ? v.signer.c_str() : "-",
+                v.valid ? "yes" : ("no (" + v.reason + ")").c_str());
+    std::printf("entitlements: %s\n", v.entitlements.description().c_str());
+    return v.valid ? cli::kSuccess : cli::kFailure;
+}
+
+int verifyCommand(const cli::Parsed& p) {
+    const std::string& path = p.operands[0];
+    codesign::Verification v = verify(path);
+    if (!v.valid) return cli::fail(kTool, path + ": " + v.reason);
+    std::printf("%s: valid\n", path.c_str());
+    return cli::kSuccess;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
+    log::setStandardErrorFallback(true);
     std::vector<std::string> args(argv + 1, argv + argc);
-    if (args.empty() || args[0] == "--help" || args[0] == "-h") {
-        std::fputs(kUsage, args.empty() ? stderr : stdout);
-        return args.empty() ? 64 : 0;
+    if (args.empty()) {
+        std::fputs(kUsage, stderr);
+        return cli::kUsage;
+    }
+    if (args[0] == "--help" || args[0] == "-h") {
+        std::fputs(kUsage, stdout);
+        return cli::kSuccess;
     }
     std::string command = args[0];
     args.erase(args.begin());
-    if (wantsHelp(args)) {
-        std::fputs(kUsage, stdout);
-        return 0;
+    struct Entry {
+        const char* name;
+        const cli::Spec* spec;
+        int (*run)(const cli::Parsed&);
+    };
+    const Entry commands[] = {{"keygen", &kKeygen, keygen}, {"trust", &kTrust, trust}, {"sign", &kSign, sign},
+                              {"show", &kShow, show},       {"verify", &kVerify, verifyCommand}};
+    for (const auto& c : commands) {
+        if (command != c.name) continue;
+        cli::Outcome parsed = cli::parse(kTool, *c.spec, args);
+        return parsed.parsed ? c.run(*parsed.parsed) : parsed.exitStatus;
     }
-    if (command == "keygen") {
-        if (args.size() != 2 || args[0] != "--out") return fail("keygen needs --out KEY");
-        if (Status err = codesign::writeKeyPair(args[1], codesign::generateKey()); !err.ok()) return fail(err.error().description());
-        std::printf("wrote %s and %s.pub\n", args[1].c_str(), args[1].c_str());
-        return 0;
-    }
-    if (command == "trust") {
-        if (args.size() != 1) return fail("trust needs one public key file");
-        if (Status err = codesign::trustKey(args[0]); !err.ok()) return fail(err.error().description());
-        std::printf("trusted %s in %s\n", args[0].c_str(), codesign::trustDirectory().c_str());
-        return 0;
-    }
-    if (command == "sign") {
-        std::string key;
-        std::optional<std::string> identifier;
-        Value entitlements = Value(Dictionary{});
-        std::string path;
-        for (size_t i = 0; i < args.size(); ++i) {
-            if (args[i] == "--key" && i + 1 < args.size()) {
-                key = args[++i];
-            } else if (args[i] == "--identifier" && i + 1 < args.size()) {
-                identifier = args[++i];
-            } else if (args[i] == "--entitlements" && i + 1 < args.size()) {
-                auto e = plist::readFile(args[++i]);
-                if (!e) return fail(args[i] + ": " + e.error().description());
-                entitlements = *e;
-            } else if (path.empty() && args[i][0] != '-') {
-                path = args[i];
-            } else {
-                return fail("unexpected argument " + args[i]);
-            }
-        }
-        if (key.empty() || path.empty()) return fail("sign needs --key KEY and a PATH");
-        auto keys = codesign::readSecretKey(key);
-        if (!keys) return fail(keys.error().description());
-        if (Status err = codesign::sign(path, *keys, identifier, entitlements); !err.ok()) return fail(err.error().description());
-        std::printf("signed %s\n", path.c_str());
-        return 0;
-    }
-    if (command == "show" || command == "verify") {
-        if (args.size() != 1) return fail(command + " needs one PATH");
-        codesign::Verification v = verify(args[0]);
-        if (command == "verify") {
-            if (!v.valid) return fail(args[0] + ": " + v.reason);
-            std::printf("%s: valid\n", args[0].c_str());
-            return 0;
-        }
-        auto bytes = plist::readWholeFile(codesign::signaturePath(args[0]));
-        auto file = bytes ? codesign::parseSignature(*bytes) : std::nullopt;
-        std::printf("path: %s\nsignature: %s\n", args[0].c_str(), codesign::signaturePath(args[0]).c_str());
-        if (file) {
-            std::printf("identifier: %s\n", file->identifier.c_str());
-        }
-        std::printf("signer: %s\nverifies: %s\n", v.valid ? v.signer.c_str() : "-",
-                    v.valid ? "yes" : ("no (" + v.reason + ")").c_str());
-        std::printf("entitlements: %s\n", v.entitlements.description().c_str());
-        return v.valid ? 0 : 1;
-    }
-    return fail("unknown command " + command + "\n" + kUsage);
+    std::fprintf(stderr, "axsign: unknown command %s\n%s", command.c_str(), kUsage);
+    return cli::kUsage;
 }

@@ -1,43 +1,41 @@
 // vantry: registers and unregisters bundles with the application registry, lists and shows its
-// records, watches its events and rebuilds a damaged database. See docs/registry.md.
+// records, watches its events and rebuilds a damaged database. See docs/registry.md and
+// docs/tools.md.
 #include <unistd.h>
 
-#include <cinttypes>
-#include <cmath>
 #include <cstdio>
-#include <cstring>
+#include <memory>
 #include <string>
 #include <vector>
 
+#include "platform/log/Log.h"
 #include "platform/vantry/Vantry.h"
+#include "tools/cli/Cli.h"
 
 using namespace corvane;
 using vantry::PlugInRecordPtr;
+namespace cli = corvane::cli;
 
 namespace {
+
+constexpr const char* kTool = "vantry";
+
+const cli::Spec kRegister{"register [--placeholder] PATH...", {"--placeholder"}, {}, 1};
+const cli::Spec kUnregister{"unregister PATH...", {}, {}, 1};
+const cli::Spec kList{"list [--json]", {"--json"}, {}, 0, 0};
+const cli::Spec kShow{"show [--json] UUID|PATH", {"--json"}, {}, 1, 1};
+const cli::Spec kWatch{"watch", {}, {}, 0, 0};
+const cli::Spec kRebuild{"rebuild", {}, {}, 0, 0};
 
 const char* kUsage =
     "usage: vantry register [--placeholder] PATH...   register application or plug-in bundles\n"
     "       vantry unregister PATH...                 unregister them\n"
     "       vantry list [--json]                      applications and plug-ins with their UUIDs\n"
-    "       vantry show UUID|PATH [--json]            one plug-in's record\n"
+    "       vantry show [--json] UUID|PATH            one plug-in's record\n"
     "       vantry watch                              print install and uninstall events as they happen\n"
     "       vantry rebuild                            move a damaged database aside and register again\n"
-    "The registry lives under the platform root (CORVANE_ROOT).\n";
-
-Value recordValue(const PlugInRecordPtr& r) {
-    Value v = r->serialize();
-    return v;
-}
-
-std::unique_ptr<vantry::Registry> openRegistry() {
-    auto r = vantry::Registry::open(vantry::Registry::defaultPath());
-    if (!r) {
-        std::fprintf(stderr, "vantry: %s\n", r.error().description().c_str());
-        std::exit(1);
-    }
-    return std::move(*r);
-}
+    "The registry lives under the platform root (CORVANE_ROOT). COMMAND --help shows one command's\n"
+    "usage. See docs/registry.md.\n";
 
 struct Printer : vantry::Observer {
     // One line per event, then one line per record.
@@ -54,107 +52,133 @@ struct Printer : vantry::Observer {
     }
 };
 
+std::unique_ptr<vantry::Registry> openRegistry() {
+    auto r = vantry::Registry::open(vantry::Registry::defaultPath());
+    if (!r) {
+        std::fprintf(stderr, "vantry: %s\n", r.error().description().c_str());
+        return nullptr;
+    }
+    return std::move(*r);
+}
+
+int registration(bool registering, const cli::Parsed& p) {
+    auto registry = openRegistry();
+    if (!registry) return cli::kFailure;
+    int status = cli::kSuccess;
+    for (const auto& path : p.operands) {
+        Status done = registering ? registry->registerBundle(path, p.has("--placeholder"))
+                                  : registry->unregisterBundle(path);
+        if (!done.ok()) {
+            // A bundle that cannot be read, or a path that is not registered, is bad input.
+            status = cli::fail(kTool, done.error().description(), cli::kDataError);
+        } else {
+            std::printf("%s %s\n", registering ? "registered" : "unregistered", path.c_str());
+        }
+    }
+    return status;
+}
+
+void printPlugIn(const PlugInRecordPtr& r) {
+    std::printf("  %s  %s  %s\n", r->uuid().string().c_str(), r->identifier().c_str(), r->bundlePath().c_str());
+}
+
+// Applications (each with its plug-ins, none for some) and then stand-alone plug-ins.
+int list(const cli::Parsed& p) {
+    auto registry = openRegistry();
+    if (!registry) return cli::kFailure;
+    auto applications = registry->installedApplications();
+    std::vector<PlugInRecordPtr> standalone;
+    for (const auto& r : registry->installedPlugIns())
+        if (!r->containingApplication()) standalone.push_back(r);
+    if (p.has("--json")) {
+        Array apps;
+        for (const auto& app : applications) {
+            Value serialized = app->serialize();
+            Dictionary entry = *serialized.asDictionary();
+            Array plugIns;
+            for (const auto& r : app->plugIns()) plugIns.push_back(r->serialize());
+            entry["plugins"] = Value(std::move(plugIns));
+            apps.push_back(Value(std::move(entry)));
+        }
+        Array alone;
+        for (const auto& r : standalone) alone.push_back(r->serialize());
+        Value document = dict({{"applications", Value(std::move(apps))}, {"plugins", Value(std::move(alone))}});
+        std::printf("%s\n", document.json().c_str());
+        return cli::kSuccess;
+    }
+    for (const auto& app : applications) {
+        auto plugIns = app->plugIns();
+        std::printf("%s%s\n", app->bundlePath().c_str(), plugIns.empty() ? "  (no plug-ins)" : "");
+        for (const auto& r : plugIns) printPlugIn(r);
+    }
+    if (!standalone.empty()) std::printf("(stand-alone plug-ins)\n");
+    for (const auto& r : standalone) printPlugIn(r);
+    return cli::kSuccess;
+}
+
+int show(const cli::Parsed& p) {
+    auto registry = openRegistry();
+    if (!registry) return cli::kFailure;
+    const std::string& which = p.operands[0];
+    auto uuid = UUID::parse(which);
+    PlugInRecordPtr r = uuid ? registry->plugInForUUID(*uuid) : registry->plugInForPath(which);
+    if (!r) return cli::fail(kTool, "no plug-in " + which, cli::kDataError);
+    Value record = r->serialize();
+    std::printf("%s\n", (p.has("--json") ? record.json() : record.description()).c_str());
+    return cli::kSuccess;
+}
+
+int watch(const cli::Parsed&) {
+    auto registry = openRegistry();
+    if (!registry) return cli::kFailure;
+    Printer printer;
+    auto subscription = registry->subscribe(printer);
+    std::printf("watching %s\n", registry->path().c_str());
+    std::fflush(stdout);
+    for (;;) pause();
+}
+
+int rebuild(const cli::Parsed&) {
+    auto failed = vantry::Registry::rebuild(vantry::Registry::defaultPath());
+    if (!failed) return cli::fail(kTool, failed.error().description());
+    for (const auto& path : *failed) std::fprintf(stderr, "vantry: could not register %s again\n", path.c_str());
+    std::printf("rebuilt %s\n", vantry::Registry::defaultPath().c_str());
+    return failed->empty() ? cli::kSuccess : cli::kFailure;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
+    log::setStandardErrorFallback(true);
     std::vector<std::string> args(argv + 1, argv + argc);
     if (args.empty()) {
         std::fputs(kUsage, stderr);
-        return 64;
+        return cli::kUsage;
     }
-    for (const auto& a : args) {
-        if (a == "--help" || a == "-h") {
-            std::fputs(kUsage, stdout);
-            return 0;
-        }
+    if (args[0] == "--help" || args[0] == "-h") {
+        std::fputs(kUsage, stdout);
+        return cli::kSuccess;
     }
     std::string command = args[0];
     args.erase(args.begin());
-    bool asJson = false;
-    bool placeholder = false;
-    std::vector<std::string> operands;
-    for (const auto& a : args) {
-        if (a == "--json") {
-            asJson = true;
-        } else if (a == "--placeholder") {
-            placeholder = true;
-        } else {
-            operands.push_back(a);
-        }
-    }
-
-    if (command == "rebuild") {
-        auto failed = vantry::Registry::rebuild(vantry::Registry::defaultPath());
-        if (!failed) {
-            std::fprintf(stderr, "vantry: %s\n", failed.error().description().c_str());
-            return 1;
-        }
-        for (const auto& p : *failed) std::fprintf(stderr, "vantry: could not register %s again\n", p.c_str());
-        std::printf("rebuilt %s\n", vantry::Registry::defaultPath().c_str());
-        return failed->empty() ? 0 : 1;
-    }
-
-    auto registry = openRegistry();
-    if (command == "register" || command == "unregister") {
-        if (operands.empty()) {
-            std::fprintf(stderr, "vantry: %s needs at least one PATH\n", command.c_str());
-            return 64;
-        }
-        int status = 0;
-        for (const auto& path : operands) {
-            Status done = command == "register" ? registry->registerBundle(path, placeholder)
-                                                : registry->unregisterBundle(path);
-            if (!done.ok()) {
-                std::fprintf(stderr, "vantry: %s\n", done.error().description().c_str());
-                status = 1;
-            } else {
-                std::printf("%sed %s\n", command.c_str(), path.c_str());
-            }
-        }
-        return status;
-    }
-    if (command == "list") {
-        auto plugins = registry->installedPlugIns();
-        if (asJson) {
-            Array list;
-            for (const auto& r : plugins) list.push_back(recordValue(r));
-            std::printf("%s\n", Value(std::move(list)).json().c_str());
-            return 0;
-        }
-        std::string lastApp = "-";
-        for (const auto& r : plugins) {
-            std::string app = r->containingApplication() ? r->containingApplication()->bundlePath() : "";
-            if (app != lastApp) {
-                std::printf("%s\n", app.empty() ? "(stand-alone plug-ins)" : app.c_str());
-                lastApp = app;
-            }
-            std::printf("  %s  %s  %s\n", r->uuid().string().c_str(), r->identifier().c_str(),
-                        r->bundlePath().c_str());
-        }
-        return 0;
-    }
-    if (command == "show") {
-        if (operands.size() != 1) {
-            std::fprintf(stderr, "vantry: show needs one UUID or PATH\n");
-            return 64;
-        }
-        auto uuid = UUID::parse(operands[0]);
-        PlugInRecordPtr r = uuid ? registry->plugInForUUID(*uuid) : registry->plugInForPath(operands[0]);
-        if (!r) {
-            std::fprintf(stderr, "vantry: no plug-in %s\n", operands[0].c_str());
-            return 1;
-        }
-        std::string out = asJson ? recordValue(r).json() : recordValue(r).description();
-        std::printf("%s\n", out.c_str());
-        return 0;
-    }
-    if (command == "watch") {
-        Printer printer;
-        auto subscription = registry->subscribe(printer);
-        std::printf("watching %s\n", registry->path().c_str());
-        std::fflush(stdout);
-        for (;;) pause();
+    struct Entry {
+        const char* name;
+        const cli::Spec* spec;
+        int (*run)(const cli::Parsed&);
+    };
+    const Entry commands[] = {
+        {"register", &kRegister, [](const cli::Parsed& p) { return registration(true, p); }},
+        {"unregister", &kUnregister, [](const cli::Parsed& p) { return registration(false, p); }},
+        {"list", &kList, list},
+        {"show", &kShow, show},
+        {"watch", &kWatch, watch},
+        {"rebuild", &kRebuild, rebuild},
+    };
+    for (const auto& c : commands) {
+        if (command != c.name) continue;
+        cli::Outcome parsed = cli::parse(kTool, *c.spec, args);
+        return parsed.parsed ? c.run(*parsed.parsed) : parsed.exitStatus;
     }
     std::fprintf(stderr, "vantry: unknown command %s\n%s", command.c_str(), kUsage);
-    return 64;
+    return cli::kUsage;
 }

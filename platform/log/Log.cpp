@@ -21,12 +21,16 @@ namespace corvane::log {
 
 namespace {
 
+enum class Sink { Journal, StandardError, Fallback };
+
 struct Config {
     Level defaultMinimum = Level::Default;
     std::map<std::string, Level, std::less<>> perCategory;
     bool showPrivate = false;
-    bool useJournal = false;
+    Sink sink = Sink::Fallback;
 };
+
+std::atomic<bool> gStandardErrorFallback{false};
 
 std::optional<Level> parseLevel(std::string_view s) {
     if (s == "debug") return Level::Debug;
@@ -56,12 +60,12 @@ Config readConfig() {
     c.showPrivate = priv && std::strcmp(priv, "0") != 0 && *priv;
     const char* sink = std::getenv("CORVANE_LOG_SINK");
     if (sink && std::strcmp(sink, "stderr") == 0) {
-        c.useJournal = false;
+        c.sink = Sink::StandardError;
     } else if (sink && std::strcmp(sink, "journal") == 0) {
-        c.useJournal = true;
+        c.sink = Sink::Journal;
     } else {
         struct stat st {};
-        c.useJournal = ::stat("/run/systemd/journal/socket", &st) == 0;
+        c.sink = ::stat("/run/systemd/journal/socket", &st) == 0 ? Sink::Journal : Sink::Fallback;
     }
     return c;
 }
@@ -103,7 +107,7 @@ void writeJournal(const Handle& h, Level level, const std::string& text) {
     int r = sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journalPriority(level),
                             "SUBSYSTEM=%s", h.subsystem().c_str(), "CATEGORY=%s",
                             h.category().c_str(), nullptr);
-    if (r < 0) writeStderr(h, level, text);
+    if (r < 0 && gStandardErrorFallback.load(std::memory_order_relaxed)) writeStderr(h, level, text);
 }
 
 }  // namespace
@@ -309,13 +313,17 @@ void write(const Handle& handle, Level level, std::string_view fmt, std::span<co
             return;
         }
     }
+    Sink sink = config().sink;
+    if (sink == Sink::Fallback && !gStandardErrorFallback.load(std::memory_order_relaxed)) return;
     std::string text = format(fmt, args, !config().showPrivate);
-    if (config().useJournal) {
+    if (sink == Sink::Journal) {
         writeJournal(handle, level, text);
     } else {
         writeStderr(handle, level, text);
     }
 }
+
+void setStandardErrorFallback(bool enabled) { gStandardErrorFallback.store(enabled, std::memory_order_relaxed); }
 
 // ---- CaptureSink
 

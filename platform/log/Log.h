@@ -119,6 +119,12 @@ std::string formatText(std::string_view fmt, const A&... args) {
     return format(fmt, std::span<const Arg>(list, sizeof...(A)), false);
 }
 
+// Where messages go when the journal is not there to take them: standard error in this project's
+// programs, which turn it on first thing in main; nowhere in a library inside someone else's
+// program (the default), whose standard error is not ours to write on. CORVANE_LOG_SINK=stderr
+// sends every message to standard error regardless.
+void setStandardErrorFallback(bool enabled);
+
 // Writes a message (already checked to be enabled).
 void write(const Handle& handle, Level level, std::string_view fmt, std::span<const Arg> args);
 

@@ -75,6 +75,8 @@ private:
 };
 
 class Value;
+template <class T>
+class Result;
 using Dictionary = std::map<std::string, Value, std::less<>>;
 using Array = std::vector<Value>;
 using Bytes = std::vector<uint8_t>;
@@ -180,6 +182,8 @@ public:
     std::string json() const;
     // Reads one value in the text notation; nullopt on anything malformed or trailing text.
     static std::optional<Value> parse(std::string_view text);
+    // The same, saying where the text went wrong: "at offset N: expected X".
+    static Result<Value> parseReporting(std::string_view text);
 
     friend bool operator==(const Value& a, const Value& b);
 

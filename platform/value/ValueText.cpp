@@ -238,9 +238,13 @@ public:
         auto v = parseValue(0);
         if (!v) return std::nullopt;
         skipSpace();
-        if (pos_ != s_.size()) return std::nullopt;
+        if (pos_ != s_.size()) return fail("the end of the text");
         return v;
     }
+
+    // Where the first failure was found, and what would have been accepted there.
+    size_t errorOffset() const { return errorAt_; }
+    const char* expected() const { return expected_; }
 
 private:
     // Deep enough for any real message, shallow enough that a hostile text cannot exhaust the
@@ -249,6 +253,17 @@ private:
 
     std::string_view s_;
     size_t pos_ = 0;
+    size_t errorAt_ = 0;
+    const char* expected_ = nullptr;
+
+    // Records the innermost failure (the first one found) and fails.
+    std::nullopt_t fail(const char* expected) {
+        if (!expected_) {
+            expected_ = expected;
+            errorAt_ = std::min(pos_, s_.size());
+        }
+        return std::nullopt;
+    }
 
     void skipSpace() {
         while (pos_ < s_.size() &&
@@ -272,16 +287,16 @@ private:
     }
 
     std::optional<Value> parseValue(int depth) {
-        if (depth > kMaxDepth) return std::nullopt;
+        if (depth > kMaxDepth) return fail("less nesting");
         skipSpace();
-        if (pos_ >= s_.size()) return std::nullopt;
+        if (pos_ >= s_.size()) return fail("a value");
         char c = s_[pos_];
         switch (c) {
             case '{': return parseDictionary(depth);
             case '[': return parseArray(depth);
             case '"': {
                 auto s = parseString();
-                if (!s) return std::nullopt;
+                if (!s) return fail("a string");
                 return Value(std::move(*s));
             }
             case '<': return parseData();
@@ -294,14 +309,14 @@ private:
         if (eatWord("nan")) return Value(std::nan(""));
         if (eatWord("uuid(")) {
             auto u = UUID::parse(s_.substr(pos_, 36));
-            if (!u) return std::nullopt;
+            if (!u) return fail("a UUID of 36 characters (8-4-4-4-12 hexadecimal digits)");
             pos_ += 36;
-            if (!eat(')')) return std::nullopt;
+            if (!eat(')')) return fail("\")\"");
             return Value(*u);
         }
         if (eatWord("fd(")) return parseFd();
         if (c == '-' || (c >= '0' && c <= '9')) return parseNumber();
-        return std::nullopt;
+        return fail("a value");
     }
 
     std::optional<Value> parseDictionary(int depth) {
@@ -310,14 +325,15 @@ private:
         if (eat('}')) return Value(std::move(d));
         for (;;) {
             skipSpace();
-            if (pos_ >= s_.size() || s_[pos_] != '"') return std::nullopt;
+            if (pos_ >= s_.size() || s_[pos_] != '"') return fail("a key in double quotes");
             auto key = parseString();
-            if (!key || !eat(':')) return std::nullopt;
+            if (!key) return fail("a key in double quotes");
+            if (!eat(':')) return fail("\":\"");
             auto v = parseValue(depth + 1);
             if (!v) return std::nullopt;
             d.insert_or_assign(std::move(*key), std::move(*v));
             if (eat('}')) return Value(std::move(d));
-            if (!eat(',')) return std::nullopt;
+            if (!eat(',')) return fail("\",\" or \"}\"");
         }
     }
 
@@ -330,7 +346,7 @@ private:
             if (!v) return std::nullopt;
             a.push_back(std::move(*v));
             if (eat(']')) return Value(std::move(a));
-            if (!eat(',')) return std::nullopt;
+            if (!eat(',')) return fail("\",\" or \"]\"");
         }
     }
 
@@ -358,10 +374,10 @@ private:
         while (pos_ < s_.size()) {
             auto c = static_cast<unsigned char>(s_[pos_++]);
             if (c == '"') {
-                if (!isValidUtf8(out)) return std::nullopt;
+                if (!isValidUtf8(out)) return fail("well-formed UTF-8");
                 return out;
             }
-            if (c < 0x20) return std::nullopt;
+            if (c < 0x20) return fail("no control character in a string (write it as \\u00XX)");
             if (c != '\\') {
                 out.push_back(static_cast<char>(c));
                 continue;
@@ -391,25 +407,25 @@ private:
                     if (!appendUtf8(out, *cp)) return std::nullopt;
                     break;
                 }
-                default: return std::nullopt;
+                default: return fail("an escape: \\\" \\\\ \\/ \\b \\f \\n \\r \\t or \\uXXXX");
             }
         }
-        return std::nullopt;
+        return fail("the closing double quote");
     }
 
     std::optional<Value> parseData() {
         ++pos_;
         Bytes bytes;
         for (;;) {
-            if (pos_ >= s_.size()) return std::nullopt;
+            if (pos_ >= s_.size()) return fail("\">\" closing the data");
             if (s_[pos_] == '>') {
                 ++pos_;
                 return Value::data(std::move(bytes));
             }
-            if (pos_ + 1 >= s_.size()) return std::nullopt;
+            if (pos_ + 1 >= s_.size()) return fail("two hexadecimal digits per byte");
             int hi = hexDigit(s_[pos_]);
             int lo = hexDigit(s_[pos_ + 1]);
-            if (hi < 0 || lo < 0) return std::nullopt;
+            if (hi < 0 || lo < 0) return fail("two hexadecimal digits per byte");
             bytes.push_back(static_cast<uint8_t>(hi << 4 | lo));
             pos_ += 2;
         }
@@ -451,13 +467,13 @@ private:
             }
             if (pos_ == start) return std::nullopt;
         }
-        if (!eatWord("Z")) return std::nullopt;
+        if (!eatWord("Z")) return fail("a date written @YYYY-MM-DDThh:mm:ss[.ffffff]Z");
         static const unsigned monthDays[] = {31, 29, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
         if (*mo < 1 || *mo > 12 || *d < 1 || *d > monthDays[*mo - 1] || *h > 23 || *mi > 59 ||
             *se > 59)
-            return std::nullopt;
+            return fail("a date that exists");
         bool leap = (*y % 4 == 0 && *y % 100 != 0) || *y % 400 == 0;
-        if (*mo == 2 && *d == 29 && !leap) return std::nullopt;
+        if (*mo == 2 && *d == 29 && !leap) return fail("a date that exists");
         int64_t days =
             daysFromCivil(*y, static_cast<unsigned>(*mo), static_cast<unsigned>(*d));
         int64_t secs = days * 86400 + *h * 3600 + *mi * 60 + *se;
@@ -481,7 +497,7 @@ private:
         if (s_[pos_] == '-') ++pos_;
         size_t digitsStart = pos_;
         while (pos_ < s_.size() && s_[pos_] >= '0' && s_[pos_] <= '9') ++pos_;
-        if (pos_ == digitsStart) return std::nullopt;
+        if (pos_ == digitsStart) return fail("a digit");
         bool isDouble = false;
         if (pos_ < s_.size() && s_[pos_] == '.') {
             isDouble = true;
@@ -503,13 +519,13 @@ private:
         errno = 0;
         if (pos_ < s_.size() && s_[pos_] == 'u') {
             ++pos_;
-            if (text[0] == '-') return std::nullopt;
+            if (text[0] == '-') return fail("an unsigned integer without a sign");
             unsigned long long u = std::strtoull(text.c_str(), nullptr, 10);
-            if (errno == ERANGE) return std::nullopt;
+            if (errno == ERANGE) return fail("an unsigned integer below 2^64");
             return Value(static_cast<uint64_t>(u));
         }
         long long i = std::strtoll(text.c_str(), nullptr, 10);
-        if (errno == ERANGE) return std::nullopt;
+        if (errno == ERANGE) return fail("an integer within 64 bits (or a \"u\" for an unsigned one)");
         return Value(static_cast<int64_t>(i));
     }
 };
@@ -529,6 +545,14 @@ std::string Value::json() const {
 }
 
 std::optional<Value> Value::parse(std::string_view text) { return Parser(text).parseAll(); }
+
+Result<Value> Value::parseReporting(std::string_view text) {
+    Parser parser(text);
+    if (auto v = parser.parseAll()) return std::move(*v);
+    std::string at = "at offset " + std::to_string(parser.errorOffset());
+    return Error{"com.corvane.value", 1,
+                 at + ": expected " + (parser.expected() ? parser.expected() : "a value in the text notation")};
+}
 
 bool appendUtf8(std::string& out, uint32_t cp) {
     if (cp > 0x10ffff || (cp >= 0xd800 && cp <= 0xdfff)) return false;

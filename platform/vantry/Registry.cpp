@@ -47,6 +47,10 @@ Status Registry::unregisterBundle(const std::string& path) { return store_->unre
 
 std::vector<std::string> Registry::registeredPaths() { return store_->registeredPaths(); }
 
+std::vector<ApplicationRecordPtr> Registry::installedApplications() { return store_->installedApplications(); }
+
+Status Registry::checkBundle(const std::string& path) { return vantry::checkBundle(path); }
+
 Subscription Registry::subscribe(Observer& observer) { return store_->subscribe(observer); }
 
 void Registry::dropCaches() { store_->dropCaches(); }

@@ -1,8 +1,11 @@
 // Reading bundles from disk at registration: the plug-in's metadata merged with its SDK, its
 // verified entitlements, its data container, its names, and a fingerprint of all of it.
+#include <dirent.h>
 #include <sodium.h>
 #include <sys/stat.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <cstdlib>
 
 #include "platform/codesign/CodeSign.h"
@@ -74,19 +77,66 @@ LocalizedNames localizedNames(const std::string& bundle, const Value& info) {
     return {display ? display : shortName, shortName};
 }
 
+Result<Value> readPlugInInfo(const std::string& path) {
+    auto info = plist::readFile(path + "/Info.plist");
+    if (!info || !info->isDictionary()) return refusal("malformed or missing Info.plist in " + path);
+    if (!(*info)["KSExtension"].isDictionary()) return refusal("no plug-in dictionary (KSExtension) in " + path);
+    auto extId = stringAt((*info)["KSExtension"], "KSExtensionIdentifier");
+    if (!extId && stringAt(*info, "KFBundleIdentifier").value_or("").empty())
+        return refusal("plug-in without identifier: " + path);
+    if (extId && extId->empty()) return refusal("plug-in without identifier: " + path);
+    return *info;
+}
+
+Result<std::vector<std::string>> plugInPathsOf(const std::string& appPath) {
+    std::vector<std::string> paths;
+    std::string plugInsDir = appPath + "/PlugIns";
+    DIR* d = opendir(plugInsDir.c_str());
+    if (!d) return paths;
+    std::vector<std::string> names;
+    while (struct dirent* e = readdir(d)) {
+        std::string n = e->d_name;
+        if (n.size() > 6 && n.substr(n.size() - 6) == ".appex") names.push_back(n);
+    }
+    closedir(d);
+    std::sort(names.begin(), names.end());
+    for (const auto& n : names) {
+        auto p = layout::canonicalPath(plugInsDir + "/" + n);
+        if (!p) {
+            return refusal((errno == ELOOP ? "symbolic link loop under PlugIns/: " : "unreadable plug-in: ") +
+                           plugInsDir + "/" + n);
+        }
+        paths.push_back(*p);
+    }
+    return paths;
+}
+
+Status checkBundle(const std::string& given) {
+    auto path = layout::canonicalPath(given);
+    struct stat st {};
+    if (!path || ::stat(path->c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return refusal("not a bundle: " + given);
+    auto info = plist::readFile(*path + "/Info.plist");
+    if (!info || !info->isDictionary()) return refusal("malformed or missing Info.plist in " + *path);
+    if ((*info)["KSExtension"].isDictionary()) return readPlugInInfo(*path).status();
+    if (!stringAt(*info, "KFBundleIdentifier"))
+        return refusal("application without identifier (KFBundleIdentifier): " + *path);
+    auto plugIns = plugInPathsOf(*path);
+    if (!plugIns) return plugIns.error();
+    for (const auto& p : *plugIns) {
+        if (auto read = readPlugInInfo(p); !read) return read.error();
+    }
+    return {};
+}
+
 Result<ScannedPlugIn> scanPlugIn(const std::string& path) {
-    Value info = [&] {
-        auto v = plist::readFile(path + "/Info.plist");
-        return v && v->isDictionary() ? *v : Value();
-    }();
-    if (info.isNull()) return refusal("malformed or missing Info.plist in " + path);
-    if (!info["KSExtension"].isDictionary()) return refusal("no plug-in dictionary (KSExtension) in " + path);
+    auto read = readPlugInInfo(path);
+    if (!read) return read.error();
+    const Value& info = *read;
     ScannedPlugIn s;
     s.path = path;
     s.bundleIdentifier = stringAt(info, "KFBundleIdentifier").value_or("");
     auto extId = stringAt(info["KSExtension"], "KSExtensionIdentifier");
     s.identifier = extId ? *extId : s.bundleIdentifier;
-    if (s.identifier.empty()) return refusal("plug-in without identifier: " + path);
     s.bundleVersion = stringAt(info, "KFBundleVersion").value_or("");
     auto resolved = sdk::resolve(info);
     s.info = resolved.info;

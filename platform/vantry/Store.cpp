@@ -196,6 +196,18 @@ std::vector<std::string> Store::registeredPaths() {
     return out;
 }
 
+std::vector<ApplicationRecordPtr> Store::installedApplications() {
+    MutexLock lock(mutex_);
+    checkFreshness();
+    std::vector<std::string> paths;
+    Statement q(db_, "SELECT path FROM applications ORDER BY path");
+    while (q && q.step() == SQLITE_ROW) paths.push_back(q.text(0));
+    std::vector<ApplicationRecordPtr> out;
+    for (const auto& p : paths)
+        if (auto app = appFromRow(p)) out.push_back(std::move(app));
+    return out;
+}
+
 void Store::dropCaches() {
     MutexLock lock(mutex_);
     byUUID_.clear();
@@ -350,25 +362,12 @@ Status Store::registerApplication(const std::string& path, const Value& info, bo
     if (!appId) return refusal("application without identifier (KFBundleIdentifier): " + path);
     // Scan every plug-in first: a bundle that cannot be read leaves the database as it was.
     std::vector<ScannedPlugIn> scanned;
-    std::string plugInsDir = path + "/PlugIns";
-    if (DIR* d = opendir(plugInsDir.c_str())) {
-        std::vector<std::string> names;
-        while (struct dirent* e = readdir(d)) {
-            std::string n = e->d_name;
-            if (n.size() > 6 && n.substr(n.size() - 6) == ".appex") names.push_back(n);
-        }
-        closedir(d);
-        std::sort(names.begin(), names.end());
-        for (const auto& n : names) {
-            auto p = layout::canonicalPath(plugInsDir + "/" + n);
-            if (!p) {
-                return refusal((errno == ELOOP ? "symbolic link loop under PlugIns/: " : "unreadable plug-in: ") +
-                               plugInsDir + "/" + n);
-            }
-            auto s = scanPlugIn(*p);
-            if (!s) return s.error();
-            scanned.push_back(std::move(*s));
-        }
+    auto plugInPaths = plugInPathsOf(path);
+    if (!plugInPaths) return plugInPaths.error();
+    for (const auto& p : *plugInPaths) {
+        auto s = scanPlugIn(p);
+        if (!s) return s.error();
+        scanned.push_back(std::move(*s));
     }
     LocalizedNames names = localizedNames(path, info);
     Dictionary appRecord{{"identifier", *appId}, {"placeholder", placeholder}};

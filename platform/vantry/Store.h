@@ -93,8 +93,15 @@ struct LocalizedNames {
     std::optional<std::string> display, shortName;
 };
 
+// A plug-in bundle's Info.plist, refused when it cannot be read, is no plug-in or has no identifier.
+Result<Value> readPlugInInfo(const std::string& path);
 // Reads one plug-in bundle. Refused when it cannot be read or has no identifier.
 Result<ScannedPlugIn> scanPlugIn(const std::string& path);
+// The plug-in bundles under an application's PlugIns/, canonical and in order; refused on a link
+// loop or an unreadable entry.
+Result<std::vector<std::string>> plugInPathsOf(const std::string& appPath);
+// Registration's reading of a bundle, without registering it.
+Status checkBundle(const std::string& path);
 // The display and short names of a bundle in the user's language.
 LocalizedNames localizedNames(const std::string& bundle, const Value& info);
 // A new record (with a fresh UUID) for a scanned plug-in.
@@ -133,6 +140,7 @@ public:
                                        const std::function<bool(const std::string&, const Value&)>& filter)
         EXCLUDES(mutex_);
     std::vector<std::string> registeredPaths() EXCLUDES(mutex_);
+    std::vector<ApplicationRecordPtr> installedApplications() EXCLUDES(mutex_);
     void dropCaches() EXCLUDES(mutex_);
 
     // Writes.

@@ -143,6 +143,8 @@ public:
     PlugInRecordPtr plugInForPath(const std::string& bundlePath);
     ApplicationRecordPtr applicationForPath(const std::string& bundlePath);
     std::vector<PlugInRecordPtr> installedPlugIns();
+    // Every registered application, with or without plug-ins, ordered by bundle path.
+    std::vector<ApplicationRecordPtr> installedApplications();
     // The plug-ins that may fit `pattern` and that `filter` accepts. The registry drops a plug-in
     // only when the pattern's exact test would certainly fail; the filter is called with the
     // plug-in's identifier and entitlements before its record is built.
@@ -154,6 +156,9 @@ public:
     // cannot be read; the database is then unchanged.
     Status registerBundle(const std::string& path, bool placeholder = false);
     Status unregisterBundle(const std::string& path);
+    // Reads a bundle as registration would and says why it would be refused; writes nothing and
+    // needs no database.
+    static Status checkBundle(const std::string& path);
     // The paths registered so far, for rebuilding a damaged database.
     std::vector<std::string> registeredPaths();
 

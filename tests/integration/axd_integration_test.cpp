@@ -174,7 +174,7 @@ TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
 
     // remove: refused without the manager entitlement, served with it.
     auto refused = d.axctl({"remove", app});
-    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(refused.status, 77);  // refused for lack of an entitlement
     EXPECT_NE(refused.err.find("caller lacks entitlement for this operation (error 11)"), std::string::npos) << refused.err;
     EXPECT_TRUE((*registry)->plugInForPath(app + "/PlugIns/One.appex"));
     EXPECT_EQ(d.send(request("remove", {{"paths", Value(Array{})}})), dict({}));  // no path: no test
