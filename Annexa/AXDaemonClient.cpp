@@ -8,18 +8,36 @@ namespace log = corvane::log;
 using corvane::rpx::Reply;
 
 AXDaemonClient::AXDaemonClient(const std::optional<std::string>& serviceName)
-    : replyQueue_(corvane::dispatch::Queue::create("axd_client")),
-      axd_(corvane::rpx::Connection::connect(serviceName.value_or(kDefaultServiceName), replyQueue_)) {
-    axd_->setEventHandler([](const corvane::rpx::Event& ev) {
-        log::error(logOps(), "Communications error: %{public}@", ev.description());
-    });
-    axd_->resume();
+    : serviceName_(serviceName.value_or(kDefaultServiceName)),
+      replyQueue_(corvane::dispatch::Queue::create("axd_client")) {
+    corvane::MutexLock lock(mutex_);
+    axd_ = connectLocked();
 }
 
 AXDaemonClient::~AXDaemonClient() {
+    corvane::MutexLock lock(mutex_);
     // Closing is no communications error.
     axd_->setEventHandler(nullptr);
     axd_->cancel();
+}
+
+std::shared_ptr<corvane::rpx::Connection> AXDaemonClient::connectLocked() {
+    auto connection = corvane::rpx::Connection::connect(serviceName_, replyQueue_);
+    connection->setEventHandler([](const corvane::rpx::Event& ev) {
+        log::error(logOps(), "Communications error: %{public}@", ev.description());
+    });
+    connection->resume();
+    return connection;
+}
+
+std::shared_ptr<corvane::rpx::Connection> AXDaemonClient::connection() {
+    corvane::MutexLock lock(mutex_);
+    if (!axd_->isValid()) {
+        log::debug(logOps(), "connecting again to %{public}@", serviceName_);
+        axd_->setEventHandler(nullptr);
+        axd_ = connectLocked();
+    }
+    return axd_;
 }
 
 Dictionary AXDaemonClient::request(const std::string& name) const {
@@ -40,7 +58,7 @@ void AXDaemonClient::setUuids(Dictionary& message, const std::vector<UUID>& uuid
 
 void AXDaemonClient::send(const Value& message, Completion reply) {
     log::debug(logTraffic(), "request: %@", message);
-    axd_->sendWithReply(message, replyQueue_, [reply = std::move(reply)](const Reply& r) {
+    connection()->sendWithReply(message, replyQueue_, [reply = std::move(reply)](const Reply& r) {
         log::debug(logTraffic(), "reply: %@", r.description());
         reply(r);
     });

@@ -18,6 +18,10 @@ namespace annexa {
 
 // Thread-safe: requests may be made from any thread; completions and connection events run on the
 // queue "axd_client", one at a time.
+//
+// A request made after the connection ended (the daemon restarted, or was not there yet) connects
+// again first, once per request: a long-running host survives a daemon restart without making a
+// new client. A request under way when the connection ends fails with "Connection invalid".
 class AXDaemonClient {
 public:
     using Completion = std::function<void(const corvane::rpx::Reply&)>;
@@ -61,9 +65,17 @@ public:
     uint64_t protocolVersion() const { return protocolVersion_; }
     void setProtocolVersion(uint64_t version) { protocolVersion_ = version; }
 
+    const std::string& serviceName() const { return serviceName_; }
+
 private:
+    // The live connection, made anew when the last one has ended.
+    std::shared_ptr<corvane::rpx::Connection> connection() EXCLUDES(mutex_);
+    std::shared_ptr<corvane::rpx::Connection> connectLocked() REQUIRES(mutex_);
+
+    const std::string serviceName_;
     corvane::dispatch::QueuePtr replyQueue_;
-    std::shared_ptr<corvane::rpx::Connection> axd_;
+    corvane::Mutex mutex_;
+    std::shared_ptr<corvane::rpx::Connection> axd_ GUARDED_BY(mutex_);
     std::atomic<uint64_t> protocolVersion_{kCurrentProtocolVersion};
 };
 

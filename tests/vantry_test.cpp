@@ -268,6 +268,28 @@ TEST(Vantry, AChangedPlugInIsReplacedAndOthersKeepTheirIdentity) {
     EXPECT_FALSE(a->containingApplication());
 }
 
+// The listing names every application, those without plug-ins too, in text and in JSON.
+TEST(Vantry, ListingShowsApplicationsWithoutPlugIns) {
+    Fixture f;
+    std::string bare = axtest::makeBundle(f.root.path(), "Bare.app", axtest::appInfo("com.example.bare"), "/bin/true");
+    ASSERT_EQ(f.vantry({"register", f.app}).status, 0);
+    ASSERT_EQ(f.vantry({"register", bare}).status, 0);
+    auto text = f.vantry({"list"});
+    EXPECT_NE(text.out.find(bare + "  (no plug-ins)\n"), std::string::npos) << text.out;
+    EXPECT_NE(text.out.find(f.app + "\n  "), std::string::npos) << text.out;
+    auto json = f.vantry({"list", "--json"});
+    ASSERT_EQ(json.status, 0);
+    // JSON's objects and arrays read as the text notation's, so the document parses as a Value.
+    auto document = Value::parse(json.out);
+    ASSERT_TRUE(document) << json.out;
+    const Array* apps = (*document)["applications"].asArray();
+    ASSERT_TRUE(apps);
+    ASSERT_EQ(apps->size(), 2u);
+    EXPECT_EQ((*apps)[0]["path"], Value(bare));
+    EXPECT_EQ((*apps)[0]["plugins"], Value(Array{}));
+    EXPECT_EQ((*apps)[1]["plugins"].asArray()->size(), 3u);
+}
+
 TEST(Vantry, ADamagedDatabaseIsReportedAndRebuilt) {
     Fixture f;
     ASSERT_EQ(f.vantry({"register", f.app}).status, 0);

@@ -32,7 +32,13 @@ int64_t report(int64_t code, const std::string& text, char** errorText) {
     return code;
 }
 
-int64_t finish(const Reply& reply, char** errorText) {
+int64_t unreachable(const AXDaemonClient& client, const Reply& reply, char** errorText) {
+    return report(ANNEXA_EUNREACHABLE, "cannot reach the daemon at " + client.serviceName() + ": " + reply.description(),
+                  errorText);
+}
+
+int64_t finish(const AXDaemonClient& client, const Reply& reply, char** errorText) {
+    if (!reply.ok()) return unreachable(client, reply, errorText);
     corvane::Status status = AXDaemonClient::errorInReply(reply);
     if (!status.ok()) return report(status.error().code, status.error().description(), errorText);
     return report(0, {}, errorText);
@@ -61,30 +67,32 @@ annexa_client* annexa_client_create(const char* service_name) {
 
 void annexa_client_destroy(annexa_client* client) { delete client; }
 
-int64_t annexa_send(annexa_client* client, const char* message, char** reply) {
+int64_t annexa_send(annexa_client* client, const char* message, char** reply, char** error_text) {
     if (reply) *reply = nullptr;
-    if (!client || !message || !reply) return ANNEXA_EINVAL;
-    auto value = corvane::Value::parse(message);
-    if (!value) return ANNEXA_EINVAL;
+    if (!client || !message || !reply) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    auto value = corvane::Value::parseReporting(message);
+    if (!value) return report(ANNEXA_EINVAL, "not one value in the text notation: " + value.error().description(), error_text);
     AXDaemonClient& c = client->client;
     Reply r = c.wait([&](AXDaemonClient::Completion done) { c.send(*value, std::move(done)); });
-    if (!r.ok()) return annexa::errorCodeValue(annexa::AXErrorCode::InvalidRequest);
+    if (!r.ok()) return unreachable(c, r, error_text);
     *reply = copyText(r.value.description());
-    return 0;
+    return report(0, {}, error_text);
 }
+
+void annexa_log_to_stderr(int enabled) { corvane::log::setStandardErrorFallback(enabled != 0); }
 
 int64_t annexa_add(annexa_client* client, const char* const* paths, size_t count, char** error_text) {
     std::vector<std::string> list;
     if (!client || !readPaths(paths, count, list)) return report(ANNEXA_EINVAL, "invalid argument", error_text);
     AXDaemonClient& c = client->client;
-    return finish(c.wait([&](AXDaemonClient::Completion done) { c.addPlugIns(list, std::move(done)); }), error_text);
+    return finish(c, c.wait([&](AXDaemonClient::Completion done) { c.addPlugIns(list, std::move(done)); }), error_text);
 }
 
 int64_t annexa_remove(annexa_client* client, const char* const* paths, size_t count, char** error_text) {
     std::vector<std::string> list;
     if (!client || !readPaths(paths, count, list)) return report(ANNEXA_EINVAL, "invalid argument", error_text);
     AXDaemonClient& c = client->client;
-    return finish(c.wait([&](AXDaemonClient::Completion done) { c.removePlugIns(list, std::move(done)); }),
+    return finish(c, c.wait([&](AXDaemonClient::Completion done) { c.removePlugIns(list, std::move(done)); }),
                   error_text);
 }
 
@@ -102,7 +110,7 @@ int64_t annexa_annotate(annexa_client* client, const char* const* uuids, size_t 
     auto value = corvane::Value::parse(annotations);
     if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
     AXDaemonClient& c = client->client;
-    return finish(c.wait([&](AXDaemonClient::Completion done) { c.setPlugInAnnotations(list, *value, std::move(done)); }),
+    return finish(c, c.wait([&](AXDaemonClient::Completion done) { c.setPlugInAnnotations(list, *value, std::move(done)); }),
                   error_text);
 }
 
@@ -111,7 +119,7 @@ int64_t annexa_bulk_annotate(annexa_client* client, const char* annotations, cha
     auto value = corvane::Value::parse(annotations);
     if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
     AXDaemonClient& c = client->client;
-    return finish(c.wait([&](AXDaemonClient::Completion done) { c.bulkSetPlugInAnnotations(*value, std::move(done)); }),
+    return finish(c, c.wait([&](AXDaemonClient::Completion done) { c.bulkSetPlugInAnnotations(*value, std::move(done)); }),
                   error_text);
 }
 

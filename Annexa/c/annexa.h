@@ -6,10 +6,18 @@
  * Values cross this interface in the text notation of messages (docs/rpx-wire.md), for example
  * {"election": 1} or {"request": "bulk", "version": 3u}.
  *
- * Return codes: 0 for success; a positive code is the daemon's error code (4 also when the daemon
- * cannot be reached); ANNEXA_EINVAL when the caller's arguments are unusable (a null pointer, text
- * that is not one value in the notation, a UUID that does not parse). When `error_text` is not
- * null it receives the error's text on failure (release it with annexa_free) and null on success.
+ * Return codes: 0 for success; a positive code is the daemon's error code (docs/client-library.md
+ * lists them); ANNEXA_EUNREACHABLE when the daemon cannot be reached (not running, or the
+ * connection ended before the reply came); ANNEXA_EINVAL when the caller's arguments are unusable
+ * (a null pointer, text that is not one value in the notation, a UUID that does not parse). When
+ * `error_text` is not null it receives the error's text on failure (release it with annexa_free)
+ * and null on success.
+ *
+ * A client connects again by itself when a call finds its connection ended, so a host keeps its
+ * client across restarts of the daemon.
+ *
+ * The library writes its log to the journal, or nowhere when there is none; it writes on the
+ * host's standard error only after annexa_log_to_stderr(1) or with CORVANE_LOG_SINK=stderr.
  *
  * A client may be used from one thread at a time; separate clients are independent. */
 #ifndef ANNEXA_H
@@ -23,6 +31,7 @@ extern "C" {
 #endif
 
 #define ANNEXA_EINVAL (-1)
+#define ANNEXA_EUNREACHABLE (-2)
 
 typedef struct annexa_client annexa_client;
 
@@ -33,8 +42,9 @@ void annexa_client_destroy(annexa_client* client);
 
 /* Sends one message written in the text notation and waits for the reply, which `reply` receives
  * in the same notation (release it with annexa_free). Returns 0 whenever a reply came, whatever it
- * says; 4 when the daemon cannot be reached. */
-int64_t annexa_send(annexa_client* client, const char* message, char** reply);
+ * says; ANNEXA_EUNREACHABLE when the daemon cannot be reached, ANNEXA_EINVAL for a message that is
+ * not one value (`error_text` then says where it went wrong). */
+int64_t annexa_send(annexa_client* client, const char* message, char** reply, char** error_text);
 
 /* Registers bundles (absolute paths): applications with their plug-ins, or plug-ins alone. */
 int64_t annexa_add(annexa_client* client, const char* const* paths, size_t count, char** error_text);
@@ -46,6 +56,9 @@ int64_t annexa_annotate(annexa_client* client, const char* const* uuids, size_t 
                         char** error_text);
 /* Sets each plug-in's extension dictionary: a dictionary from UUID texts to dictionaries. */
 int64_t annexa_bulk_annotate(annexa_client* client, const char* annotations, char** error_text);
+
+/* With a non-zero argument, log lines the journal cannot take go to standard error. */
+void annexa_log_to_stderr(int enabled);
 
 /* Releases text returned by this interface. */
 void annexa_free(void* text);

@@ -19,10 +19,12 @@ int main(int argc, char** argv) {
     annexa_client* client = annexa_client_create(NULL);
     if (!client) return 70;
     char* text = NULL;
-    int64_t code = annexa_send(client, "{\"request\": \"bulk\", \"version\": 3u}", &text);
+    char* error = NULL;
+    int64_t code = annexa_send(client, "{\"request\": \"bulk\", \"version\": 3u}", &text, &error);
     line("send", code, text);
-    code = annexa_send(client, "{not the notation", &text);
-    line("send garbage", code, text);
+    annexa_free(error);
+    code = annexa_send(client, "{not the notation", &text, &error);
+    line("send garbage", code, error);
 
     const char* paths[] = {argv[1]};
     code = annexa_add(client, paths, 1, &text);
@@ -51,6 +53,8 @@ int main(int argc, char** argv) {
     annexa_client* nobody = annexa_client_create("com.nobody.here");
     code = annexa_add(nobody, paths, 1, &text);
     line("unreachable", code, text);
+    code = annexa_send(nobody, "{}", &text, &error);
+    line("send unreachable", code, error);
     annexa_client_destroy(nobody);
     return 0;
 }

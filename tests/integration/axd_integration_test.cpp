@@ -36,13 +36,16 @@ struct Daemon {
     std::unique_ptr<axtest::Process> axd;
     dispatch::QueuePtr queue = dispatch::Queue::create("test.client");
 
-    explicit Daemon(std::vector<std::string> args = {}) {
+    explicit Daemon(std::vector<std::string> args = {}) { start(std::move(args)); }
+    ~Daemon() { stop(); }
+    void start(std::vector<std::string> args = {}) {
         args.insert(args.begin(), axtest::binary("axd"));
         axd = std::make_unique<axtest::Process>(args, std::map<std::string, std::string>{
                                                           {"CORVANE_LOG", "debug"}, {"CORVANE_LOG_SINK", "stderr"}, {"CORVANE_LOG_PRIVATE", "1"}});
-        axtest::eventually([] { return axtest::exists(rpx::endpointPath("com.corvane.annexa.axd")); });
+        // A socket file left by the daemon before does not count: the endpoint must answer.
+        axtest::eventually([] { return axtest::endpointAnswers(rpx::endpointPath("com.corvane.annexa.axd")); });
     }
-    ~Daemon() {
+    void stop() {
         axd->signal(SIGTERM);
         axd->wait(5s);
     }
@@ -203,7 +206,7 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
     ASSERT_EQ(host.status, 0) << host.err;
     EXPECT_EQ(host.out,
               "send: 0 {}\n"
-              "send garbage: -1 -\n"
+              "send garbage: -1 not one value in the text notation: at offset 1: expected a key in double quotes\n"
               "add: 0 -\n"
               "add relative: 9 absolute path required: relative/App.app\n"
               "annotate: 0 -\n"
@@ -211,10 +214,32 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
               "annotate bad uuid: -1 not a UUID: not-a-uuid\n"
               "bulk-annotate: 0 -\n"
               "remove: 11 caller lacks entitlement for this operation\n"
-              "unreachable: 4 Connection invalid\n");
+              "unreachable: -2 cannot reach the daemon at com.nobody.here: Connection invalid\n"
+              "send unreachable: -2 cannot reach the daemon at com.nobody.here: Connection invalid\n");
+    // The library logged its communications errors, but not on the host's standard error.
+    EXPECT_EQ(host.err, "");
     std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";
     EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"],
               dict({{"election", 1}, {"extension", dict({{"from", "C"}})}}));
+}
+
+// A long-running host keeps its client: the request after the daemon went away fails as
+// unreachable, and the first one after it came back connects again and is served.
+TEST(Axd, AHostKeepsItsClientAcrossADaemonRestart) {
+    Daemon d;
+    annexa::AXDaemonClient client;
+    auto bulk = [&] { return client.wait([&](auto done) { client.bulkPlugIns(0, done); }); };
+    EXPECT_TRUE(bulk().ok());
+    d.stop();
+    auto gone = bulk();
+    EXPECT_FALSE(gone.ok());
+    EXPECT_EQ(gone.description(), "Connection invalid");
+    d.start();
+    for (int i = 0; i < 3; ++i) {
+        auto served = bulk();
+        EXPECT_TRUE(served.ok()) << i << ": " << served.description();
+        EXPECT_EQ(served.value, dict({}));
+    }
 }
 
 TEST(Axd, SendRoundTripsTheTextNotation) {

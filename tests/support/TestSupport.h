@@ -51,6 +51,8 @@ std::string sourceDir();
 void writeFile(const std::string& path, const std::string& contents, int mode = 0644);
 std::string readFile(const std::string& path);
 bool exists(const std::string& path);
+// Whether a listening Unix socket at `path` accepts a connection.
+bool endpointAnswers(const std::string& path);
 
 // A child process with its standard output and error collected in files.
 class Process {
