@@ -133,10 +133,8 @@ void write(std::string& out, const Value& v, Notation notation) {
             out += buf;
             break;
         case K::Double:
-            if (json) {
-                double d = *v.doubleValue();
-                std::snprintf(buf, sizeof buf, "%.17g", d);
-                out += std::isfinite(d) ? buf : "null";
+            if (json && !std::isfinite(*v.doubleValue())) {
+                out += "null";
             } else {
                 appendDouble(out, *v.doubleValue());
             }
