@@ -145,6 +145,19 @@ TEST(Axd, MalformedRequestsGetTheirErrorReplies) {
 
 TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
     Daemon d;
+    // A bundle the registry cannot read: the reply's text is fixed, the reason comes beside it.
+    std::string broken = axtest::makeBundle(d.root.path(), "Broken.app", axtest::appInfo("com.example.broken"), "/bin/true");
+    axtest::makeBundle(broken + "/PlugIns", "NoDictionary.appex", axtest::appInfo("com.example.nodict"), "/bin/true");
+    auto refusedAdd = d.axctl({"add", broken});
+    EXPECT_EQ(refusedAdd.status, 1);
+    EXPECT_NE(refusedAdd.err.find("unable to register plug-in at " + broken + " (error 2)"), std::string::npos)
+        << refusedAdd.err;
+    EXPECT_NE(refusedAdd.err.find("axctl: no plug-in dictionary (KSExtension) in " + broken +
+                                  "/PlugIns/NoDictionary.appex"),
+              std::string::npos)
+        << refusedAdd.err;
+    EXPECT_TRUE(d.axd->waitForErr("<error> com.corvane.Annexa:ops: Vantry cannot register"));
+
     std::string app = makeApp(d.root.path());
     auto add = d.axctl({"add", app});
     ASSERT_EQ(add.status, 0) << add.err;
