@@ -37,6 +37,8 @@ int64_t versionOf(const Value& top) {
 
 AXDAnnotationStore::AXDAnnotationStore(const char* path)
     : annotationsURL_(path ? std::string(path) : defaultDatabaseURL()) {
+    // The daemon is the file's one writer: whatever a write killed half-way left is stale.
+    corvane::plist::removeStaleTemporaries(annotationsURL_);
     Status loaded = loadDb(annotationsURL_);
     if (loaded.ok()) return;
     const Error& error = loaded.error();
@@ -61,6 +63,12 @@ Value AXDAnnotationStore::annotationForIdentifier(const std::string& key) const 
 }
 
 void AXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, const std::string& key) {
+    changeAnnotationForIdentifier(annotation, key);
+    saveIfChanged();
+}
+
+void AXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, const std::string& key) {
+    changed_ = true;
     if (annotation.isNull()) {
         annotations_.erase(key);
     } else {
@@ -71,10 +79,16 @@ void AXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, con
         }
         annotations_.insert_or_assign(key, Value(std::move(merged)));
     }
+}
+
+void AXDAnnotationStore::saveIfChanged() {
+    if (!changed_) return;
     if (Status saved = saveDb(); !saved.ok()) {
         log::error(logOps(), "unable to save annotations:%{public}@ error:%{public}@", annotationsURL_,
                    saved.error());
+        return;
     }
+    changed_ = false;
 }
 
 Status AXDAnnotationStore::loadDb(const std::string& path) {

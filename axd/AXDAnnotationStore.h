@@ -39,6 +39,12 @@ public:
     // of the same key whole), or removes the key's annotation when `annotation` is null; then saves.
     // A failed save is logged; the change stays in memory.
     void setAnnotationForIdentifier(const Value& annotation, const std::string& key);
+    // The same change, in memory only: a request makes all its changes so and saves once, with
+    // saveIfChanged().
+    void changeAnnotationForIdentifier(const Value& annotation, const std::string& key);
+    // Saves when anything changed since the last save (a failed save is logged and tried again
+    // next time).
+    void saveIfChanged();
 
     // Plug-in forms of the two operations: the key is the plug-in's annotationKey().
     template <class PlugIn>
@@ -48,6 +54,10 @@ public:
     template <class PlugIn>
     void setAnnotationForPlugIn(const Value& annotation, const PlugIn& plugIn) {
         setAnnotationForIdentifier(annotation, plugIn.annotationKey());
+    }
+    template <class PlugIn>
+    void changeAnnotationForPlugIn(const Value& annotation, const PlugIn& plugIn) {
+        changeAnnotationForIdentifier(annotation, plugIn.annotationKey());
     }
 
     // Reads the file at `path` and installs its table; the table is unchanged on failure.
@@ -63,6 +73,7 @@ public:
 private:
     std::string annotationsURL_;
     Dictionary annotations_;
+    bool changed_ = false;  // since the last save
 };
 
 }  // namespace annexa

@@ -122,7 +122,15 @@ void AXDatabase::setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn
     databaseQueue_->assertNotCurrent();
     databaseQueue_->sync([&] {
         databaseQueue_->assertCurrent();
-        annotations_->setAnnotationForPlugIn(annotation, plugIn);
+        annotations_->changeAnnotationForPlugIn(annotation, plugIn);
+    });
+}
+
+void AXDatabase::saveAnnotations() {
+    databaseQueue_->assertNotCurrent();
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
+        annotations_->saveIfChanged();
     });
 }
 

@@ -54,7 +54,10 @@ public:
     Status removePlugIn(const std::string& path);
 
     Value annotationForPlugIn(const AXDPlugIn& plugIn);
+    // Changes the annotation in memory; saveAnnotations() writes the changes of a request at once.
     void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
+    // Writes the annotation file when anything changed since the last write.
+    void saveAnnotations();
     void notifyAnnotationChange();
     void autoElect(const AXDPlugIn& plugIn) REQUIRES(*databaseQueue_);
     // The registry's events, on its event thread.

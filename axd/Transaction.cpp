@@ -8,6 +8,7 @@
 #include "axd/AXDRpxClient.h"
 #include "axd/AXDServer.h"
 #include "platform/layout/Layout.h"
+#include "platform/plist/Plist.h"
 #include "platform/trace/Trace.h"
 
 namespace annexa {
@@ -33,6 +34,14 @@ const std::pair<const char*, Handler> kRequests[] = {
 Transaction::Transaction(corvane::rpx::Event request, std::shared_ptr<AXDRpxClient> client)
     : client_(std::move(client)), request_(std::move(request)) {}
 
+Transaction::~Transaction() {
+    if (answered_ || !request_.wantsReply) return;
+    const std::string* name = request()[message::kRequest].asString();
+    log::error(logOps(), "request %{public}s of client %d ended without a reply; answering with an internal error",
+               name ? name->c_str() : "(none)", client_->pid());
+    failMessage(AXErrorCode::InvalidRequest, "internal error: the request ended without a reply");
+}
+
 AXDServer& Transaction::server() const { return *client_->server(); }
 corvane::rpx::ConnectionPtr Transaction::connection() const { return client_->connection(); }
 
@@ -41,8 +50,11 @@ void Transaction::dispatch() {
     const Value& version = request()[message::kVersion];
     version_ = version.kind() == Value::Kind::UInt64 ? *version.uint64Value() : 0;
     if (version_ < kOldestProtocolVersion || version_ > kCurrentProtocolVersion) {
-        failMessage(AXErrorCode::VersionMismatch, log::formatText("unsupported protocol version %d (current %d)", static_cast<int32_t>(version_),
-                                       static_cast<int>(kCurrentProtocolVersion)));
+        // The number as it was sent, not cut to 32 bits or read as signed.
+        failMessage(AXErrorCode::VersionMismatch,
+                    log::formatText("unsupported protocol version %llu (current %llu)",
+                                    static_cast<unsigned long long>(version_),
+                                    static_cast<unsigned long long>(kCurrentProtocolVersion)));
         return;
     }
     // The client's connection is already gone: nobody would read a reply.
@@ -66,6 +78,7 @@ void Transaction::dispatch() {
 void Transaction::done() {
     if (answered_) return;
     answered_ = true;
+    server().saveAnnotations();
     Value reply(reply_);
     if (AXD_TRACE_ENABLED(request__output)) {
         std::string text = reply.description();
@@ -187,18 +200,23 @@ void Transaction::bulkPlugIns() {
 
 // ---- annotations
 
-Value Transaction::annotationsArgument() {
+std::optional<Value> Transaction::annotationsArgument() {
     const Value* annotations = rpx_dictionary_get_dictionary(request(), message::kAnnotations);
-    if (!annotations) {
+    // A null or a descriptor inside cannot be carried, and a value the annotation file cannot hold
+    // (a UUID, a control character, a date past year 9999) would make every later save fail: both
+    // are refused before anything changes.
+    Value converted = annotations ? convertMessageToValue(*annotations) : Value();
+    if (converted.isNull() || !corvane::plist::toXML(converted)) {
         failMessage(AXErrorCode::InvalidRequest, "invalid request format (bad annotations dictionary)");
-        return Value();
+        return std::nullopt;
     }
-    return convertMessageToValue(*annotations);
+    return converted;
 }
 
 void Transaction::annotatePlugIns() {
-    Value d = annotationsArgument();
-    if (d.isNull()) return;
+    auto argument = annotationsArgument();
+    if (!argument) return;
+    const Value& d = *argument;
     Dictionary changes;
     if (const Value* election = d.find(keys::kElection)) {
         if (!election->isNumber()) {
@@ -235,8 +253,9 @@ void Transaction::annotatePlugIns() {
 }
 
 void Transaction::bulkAnnotatePlugIns() {
-    Value d = annotationsArgument();
-    if (d.isNull()) return;
+    auto argument = annotationsArgument();
+    if (!argument) return;
+    const Value& d = *argument;
     const Dictionary* entries = d.asDictionary();
     size_t count = entries ? entries->size() : 0;
     log::debug(logOps(), "bulk change requested for %u plug-ins", static_cast<unsigned>(count));

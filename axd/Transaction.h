@@ -21,9 +21,16 @@ public:
     enum class Walk { Continue, Stop };
 
     Transaction(corvane::rpx::Event request, std::shared_ptr<AXDRpxClient> client);
+    // A request must be answered once. One that a handler left unanswered is answered here, with
+    // an internal error, and logged: a client never waits for ever, whatever a handler does.
+    ~Transaction();
+    Transaction(const Transaction&) = delete;
+    Transaction& operator=(const Transaction&) = delete;
 
     void dispatch();
-    // Sends the reply (dropped when the connection is gone or no reply is expected).
+    // Saves the annotations the request changed, then sends the reply (dropped when the connection
+    // is gone or no reply is expected): what a reply acknowledges is on disk, at one write per
+    // request.
     void done();
     void failMessage(AXErrorCode code, const std::string& message);
     // An error of the domain "Annexa" answers with its own code and text; any other with
@@ -52,8 +59,9 @@ public:
     corvane::rpx::ConnectionPtr connection() const;
 
 private:
-    // The request's "annotations" dictionary as a Value; null after answering that it is missing.
-    Value annotationsArgument();
+    // The request's "annotations" dictionary as a Value; nullopt after answering that it is
+    // missing or holds what the annotation file cannot keep.
+    std::optional<Value> annotationsArgument();
 
     std::shared_ptr<AXDRpxClient> client_;
     corvane::rpx::Event request_;

@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -186,11 +187,34 @@ TEST(AXDAnnotationStore, AKilledSaverLeavesTheOldOrTheNewTable) {
         Value first = ext["k0"]["election"];
         for (const auto& [k, v] : *ext.asDictionary()) ASSERT_EQ(v["election"], first) << k;
     }
-    // A store opened after all that loads the last complete table.
+    // A store opened after all that loads the last complete table, and nothing but the file is
+    // left beside it: the kills left no temporary file, or the store's start removed it.
+    axtest::writeFile(dir / ".Annotations.999.new", "left by a writer killed between link and rename");
     AXDAnnotationStore store(path.c_str());
     Value kept = store.annotationForIdentifier("p")["extension"];
     ASSERT_TRUE(kept.isDictionary());
     EXPECT_EQ(kept.asDictionary()->size(), 200u);
+    std::vector<std::string> names;
+    for (const auto& e : std::filesystem::directory_iterator(dir.path())) names.push_back(e.path().filename());
+    EXPECT_EQ(names, std::vector<std::string>{"Annotations"});
+}
+
+// Changes made in memory reach the file at the next save, once, however many there were.
+TEST(AXDAnnotationStore, ChangesAreSavedOnceWhenAsked) {
+    axtest::TempDir dir;
+    std::string path = dir / "Annotations";
+    AXDAnnotationStore store(path.c_str());
+    for (int i = 0; i < 50; ++i) store.changeAnnotationForIdentifier(corvane::dict({{"election", i}}), "k" + std::to_string(i));
+    EXPECT_FALSE(axtest::exists(path));
+    store.saveIfChanged();
+    ASSERT_TRUE(axtest::exists(path));
+    struct stat before {};
+    ::stat(path.c_str(), &before);
+    store.saveIfChanged();  // nothing changed: no write
+    struct stat after {};
+    ::stat(path.c_str(), &after);
+    EXPECT_EQ(before.st_ino, after.st_ino);
+    EXPECT_EQ((*corvane::plist::readFile(path))["data"].asDictionary()->size(), 50u);
 }
 
 TEST(AXDAnnotationStoreDeathTest, NoContainerOrDirectoryEndsTheDaemon) {

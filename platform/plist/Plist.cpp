@@ -2,6 +2,7 @@
 
 #include "platform/plist/PlistRead.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -10,6 +11,7 @@
 #include <cinttypes>
 #include <cmath>
 #include <cstdio>
+#include <vector>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
@@ -210,15 +212,31 @@ Result<std::string> toXML(const Value& value) {
     return out;
 }
 
+namespace {
+
+std::string baseOf(const std::string& path) {
+    return path.substr(path.rfind('/') == std::string::npos ? 0 : path.rfind('/') + 1);
+}
+
+}  // namespace
+
 Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
     std::string dir = directoryOf(path);
-    std::string base = path.substr(path.rfind('/') == std::string::npos ? 0 : path.rfind('/') + 1);
-    std::string tmp = dir + "/." + base + ".XXXXXX";
-    int fd = mkostemp(tmp.data(), O_CLOEXEC);
-    if (fd < 0) return Error::file(errno, path, true);
+    std::string base = baseOf(path);
+    // The new contents are written to an unnamed file, which gets a name only for the instant
+    // between linking it in and renaming it over the old file: a process killed while writing
+    // leaves nothing behind. File systems without unnamed files get a named temporary instead.
+    std::string tmp;
+    int fd = ::open(dir.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, 0600);
+    bool unnamed = fd >= 0;
+    if (!unnamed) {
+        tmp = dir + "/." + base + ".XXXXXX";
+        fd = mkostemp(tmp.data(), O_CLOEXEC);
+        if (fd < 0) return Error::file(errno, path, true);
+    }
     auto failWith = [&](int err) {
         ::close(fd);
-        ::unlink(tmp.c_str());
+        if (!tmp.empty()) ::unlink(tmp.c_str());
         return Error::file(err, path, true);
     };
     mode_t mask = umask(0);
@@ -234,6 +252,15 @@ Status writeFileAtomically(const std::string& path, std::string_view bytes, mode
         done += static_cast<size_t>(n);
     }
     if (fsync(fd) != 0) return failWith(errno);
+    if (unnamed) {
+        tmp = dir + "/." + base + "." + std::to_string(::getpid()) + ".new";
+        ::unlink(tmp.c_str());
+        std::string self = "/proc/self/fd/" + std::to_string(fd);
+        if (::linkat(AT_FDCWD, self.c_str(), AT_FDCWD, tmp.c_str(), AT_SYMLINK_FOLLOW) != 0) {
+            tmp.clear();
+            return failWith(errno);
+        }
+    }
     if (::close(fd) != 0) {
         int err = errno;
         ::unlink(tmp.c_str());
@@ -250,6 +277,20 @@ Status writeFileAtomically(const std::string& path, std::string_view bytes, mode
         ::close(dfd);
     }
     return {};
+}
+
+void removeStaleTemporaries(const std::string& path) {
+    std::string dir = directoryOf(path);
+    std::string prefix = "." + baseOf(path) + ".";
+    DIR* d = opendir(dir.c_str());
+    if (!d) return;
+    std::vector<std::string> stale;
+    while (struct dirent* e = readdir(d)) {
+        std::string name = e->d_name;
+        if (name.size() > prefix.size() && name.compare(0, prefix.size(), prefix) == 0) stale.push_back(name);
+    }
+    closedir(d);
+    for (const auto& name : stale) ::unlink((dir + "/" + name).c_str());
 }
 
 Status writeXMLFile(const std::string& path, const Value& value, mode_t mode) {

@@ -42,10 +42,16 @@ Result<std::string> toXML(const Value& value);
 Result<std::string> readWholeFile(const std::string& path);
 
 // Replaces the file at `path` with `bytes` so that a reader sees the old contents or the new, never
-// a mix, also across a crash: a temporary file beside the target is written in full, fsynced,
-// renamed over the target, and the directory is fsynced. A failure leaves the old file as it was
-// and no temporary file behind. The new file gets `mode` (masked by the umask).
+// a mix, also across a crash: an unnamed file in the target's directory is written in full,
+// fsynced, linked in as ".<name>.<pid>.new" and at once renamed over the target, and the directory
+// is fsynced. A failure leaves the old file as it was and no temporary file behind; a process killed
+// meanwhile leaves at most the linked name, for the instant between link and rename. The new file
+// gets `mode` (masked by the umask).
 Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666);
+
+// Removes what writes to `path` killed half-way may have left beside it (".<name>.*"); for the one
+// writer of a file, at its start.
+void removeStaleTemporaries(const std::string& path);
 
 // toXML, then writeFileAtomically.
 Status writeXMLFile(const std::string& path, const Value& value, mode_t mode = 0666);

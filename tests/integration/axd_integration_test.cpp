@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/inotify.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -141,6 +142,93 @@ TEST(Axd, MalformedRequestsGetTheirErrorReplies) {
     // Only the requests that changed nothing but succeeded without plug-ins post nothing.
     EXPECT_EQ(notify::count(kChange), 0u);
     EXPECT_TRUE(d.axd->waitForErr("bulk options 0xff not supported"));
+}
+
+// Every request is answered, and nothing is acknowledged that the annotation file cannot hold: such
+// values are refused before anything changes, so a later save cannot fail because of them.
+TEST(Axd, AnnotationsTheFileCannotHoldAreRefusedAndAnswered) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    UUID one = (*registry)->plugInForPath(app + "/PlugIns/One.appex")->uuid();
+    auto descriptor = Value(std::make_shared<corvane::FileDescriptor>(::dup(0)));
+    const Value bad = error(4, "invalid request format (bad annotations dictionary)");
+    const std::pair<const char*, Value> values[] = {
+        {"a null", Value()},
+        {"a descriptor", descriptor},
+        {"a UUID", Value(UUID::random())},
+        {"a control character in a string", Value("bell \x01")},
+        {"a date past year 9999", Value(corvane::Date{int64_t{300000000000} * 1000000})},
+        {"a control character in a key", dict({{"k\x01", 1}})},
+    };
+    auto c = d.connect();
+    for (const auto& [name, value] : values) {
+        Value extension = dict({{"deep", Value(Array{value})}});
+        auto annotate = c->sendWithReplySync(request("annotate", {{"annotations", dict({{"extension", extension}})},
+                                                                  {"uuids", Value(Array{Value(one)})}}));
+        ASSERT_TRUE(annotate.ok()) << name;
+        EXPECT_EQ(annotate.value, bad) << name;
+        auto bulk = c->sendWithReplySync(request("bulk-annotate", {{"annotations", dict({{one.string(), extension}})}}));
+        ASSERT_TRUE(bulk.ok()) << name;
+        EXPECT_EQ(bulk.value, bad) << name;
+    }
+    // Hundreds of them leave the connection serving, and a good annotation is written.
+    for (int i = 0; i < 300; ++i) {
+        ASSERT_TRUE(c->sendWithReplySync(request("annotate", {{"annotations", dict({{"x", Value()}})}})).ok()) << i;
+    }
+    auto good = c->sendWithReplySync(request("annotate", {{"annotations", dict({{"election", 2}})},
+                                                          {"uuids", Value(Array{Value(one)})}}));
+    ASSERT_TRUE(good.ok());
+    EXPECT_EQ(good.value, dict({}));
+    std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";
+    EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"], dict({{"election", 2}}));
+    EXPECT_FALSE(d.axd->waitForErr("unable to save annotations", 100ms));
+
+    // A version is reported as it was sent, whatever its size.
+    EXPECT_EQ(d.send(dict({{"request", "bulk"}, {"version", (uint64_t{1} << 32) + 3}})),
+              error(7, "unsupported protocol version 4294967299 (current 3)"));
+    EXPECT_EQ(d.send(dict({{"request", "bulk"}, {"version", ~uint64_t{0}}})),
+              error(7, "unsupported protocol version 18446744073709551615 (current 3)"));
+}
+
+// One request writes the annotation file once, after its last change and before its reply, also
+// when it ends in an error after earlier plug-ins changed.
+TEST(Axd, ARequestWritesTheAnnotationFileOnce) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    UUID one = (*registry)->plugInForPath(app + "/PlugIns/One.appex")->uuid();
+    UUID two = (*registry)->plugInForPath(app + "/PlugIns/Two.appex")->uuid();
+    std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";
+    std::string dir = file.substr(0, file.rfind('/'));
+    ASSERT_EQ(d.send(request("annotate", {{"annotations", dict({{"election", 1}})}, {"uuids", Value(Array{Value(one)})}})),
+              dict({}));
+    // Each write renames a new file into place; count the renames.
+    int in = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
+    ASSERT_GE(inotify_add_watch(in, dir.c_str(), IN_MOVED_TO), 0);
+    auto renames = [&] {
+        int count = 0;
+        alignas(struct inotify_event) char buf[4096];
+        ssize_t n;
+        while ((n = ::read(in, buf, sizeof buf)) > 0)
+            for (char* p = buf; p < buf + n; p += sizeof(struct inotify_event) + reinterpret_cast<struct inotify_event*>(p)->len)
+                ++count;
+        return count;
+    };
+    Array many;
+    for (int i = 0; i < 200; ++i) many.push_back(Value(i % 2 ? one : two));
+    EXPECT_EQ(d.send(request("annotate", {{"annotations", dict({{"election", 3}})}, {"uuids", Value(many)}})), dict({}));
+    EXPECT_EQ(renames(), 1);
+    // Two known plug-ins change, then an unknown UUID ends the request: the changes are on disk
+    // when the error comes.
+    EXPECT_EQ(d.send(request("annotate", {{"annotations", dict({{"election", 4}})},
+                                         {"uuids", Value(Array{Value(one), Value(two), Value(UUID::random())})}})),
+              error(4, "no such plugin (uuid not found)"));
+    EXPECT_EQ(renames(), 1);
+    EXPECT_EQ((*plist::readFile(file))["data"]["com.example.Two"], dict({{"election", 4}}));
+    ::close(in);
 }
 
 TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
