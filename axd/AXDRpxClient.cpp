@@ -32,7 +32,7 @@ void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
     if (event.error == corvane::rpx::ErrorKind::TerminationImminent) return dying();
     if (event.error == corvane::rpx::ErrorKind::ConnectionInvalid) return dead();
     if (!event.message.isDictionary()) {
-        log::error(logOps(), "unexpected message: %{public}@ from: %d", event.message, pid());
+        logUnexpected(event);
         // A sender that waits for an answer gets one rather than waiting for ever.
         if (auto conn = connection(); conn && event.wantsReply)
             conn->sendReply(event.messageId, Value(Dictionary{{message::kErrorCode, Value(static_cast<uint64_t>(errorCodeValue(
@@ -61,6 +61,24 @@ Value AXDRpxClient::entitlementValueForKey(const std::string& key) const {
         return Value();
     }
     return task_->valueForEntitlement(key);
+}
+
+void AXDRpxClient::logUnexpected(const corvane::rpx::Event& event) {
+    constexpr uint32_t kPerSecond = 5;
+    constexpr size_t kShownBytes = 256;
+    int64_t second = Date::now().wholeSeconds();
+    if (second != unexpectedSecond_) {
+        if (unexpectedInSecond_ > kPerSecond) {
+            log::error(logOps(), "%u more unexpected messages from: %d not logged",
+                       unexpectedInSecond_ - kPerSecond, pid());
+        }
+        unexpectedSecond_ = second;
+        unexpectedInSecond_ = 0;
+    }
+    if (++unexpectedInSecond_ > kPerSecond) return;
+    std::string text = event.message.description();
+    if (text.size() > kShownBytes) text = text.substr(0, kShownBytes) + "...";
+    log::error(logOps(), "unexpected message: %{public}@ from: %d", text, pid());
 }
 
 bool AXDRpxClient::hasEntitlement(const std::string& key) const {

@@ -45,6 +45,9 @@ public:
 private:
     AXDRpxClient(const corvane::rpx::ConnectionPtr& connection, AXDServer* server);
     void handleEvent(const corvane::rpx::Event& event);
+    // Logs a message that is no request: a few a second per client, each cut short, so that a
+    // client sending garbage cannot fill the log (or keep the I/O thread busy writing it).
+    void logUnexpected(const corvane::rpx::Event& event);
 
     std::atomic<bool> acceptWork_{true};
     std::weak_ptr<corvane::rpx::Connection> connection_;
@@ -54,6 +57,9 @@ private:
     std::shared_ptr<AXBundle> bundle_;
     std::shared_ptr<corvane::codesign::Handle> task_;
     uint32_t requestCount_ = 0;  // on the service queue
+    // On the connection's delivery, one event at a time.
+    int64_t unexpectedSecond_ = 0;
+    uint32_t unexpectedInSecond_ = 0;
 };
 
 }  // namespace annexa

@@ -10,6 +10,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
+#include <filesystem>
 #include <thread>
 
 #include "platform/log/Log.h"
@@ -22,6 +23,30 @@ using namespace std::chrono_literals;
 namespace wire = rpx::wire;
 
 namespace {
+
+// The limits are read once per process: this program runs with small ones, so that tests reach them
+// quickly.
+const bool kSmallLimits = [] {
+    setenv("CORVANE_RPX_LIMITS", "queued-reply-mib=16,partial-frame-seconds=1,connections-per-process=8", 1);
+    return true;
+}();
+
+size_t openDescriptors() {
+    size_t n = 0;
+    for ([[maybe_unused]] const auto& e : std::filesystem::directory_iterator("/proc/self/fd")) ++n;
+    return n;
+}
+
+// True when the peer closed the connection: reads (and drops) what came before the end.
+bool closedByPeer(int fd, std::chrono::milliseconds within = 5s) {
+    return axtest::eventually(
+        [&] {
+            char buf[65536];
+            ssize_t n = ::recv(fd, buf, sizeof buf, MSG_DONTWAIT);
+            return n == 0 || (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK);
+        },
+        within);
+}
 
 std::string frameBytes(wire::FrameKind kind, uint64_t id, const Value& body) {
     std::vector<int> fds;
@@ -537,4 +562,137 @@ TEST(Rpx, SynchronousWaitsGetTheirOwnRepliesWhoeverReads) {
     EXPECT_LT(std::chrono::steady_clock::now() - start, 2s);
     canceller.join();
     close(silent);
+}
+
+// Each way of abusing a connection ends that connection, frees what it held, and leaves the
+// listener serving the others.
+TEST(Rpx, AbusivePeersAreCutOffAndWhatTheyHeldIsFreed) {
+    ASSERT_TRUE(kSmallLimits);
+    axtest::PlatformRoot root;
+    log::CaptureSink capture;
+    EchoServer server("com.test.abuse");
+    auto q = dispatch::Queue::create("test");
+    auto good = rpx::Connection::connect("com.test.abuse", q);
+    good->setEventHandler([](const rpx::Event&) {});
+    good->resume();
+    auto stillServed = [&](const char* after) {
+        auto r = good->sendWithReplySync(dict({{"after", after}}));
+        EXPECT_TRUE(r.ok()) << after;
+    };
+
+    // Descriptors sent with a frame that names none are closed at once, with the connection.
+    stillServed("the start");  // whatever a first exchange opens is open before the count
+    size_t before = openDescriptors();
+    int fd = rawConnect("com.test.abuse");
+    std::string message = frameBytes(wire::FrameKind::Message, 1, dict({{"x", 1}}));
+    int passed[3] = {::open("/dev/null", O_RDONLY), ::open("/dev/null", O_RDONLY), ::open("/dev/null", O_RDONLY)};
+    alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof passed)];
+    struct iovec iov {message.data(), message.size()};
+    struct msghdr msg {};
+    msg.msg_iov = &iov;
+    msg.msg_iovlen = 1;
+    msg.msg_control = control;
+    msg.msg_controllen = sizeof control;
+    struct cmsghdr* c = CMSG_FIRSTHDR(&msg);
+    c->cmsg_level = SOL_SOCKET;
+    c->cmsg_type = SCM_RIGHTS;
+    c->cmsg_len = CMSG_LEN(sizeof passed);
+    std::memcpy(CMSG_DATA(c), passed, sizeof passed);
+    ASSERT_GT(sendmsg(fd, &msg, 0), 0);
+    for (int f : passed) ::close(f);
+    EXPECT_TRUE(closedByPeer(fd));
+    ::close(fd);
+    EXPECT_TRUE(axtest::eventually([&] { return openDescriptors() <= before; })) << openDescriptors() << " > " << before;
+    EXPECT_TRUE(capture.contains("descriptors that no frame names"));
+    stillServed("unclaimed descriptors");
+
+    // A second request under the id of one still waiting for its reply.
+    auto holding = rpx::Listener::create("com.test.holding", dispatch::Queue::create("test.holding"));
+    ASSERT_TRUE(holding);
+    (*holding)->setConnectionHandler([](rpx::ConnectionPtr conn) {
+        conn->setEventHandler([conn](const rpx::Event&) {});  // never replies
+        conn->resume();
+    });
+    (*holding)->resume();
+    fd = rawConnect("com.test.holding");
+    std::string twice = frameBytes(wire::FrameKind::Request, 7, dict({})) + frameBytes(wire::FrameKind::Request, 7, dict({}));
+    ASSERT_EQ(write(fd, twice.data(), twice.size()), static_cast<ssize_t>(twice.size()));
+    EXPECT_TRUE(closedByPeer(fd));
+    ::close(fd);
+    EXPECT_TRUE(capture.contains("request id 7 is already waiting for its reply"));
+
+    // Half a frame and then silence: ended after the limit (1 s here).
+    fd = rawConnect("com.test.abuse");
+    std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
+    ASSERT_EQ(write(fd, request.data(), 10), 10);
+    EXPECT_TRUE(closedByPeer(fd, 5s));
+    ::close(fd);
+    EXPECT_TRUE(capture.contains("was not finished"));
+    stillServed("a partial frame");
+
+    // More connections from one process than the limit (8 here): the extra ones are closed.
+    std::vector<int> many;
+    for (int i = 0; i < 12; ++i) many.push_back(rawConnect("com.test.abuse"));
+    size_t closed = 0;
+    for (int f : many) closed += closedByPeer(f, 300ms) ? 1 : 0;
+    for (int f : many) ::close(f);
+    EXPECT_GE(closed, 4u);  // the good client holds one of the eight
+    EXPECT_TRUE(capture.contains("reached its limit of connections"));
+    EXPECT_TRUE(axtest::eventually([&] {
+        auto r = good->sendWithReplySync(dict({{"after", "too many connections"}}));
+        return r.ok();
+    }));
+}
+
+// Messages that expect no reply count as work until their handler's copies of them are gone: a
+// flood of them stops being read while the work waits.
+TEST(Rpx, MessagesWithoutRepliesAreBackPressuredToo) {
+    axtest::PlatformRoot root;
+    auto listener = rpx::Listener::create("com.test.noreply", dispatch::Queue::create("test.listener"));
+    ASSERT_TRUE(listener);
+    struct Pending {
+        std::mutex m;
+        std::vector<rpx::Event> events;
+    };
+    auto pending = std::make_shared<Pending>();
+    (*listener)->setConnectionHandler([pending](rpx::ConnectionPtr conn) {
+        conn->setEventHandler([pending](const rpx::Event& ev) {
+            if (ev.isError()) return;
+            std::lock_guard lock(pending->m);
+            pending->events.push_back(ev);  // the work waits here, holding the event
+        });
+        conn->resume();
+    });
+    (*listener)->resume();
+    int fd = rawConnect("com.test.noreply");
+    std::string message = frameBytes(wire::FrameKind::Message, 1, dict({{"x", 1}}));
+    std::string burst;
+    for (int i = 0; i < 5000; ++i) burst += message;
+    fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
+    size_t written = 0;
+    for (int i = 0; i < 100 && written < burst.size(); ++i) {
+        ssize_t n = write(fd, burst.data() + written, burst.size() - written);
+        if (n > 0) written += static_cast<size_t>(n);
+        std::this_thread::sleep_for(2ms);
+    }
+    std::this_thread::sleep_for(200ms);
+    size_t taken;
+    {
+        std::lock_guard lock(pending->m);
+        taken = pending->events.size();
+    }
+    EXPECT_LE(taken, 300u) << "of 5000";
+    // Finishing the work lets the rest in.
+    {
+        std::lock_guard lock(pending->m);
+        pending->events.clear();
+    }
+    size_t sent = written / message.size();
+    EXPECT_TRUE(axtest::eventually([&] {
+        std::lock_guard lock(pending->m);
+        taken += pending->events.size();
+        pending->events.clear();
+        return taken >= sent;
+    })) << taken << " of " << sent;
+    ::close(fd);
 }

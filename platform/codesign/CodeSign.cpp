@@ -334,7 +334,7 @@ std::shared_ptr<Handle> Handle::fromAuditToken(const rpx::AuditToken& token) {
     if (token.pidfd && syscall(SYS_pidfd_send_signal, token.pidfd->get(), 0, nullptr, 0) != 0)
         return refuse("the process is gone");
     int fd = ::open((proc + "/exe").c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return refuse("the process is gone");
+    if (fd < 0) return refuse(errno == EMFILE || errno == ENFILE ? "out of file descriptors" : "the process is gone");
     struct stat st {};
     fstat(fd, &st);
     rpx::PeerIdentity now = rpx::identityOfProcess(token.pid, token.uid, token.gid, nullptr);

@@ -87,6 +87,7 @@ void Connection::resume() {
         MutexLock lock(impl_->mutex);
         if (impl_->resumed) return;
         impl_->resumed = true;
+        impl_->updateInterest();  // reading begins now
         auto held = std::move(impl_->held);
         impl_->held.clear();
         for (auto& ev : held) impl_->postEvent(std::move(ev));

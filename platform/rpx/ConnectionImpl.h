@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <cstring>
 #include <deque>
+#include <chrono>
 #include <map>
 #include <set>
 
@@ -80,14 +81,20 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     // Events delivered but not handled, plus requests not yet answered.
     size_t unfinished GUARDED_BY(mutex) = 0;
     std::set<uint64_t> unanswered GUARDED_BY(mutex);
+    // When the peer last completed a frame, or began one after a complete stream: a frame begun
+    // and left unfinished longer than the limit ends the connection.
+    std::chrono::steady_clock::time_point partialSince GUARDED_BY(mutex);
+    bool partial GUARDED_BY(mutex) = false;
     pid_t peerPid = 0;  // set before start, then fixed
     // An accepted connection keeps itself alive until its invalid event has been delivered.
     std::shared_ptr<Connection> self GUARDED_BY(mutex);
 
     // While paused, neither input nor a half-close is asked for: epoll is level-triggered and
     // would report them again and again. A peer that is gone entirely still shows as EPOLLHUP.
+    // Nothing is read before the connection is resumed: the kernel's socket buffer, not ours, holds
+    // what a connection not yet set up has sent.
     uint32_t interest() const REQUIRES(mutex) {
-        return (readPaused || syncReader ? 0u : static_cast<uint32_t>(EPOLLIN | EPOLLRDHUP)) |
+        return (readPaused || syncReader || !resumed ? 0u : static_cast<uint32_t>(EPOLLIN | EPOLLRDHUP)) |
                (wantWrite ? static_cast<uint32_t>(EPOLLOUT) : 0u);
     }
 
@@ -124,6 +131,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
                 return;
             }
             handleFrame(std::move(frame));
+            partial = false;
             checkPressure();
         }
     }
@@ -155,6 +163,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
                 ready.pop_front();
                 mutex.unlock();
                 runHandler(ev);
+                ev = Event();  // its work token takes the mutex when it goes: before relocking
                 mutex.lock();
             }
             running = false;
@@ -170,13 +179,14 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         if (h) h(ev);
         std::shared_ptr<Connection> last;
+        std::deque<Event> unheard;  // work tokens take the mutex when they go: outside it
         {
             MutexLock lock(mutex);
             if (unfinished) --unfinished;
             if (ev.error == ErrorKind::ConnectionInvalid) {
                 // The last event: let go of the handler (and whatever it holds) and of ourselves.
                 handler = nullptr;
-                held.clear();
+                unheard.swap(held);
                 last = std::move(self);
             } else if (!invalid) {
                 checkPressure();
@@ -214,6 +224,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             }
             o.offset += static_cast<size_t>(n);
             outBytes -= static_cast<size_t>(n);
+            gQueuedReplyBytes -= static_cast<size_t>(n);
             if (o.offset == o.bytes.size()) {
                 out.pop_front();
             } else {
@@ -248,8 +259,16 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         if (invalid) return false;
         outBytes += o.bytes.size();
+        size_t queued = gQueuedReplyBytes += o.bytes.size();
         out.push_back(std::move(o));
         flush();
+        // Past the bound for all peers together, a peer that holds more than its share goes.
+        if (!invalid && queued > (limits().queuedReplyMiB << 20) && outBytes >= kHighWaterBytes / 2) {
+            log::error(rpxLog(), "rpx: closing connection to pid %d: %llu bytes of replies it does not read",
+                       peerPid, static_cast<unsigned long long>(outBytes));
+            closeLocked();
+            return false;
+        }
         return true;
     }
 
@@ -264,7 +283,10 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             fd = -1;
         }
         out.clear();
+        gQueuedReplyBytes -= outBytes;
         outBytes = 0;
+        reader.clear();  // buffered bytes and descriptors go now, not with the last reference
+        ++gClosedSinceTrim;
         for (auto& [id, p] : pending) p.complete(Reply{ErrorKind::ConnectionInvalid, Value()});
         pending.clear();
         {
@@ -274,6 +296,18 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         Event ev;
         ev.error = ErrorKind::ConnectionInvalid;
         postEvent(std::move(ev));
+    }
+
+    // Ends the connection when the peer began a frame and sent nothing more for too long.
+    void endIfStuck(std::chrono::steady_clock::time_point now) EXCLUDES(mutex) {
+        {
+            MutexLock lock(mutex);
+            if (invalid || !partial || now - partialSince < std::chrono::seconds(limits().partialFrameSeconds)) return;
+            log::error(rpxLog(), "rpx: closing connection to pid %d: a frame begun %u s ago was not finished", peerPid,
+                       limits().partialFrameSeconds);
+            closeLocked();
+        }
+        runReady();
     }
 
     enum class ReadStatus { More, Drained, Closed };
@@ -312,6 +346,17 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         reader.append(buf, static_cast<size_t>(n));
         drainFrames();
+        if (invalid) return ReadStatus::Closed;
+        // Descriptors travel with the first bytes of the frame that names them: any that the frame
+        // being read cannot claim were sent with none, and would stay open for nothing.
+        if (reader.holdsUnclaimedDescriptors()) {
+            log::error(rpxLog(), "rpx: closing connection to pid %d: descriptors that no frame names", peerPid);
+            closeLocked();
+            return ReadStatus::Closed;
+        }
+        bool nowPartial = reader.buffered() > 0;
+        if (nowPartial && !partial) partialSince = std::chrono::steady_clock::now();
+        partial = nowPartial;
         return ReadStatus::More;
     }
 
@@ -369,6 +414,22 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         updateInterest();
     }
 
+    // Counts one unit of the connection's work until the last copy of the token goes.
+    std::shared_ptr<void> workToken() REQUIRES(mutex) {
+        ++unfinished;
+        std::weak_ptr<Impl> weak = shared_from_this();
+        return std::shared_ptr<void>(nullptr, [weak](void*) {
+            auto impl = weak.lock();
+            if (!impl) return;
+            {
+                MutexLock lock(impl->mutex);
+                if (impl->unfinished) --impl->unfinished;
+                if (!impl->invalid) impl->checkPressure();
+            }
+            impl->runReady();
+        });
+    }
+
     void handleFrame(wire::Frame frame) REQUIRES(mutex) {
         if (frame.kind == wire::FrameKind::Reply) {
             auto it = pending.find(frame.id);
@@ -382,8 +443,17 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         ev.messageId = frame.id;
         ev.wantsReply = frame.kind == wire::FrameKind::Request;
         if (ev.wantsReply) {
-            unanswered.insert(frame.id);
+            // Replies are bound to requests by id: a second request under the id of one not yet
+            // answered could never get its own.
+            if (!unanswered.insert(frame.id).second) {
+                log::error(rpxLog(), "rpx: closing connection to pid %d: request id %llu is already waiting for its reply",
+                           peerPid, static_cast<unsigned long long>(frame.id));
+                closeLocked();
+                return;
+            }
             ++unfinished;
+        } else {
+            ev.work = workToken();
         }
         postEvent(std::move(ev));
     }
@@ -404,6 +474,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     }
 
     void start() EXCLUDES(mutex) {
+        startSweeper();
         MutexLock lock(mutex);
         if (fd < 0) return;
         {

@@ -3,6 +3,7 @@
 
 #include <sys/epoll.h>
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -88,6 +89,17 @@ private:
     std::thread thread_;
 };
 
+
+// Replies queued for all peers together, in bytes.
+extern std::atomic<size_t> gQueuedReplyBytes;
+// Connections closed since memory was last given back to the system.
+extern std::atomic<size_t> gClosedSinceTrim;
+
+// Starts, once per process, the timer that ends connections stuck in a partial frame and gives
+// memory back after bursts of connections.
+void startSweeper();
+// Runs `task` on the I/O thread at the sweeper's next round (within a second).
+void afterSweep(std::function<void()> task);
 
 // The identity of the process at the other end of a connected socket.
 PeerIdentity identityOfSocket(int sock);

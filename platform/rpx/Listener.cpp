@@ -2,6 +2,11 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#include <algorithm>
+#include <chrono>
+#include <map>
+#include <vector>
+
 #include "platform/layout/Layout.h"
 #include "platform/rpx/ConnectionImpl.h"
 
@@ -17,6 +22,62 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     size_t maxFrame GUARDED_BY(mutex) = kDefaultListenerMaxFrame;
     bool inlineDelivery GUARDED_BY(mutex) = false;
     bool resumed GUARDED_BY(mutex) = false;
+    // Held open so that, out of descriptors, a waiting connection can still be taken off the
+    // backlog and closed instead of being reported again and again.
+    int spare GUARDED_BY(mutex) = -1;
+    // The accepted connections of each process, to bound them.
+    std::map<pid_t, std::vector<std::weak_ptr<Connection::Impl>>> byProcess GUARDED_BY(mutex);
+    std::chrono::steady_clock::time_point lastRefusalLog GUARDED_BY(mutex);
+
+    ~Impl() NO_THREAD_SAFETY_ANALYSIS {
+        if (spare >= 0) ::close(spare);
+    }
+
+    // Out of descriptors: takes one connection off the backlog with the spare descriptor and closes
+    // it. False when even that fails (the backlog then waits for the next event).
+    bool shedOne() REQUIRES(mutex) {
+        if (spare < 0) return false;
+        ::close(spare);
+        int client = accept4(fd, nullptr, nullptr, SOCK_CLOEXEC);
+        if (client >= 0) ::close(client);
+        spare = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+        logRefusal("out of file descriptors; a new connection was closed");
+        return client >= 0;
+    }
+
+    // At most one line a second: a flood of refusals must not flood the log as well.
+    void logRefusal(const char* why) REQUIRES(mutex) {
+        auto now = std::chrono::steady_clock::now();
+        if (now - lastRefusalLog < std::chrono::seconds(1)) return;
+        lastRefusalLog = now;
+        log::error(rpxLog(), "rpx: %{public}s (%{public}s)", why, path);
+    }
+
+    // Whether the process may have one more connection; counts the new one when it may.
+    bool admit(pid_t pid, const std::shared_ptr<Connection::Impl>& impl) REQUIRES(mutex) {
+        auto& mine = byProcess[pid];
+        mine.erase(std::remove_if(mine.begin(), mine.end(),
+                                  [](const std::weak_ptr<Connection::Impl>& w) {
+                                      auto c = w.lock();
+                                      if (!c) return true;
+                                      MutexLock lock(c->mutex);
+                                      return c->invalid;
+                                  }),
+                   mine.end());
+        if (mine.size() >= limits().connectionsPerProcess) return false;
+        mine.push_back(impl);
+        return true;
+    }
+
+    void resumeAccepting() EXCLUDES(mutex) {
+        {
+            MutexLock lock(mutex);
+            if (fd < 0) return;
+            if (spare < 0) spare = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+            IoLoop::shared().modify(fd, EPOLLIN);
+        }
+        onAcceptable();
+    }
 
     void onAcceptable() {
         for (;;) {
@@ -25,6 +86,17 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
                 MutexLock lock(mutex);
                 if (fd < 0) return;
                 client = accept4(fd, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+                if (client < 0 && (errno == EMFILE || errno == ENFILE)) {
+                    if (shedOne()) continue;
+                    // Not even the spare helped (another thread took the descriptor it freed):
+                    // stop watching the socket for a moment instead of being told again at once.
+                    IoLoop::shared().modify(fd, 0);
+                    std::weak_ptr<Impl> weak = shared_from_this();
+                    afterSweep([weak] {
+                        if (auto impl = weak.lock()) impl->resumeAccepting();
+                    });
+                    return;
+                }
             }
             if (client < 0) {
                 if (errno == EINTR) continue;
@@ -41,6 +113,15 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
             auto impl = std::make_shared<Connection::Impl>(client, delivery, frameLimit);
             impl->peerPid = peer.pid;
             impl->inlineDelivery = inlined;
+            {
+                MutexLock lock(mutex);
+                if (!admit(peer.pid, impl)) {
+                    logRefusal("a process reached its limit of connections; a new one was closed");
+                    MutexLock closing(impl->mutex);
+                    impl->closeLocked();
+                    continue;
+                }
+            }
             auto connection = std::shared_ptr<Connection>(new Connection(impl, std::move(peer)));
             {
                 MutexLock lock(impl->mutex);
@@ -106,6 +187,7 @@ Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, disp
     {
         MutexLock lock(impl->mutex);
         impl->fd = fd;
+        impl->spare = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
     }
     impl->path = path;
     impl->queue = std::move(queue);

@@ -1,6 +1,8 @@
 #include "platform/rpx/Rpx.h"
 
 #include <atomic>
+#include <cstdlib>
+#include <string_view>
 
 #include "platform/layout/Layout.h"
 #include "platform/rpx/Internal.h"
@@ -8,8 +10,38 @@
 namespace corvane::rpx {
 
 namespace {
+
 std::atomic<uint64_t> gOutstandingWork{0};
+
+Limits readLimits() {
+    Limits l;
+    const char* spec = std::getenv("CORVANE_RPX_LIMITS");
+    std::string_view rest = spec ? spec : "";
+    while (!rest.empty()) {
+        size_t comma = rest.find(',');
+        std::string_view item = rest.substr(0, comma);
+        rest = comma == std::string_view::npos ? std::string_view() : rest.substr(comma + 1);
+        size_t eq = item.find('=');
+        if (eq == std::string_view::npos) continue;
+        std::string_view name = item.substr(0, eq);
+        unsigned long long n = std::strtoull(std::string(item.substr(eq + 1)).c_str(), nullptr, 10);
+        if (n == 0) continue;  // a limit of 0 would refuse everything; keep the default
+        if (name == "connections-per-process") l.connectionsPerProcess = n;
+        if (name == "queued-reply-mib") l.queuedReplyMiB = n;
+        if (name == "partial-frame-seconds") l.partialFrameSeconds = static_cast<unsigned>(n);
+    }
+    return l;
+}
+
 }  // namespace
+
+std::atomic<size_t> internal::gQueuedReplyBytes{0};
+std::atomic<size_t> internal::gClosedSinceTrim{0};
+
+const Limits& limits() {
+    static const Limits l = readLimits();
+    return l;
+}
 
 const log::Handle& internal::rpxLog() {
     static const log::Handle h("com.corvane.rpx", "rpx");

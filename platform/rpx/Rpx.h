@@ -16,10 +16,13 @@
 // the executable path, bundled with the process's start time and the executable's file identity
 // as an audit token that the code-signing layer can check later.
 //
-// Limits: frames larger than the receiver's maximum, values nested deeper than kMaxDepth, and
-// frames that do not decode end that connection (with a log line) and no other. A peer that stops
-// reading its replies is not read from until it catches up, so the memory kept for it stays
-// bounded.
+// Limits: frames larger than the receiver's maximum, values nested deeper than kMaxDepth, frames
+// that do not decode, descriptors that no frame claims, a second request with the id of one not yet
+// answered, and a frame begun but not finished within Limits::partialFrameSeconds end that
+// connection (with a log line) and no other. A peer that stops reading its replies, or whose
+// messages' work is still under way, is not read from until it catches up, so the memory kept for
+// it stays bounded; when the replies queued for all peers pass Limits::queuedReplyMiB, the peers
+// holding the most are dropped. A connection is read from only once it is resumed.
 //
 // Thread-safety: every class here is safe to use from any thread.
 #pragma once
@@ -76,12 +79,25 @@ enum class ErrorKind {
 // "Connection invalid" / "Termination imminent".
 const char* errorDescription(ErrorKind kind);
 
+// Limits that keep one peer from starving the others (docs/rpx-wire.md). Read once, from
+// CORVANE_RPX_LIMITS ("name=value,..." with the names below), else these defaults.
+struct Limits {
+    size_t connectionsPerProcess = 64;    // "connections-per-process": a listener refuses more
+    size_t queuedReplyMiB = 64;           // "queued-reply-mib": replies queued for all peers together
+    unsigned partialFrameSeconds = 10;    // "partial-frame-seconds": a frame begun and not finished
+};
+const Limits& limits();
+
 // An event of a connection: a received message, or an error.
 struct Event {
     std::optional<ErrorKind> error;
     Value message;             // the received value (any kind; requests are dictionaries)
     uint64_t messageId = 0;    // identifies the message for its reply
     bool wantsReply = false;   // the sender waits for a reply to this message
+    // A message that expects no reply counts as its connection's work for as long as this (or a
+    // copy) lives, so that a receiver that queues the work somewhere keeps the sender back-pressured
+    // until the work is done. A request counts until its reply.
+    std::shared_ptr<void> work;
 
     bool isError() const { return error.has_value(); }
     std::string description() const;

@@ -283,4 +283,17 @@ FrameReader::Status FrameReader::next(Frame& frame, std::string& error) {
     return Status::Frame;
 }
 
+bool FrameReader::holdsUnclaimedDescriptors() const {
+    if (fds_.empty()) return false;
+    std::string_view rest = std::string_view(buffer_).substr(offset_);
+    if (rest.size() < kHeaderSize) return rest.empty() || fds_.size() > kMaxFrameDescriptors;
+    return get(rest, 6, 2) < fds_.size();
+}
+
+void FrameReader::clear() {
+    std::string().swap(buffer_);
+    offset_ = 0;
+    fds_.clear();
+}
+
 }  // namespace corvane::rpx::wire

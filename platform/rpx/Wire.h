@@ -17,6 +17,8 @@ namespace corvane::rpx::wire {
 enum class FrameKind : uint8_t { Message = 1, Request = 2, Reply = 3 };
 
 inline constexpr size_t kHeaderSize = 16;
+// The most descriptors one frame may carry (the kernel's limit for one message).
+inline constexpr size_t kMaxFrameDescriptors = 253;
 
 struct Frame {
     FrameKind kind = FrameKind::Message;
@@ -49,6 +51,11 @@ public:
     Status next(Frame& frame, std::string& error);
 
     size_t buffered() const { return buffer_.size() - offset_; }
+    // True when descriptors arrived that the frame being read does not name (or, before its
+    // header is complete, more than any frame may carry).
+    bool holdsUnclaimedDescriptors() const;
+    // Drops what is buffered, bytes and descriptors, giving the memory back.
+    void clear();
 
 private:
     size_t maxFrame_;

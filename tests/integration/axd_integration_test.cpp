@@ -1,6 +1,6 @@
 #include <gtest/gtest.h>
-#include <sys/inotify.h>
 #include <signal.h>
+#include <sys/inotify.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -11,6 +11,7 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
+#include <sstream>
 #include <thread>
 
 #include "Annexa/AXDaemonClient.h"
@@ -341,6 +342,49 @@ TEST(Axd, AHostKeepsItsClientAcrossADaemonRestart) {
         EXPECT_TRUE(served.ok()) << i << ": " << served.description();
         EXPECT_EQ(served.value, dict({}));
     }
+}
+
+// Out of descriptors, the daemon sheds new connections instead of spinning on them, and serves
+// again once descriptors are free.
+TEST(Axd, OutOfDescriptorsTheDaemonBacksOffAndRecovers) {
+    axtest::PlatformRoot root;
+    axtest::Process axd({"/bin/sh", "-c", "ulimit -n 40 && exec \"$0\"", axtest::binary("axd")},
+                        {{"CORVANE_LOG_SINK", "stderr"}});
+    std::string endpoint = rpx::endpointPath("com.corvane.annexa.axd");
+    ASSERT_TRUE(axtest::eventually([&] { return axtest::endpointAnswers(endpoint); }));
+    auto cpuTicks = [&] {
+        std::string stat = axtest::readFile("/proc/" + std::to_string(axd.pid()) + "/stat");
+        std::istringstream fields(stat.substr(stat.rfind(')') + 2));
+        std::string field;
+        long long utime = 0, stime = 0;
+        for (int i = 3; i <= 15 && fields >> field; ++i) {
+            if (i == 14) utime = std::stoll(field);
+            if (i == 15) stime = std::stoll(field);
+        }
+        return utime + stime;
+    };
+    std::vector<int> held;
+    for (int i = 0; i < 50; ++i) {
+        int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        struct sockaddr_un addr {};
+        addr.sun_family = AF_UNIX;
+        std::memcpy(addr.sun_path, endpoint.c_str(), endpoint.size() + 1);
+        if (::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0) {
+            held.push_back(fd);
+        } else {
+            ::close(fd);
+        }
+    }
+    std::this_thread::sleep_for(200ms);
+    long long start = cpuTicks();
+    std::this_thread::sleep_for(1s);
+    EXPECT_LT(cpuTicks() - start, 30) << "clock ticks of CPU in one second\n" << axd.err();  // spinning: ~100
+    EXPECT_TRUE(axd.waitForErr("out of file descriptors"));
+    for (int fd : held) ::close(fd);
+    annexa::AXDaemonClient client;
+    EXPECT_TRUE(axtest::eventually([&] { return client.wait([&](auto done) { client.bulkPlugIns(0, done); }).ok(); }));
+    axd.signal(SIGTERM);
+    EXPECT_EQ(axd.wait(5s), 0);
 }
 
 TEST(Axd, SendRoundTripsTheTextNotation) {
