@@ -696,3 +696,30 @@ TEST(Rpx, MessagesWithoutRepliesAreBackPressuredToo) {
     })) << taken << " of " << sent;
     ::close(fd);
 }
+
+// Peers that never read are bounded one by one (reading stops) and all together: past the limit for
+// all queued replies (16 MiB here), those holding the most are dropped.
+TEST(Rpx, NonReadingPeersAreBoundedTogether) {
+    axtest::PlatformRoot root;
+    log::CaptureSink capture;
+    EchoServer server("com.test.hoarders");
+    server.replyPadding = 512 * 1024;
+    std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
+    std::vector<int> hoarders;
+    for (int p = 0; p < 6; ++p) {
+        int fd = rawConnect("com.test.hoarders");
+        fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
+        for (uint64_t id = 1; id <= 40; ++id) {
+            std::string r = frameBytes(wire::FrameKind::Request, id, dict({{"x", 1}}));
+            (void)!write(fd, r.data(), r.size());
+        }
+        hoarders.push_back(fd);
+    }
+    EXPECT_TRUE(axtest::eventually([&] { return capture.contains("bytes of replies it does not read"); }));
+    auto q = dispatch::Queue::create("test");
+    auto good = rpx::Connection::connect("com.test.hoarders", q);
+    good->setEventHandler([](const rpx::Event&) {});
+    good->resume();
+    EXPECT_TRUE(good->sendWithReplySync(dict({{"y", 2}})).ok());
+    for (int fd : hoarders) ::close(fd);
+}

@@ -7,7 +7,9 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <algorithm>
 #include <deque>
+#include <vector>
 #include <mutex>
 #include <optional>
 
@@ -21,11 +23,23 @@ struct Queue::State {
     ConditionVariable wake;
     std::deque<std::function<void()>> tasks GUARDED_BY(mutex);
     bool stopping GUARDED_BY(mutex) = false;
+    // A task is running, on the queue's thread or on a caller's (see sync): the queue runs one
+    // task at a time wherever it runs.
+    bool busy GUARDED_BY(mutex) = false;
 };
 
 namespace {
 
-thread_local const void* tCurrent = nullptr;
+// The queues whose task this thread is running, innermost last: a task that enters another queue
+// synchronously runs on the same thread, inside the first one's task.
+thread_local std::vector<const void*> tCurrent;
+
+struct Entered {
+    explicit Entered(const void* queue) { tCurrent.push_back(queue); }
+    ~Entered() { tCurrent.pop_back(); }
+    Entered(const Entered&) = delete;
+    Entered& operator=(const Entered&) = delete;
+};
 
 int niceFor(QoS qos) {
     switch (qos) {
@@ -53,19 +67,44 @@ void drain(const std::shared_ptr<State>& state) {
         // Per-thread nice value; raising priority fails without CAP_SYS_NICE, which is fine.
         (void)setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), nice);
     }
-    tCurrent = state.get();
+    Entered entered(state.get());
     for (;;) {
         std::function<void()> task;
         {
             MutexLock lock(state->mutex);
-            while (!state->stopping && state->tasks.empty()) state->wake.wait(lock);
+            while (!(state->stopping && state->tasks.empty()) && (state->busy || state->tasks.empty()))
+                state->wake.wait(lock);
             if (state->tasks.empty()) break;
             task = std::move(state->tasks.front());
             state->tasks.pop_front();
+            state->busy = true;
         }
         task();
+        task = nullptr;  // what it captured goes before the next task runs
+        MutexLock lock(state->mutex);
+        state->busy = false;
+        state->wake.notify_all();
     }
-    tCurrent = nullptr;
+}
+
+// An idle queue runs a synchronous task right on the caller's thread, as its one running task: the
+// same order and exclusion as on its own thread, without two thread switches. False (nothing run)
+// when the queue is busy or has tasks waiting.
+template <class State>
+bool runHereIfIdle(State& state, const std::function<void()>& task) {
+    {
+        MutexLock lock(state.mutex);
+        if (state.busy || !state.tasks.empty() || state.stopping) return false;
+        state.busy = true;
+    }
+    {
+        Entered entered(&state);
+        task();
+    }
+    MutexLock lock(state.mutex);
+    state.busy = false;
+    state.wake.notify_all();
+    return true;
 }
 
 }  // namespace
@@ -107,6 +146,7 @@ void Queue::async(std::function<void()> task) {
 
 void Queue::sync(const std::function<void()>& task) {
     if (isCurrent()) fail("sync onto the current queue would deadlock", state_->label);
+    if (runHereIfIdle(*state_, task)) return;
     struct Done {
         Mutex mutex;
         ConditionVariable cv;
@@ -122,7 +162,9 @@ void Queue::sync(const std::function<void()>& task) {
     while (!done.done) done.cv.wait(lock);
 }
 
-bool Queue::isCurrent() const { return tCurrent == state_.get(); }
+bool Queue::isCurrent() const {
+    return std::find(tCurrent.begin(), tCurrent.end(), state_.get()) != tCurrent.end();
+}
 
 void Queue::assertCurrent() const {
     if (!isCurrent()) fail("must run on this queue", state_->label);

@@ -1,9 +1,10 @@
 // Named serial work queues.
 //
-// A Queue is one named thread (pthread_setname_np) draining a list of tasks in submission order.
-// `async` queues a task; `sync` queues it and waits for it. A task must not `sync` onto the queue
-// it runs on: that would wait for itself forever, so it is a programming error and aborts with a
-// message. "Must run on queue X" is written `X->assertCurrent()`, which aborts elsewhere and tells
+// A Queue is one named thread (pthread_setname_np) draining a list of tasks in submission order,
+// one task at a time. `async` queues a task; `sync` runs one and waits for it: on an idle queue
+// (nothing running, nothing waiting) right on the caller's thread, as the queue's one running task,
+// else queued behind the others. A task must not `sync` onto a queue it runs on: that would wait for
+// itself forever, so it is a programming error and aborts with a message. "Must run on queue X" is written `X->assertCurrent()`, which aborts elsewhere and tells
 // clang's thread-safety analysis that the queue's capability is held.
 //
 // A queue lives as long as someone holds its shared_ptr; destroying it drains the tasks already

@@ -20,7 +20,7 @@ namespace corvane::rpx::internal {
 // Reading stops while more than this much is queued for a peer, or while it has this many
 // requests unanswered or events undelivered, and starts again below half of it.
 inline constexpr size_t kHighWaterBytes = 8u << 20;
-inline constexpr size_t kMaxUnfinished = 256;
+inline constexpr size_t kMaxUnfinished = 32;
 
 const log::Handle& rpxLog();
 

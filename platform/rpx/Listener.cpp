@@ -12,6 +12,10 @@
 
 namespace corvane::rpx {
 
+namespace {
+constexpr int kAcceptsPerWakeup = 16;
+}  // namespace
+
 struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     Mutex mutex;
     int fd GUARDED_BY(mutex) = -1;
@@ -53,16 +57,13 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
         log::error(rpxLog(), "rpx: %{public}s (%{public}s)", why, path);
     }
 
-    // Whether the process may have one more connection; counts the new one when it may.
+    // Whether the process may have one more connection; counts the new one when it may. A
+    // connection counts until it is gone entirely, also when it has ended but still waits to be
+    // set up or to deliver its end: what a flood of connections holds stays bounded too.
     bool admit(pid_t pid, const std::shared_ptr<Connection::Impl>& impl) REQUIRES(mutex) {
         auto& mine = byProcess[pid];
         mine.erase(std::remove_if(mine.begin(), mine.end(),
-                                  [](const std::weak_ptr<Connection::Impl>& w) {
-                                      auto c = w.lock();
-                                      if (!c) return true;
-                                      MutexLock lock(c->mutex);
-                                      return c->invalid;
-                                  }),
+                                  [](const std::weak_ptr<Connection::Impl>& w) { return w.expired(); }),
                    mine.end());
         if (mine.size() >= limits().connectionsPerProcess) return false;
         mine.push_back(impl);
@@ -80,7 +81,9 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     }
 
     void onAcceptable() {
-        for (;;) {
+        // A few connections per wake-up: the I/O thread serves every connection, and a flood of
+        // new ones must not keep it from the others (epoll reports the rest again at once).
+        for (int taken = 0; taken < kAcceptsPerWakeup; ++taken) {
             int client;
             {
                 MutexLock lock(mutex);
@@ -102,7 +105,10 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
                 if (errno == EINTR) continue;
                 return;
             }
-            PeerIdentity peer = identityOfSocket(client);
+            // The pid alone first: a refused connection costs no more than that.
+            struct ucred cred {};
+            socklen_t credLength = sizeof cred;
+            getsockopt(client, SOL_SOCKET, SO_PEERCRED, &cred, &credLength);
             size_t frameLimit;
             bool inlined;
             {
@@ -111,17 +117,18 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
                 inlined = inlineDelivery;
             }
             auto impl = std::make_shared<Connection::Impl>(client, delivery, frameLimit);
-            impl->peerPid = peer.pid;
+            impl->peerPid = cred.pid;
             impl->inlineDelivery = inlined;
             {
                 MutexLock lock(mutex);
-                if (!admit(peer.pid, impl)) {
+                if (!admit(cred.pid, impl)) {
                     logRefusal("a process reached its limit of connections; a new one was closed");
                     MutexLock closing(impl->mutex);
                     impl->closeLocked();
                     continue;
                 }
             }
+            PeerIdentity peer = identityOfSocket(client);
             auto connection = std::shared_ptr<Connection>(new Connection(impl, std::move(peer)));
             {
                 MutexLock lock(impl->mutex);

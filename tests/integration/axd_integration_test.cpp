@@ -387,6 +387,24 @@ TEST(Axd, OutOfDescriptorsTheDaemonBacksOffAndRecovers) {
     EXPECT_EQ(axd.wait(5s), 0);
 }
 
+// A client sending messages that are no requests is logged a few times a second, each line cut
+// short, however fast it sends.
+TEST(Axd, UnexpectedMessagesAreLoggedSparingly) {
+    Daemon d;
+    auto c = d.connect();
+    for (int i = 0; i < 200; ++i) c->send(Value(std::string(10000, 'x')));
+    ASSERT_TRUE(c->sendWithReplySync(request("bulk")).ok());  // after the 200, in order
+    std::string err = d.axd->err();
+    size_t lines = 0;
+    for (size_t at = err.find("unexpected message: "); at != std::string::npos; at = err.find("unexpected message: ", at + 1)) {
+        ++lines;
+        size_t end = err.find('\n', at);
+        EXPECT_LT(end - at, 400u);
+    }
+    EXPECT_GE(lines, 1u);
+    EXPECT_LE(lines, 15u);
+}
+
 TEST(Axd, SendRoundTripsTheTextNotation) {
     Daemon d;
     auto sent = d.axctl({"send"}, "{ \"request\" : \"bulk\", \"version\": 3u }");
