@@ -347,6 +347,13 @@ TEST(Axd, AHostKeepsItsClientAcrossADaemonRestart) {
 // Out of descriptors, the daemon sheds new connections instead of spinning on them, and serves
 // again once descriptors are free.
 TEST(Axd, OutOfDescriptorsTheDaemonBacksOffAndRecovers) {
+#if defined(__has_feature)
+#if __has_feature(address_sanitizer)
+    // The sanitizers' runtime needs descriptors of its own (it probes memory through a pipe), and
+    // without them reports errors that are not there.
+    GTEST_SKIP() << "not under the sanitizers";
+#endif
+#endif
     axtest::PlatformRoot root;
     axtest::Process axd({"/bin/sh", "-c", "ulimit -n 40 && exec \"$0\"", axtest::binary("axd")},
                         {{"CORVANE_LOG_SINK", "stderr"}});
@@ -382,9 +389,10 @@ TEST(Axd, OutOfDescriptorsTheDaemonBacksOffAndRecovers) {
     EXPECT_TRUE(axd.waitForErr("out of file descriptors"));
     for (int fd : held) ::close(fd);
     annexa::AXDaemonClient client;
-    EXPECT_TRUE(axtest::eventually([&] { return client.wait([&](auto done) { client.bulkPlugIns(0, done); }).ok(); }));
+    EXPECT_TRUE(axtest::eventually([&] { return client.wait([&](auto done) { client.bulkPlugIns(0, done); }).ok(); }))
+        << axd.err();
     axd.signal(SIGTERM);
-    EXPECT_EQ(axd.wait(5s), 0);
+    EXPECT_EQ(axd.wait(5s), 0) << axd.err();
 }
 
 // A client sending messages that are no requests is logged a few times a second, each line cut
