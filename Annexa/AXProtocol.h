@@ -20,7 +20,7 @@ enum class AXErrorCode : int64_t {
     None = 0,
     RegistryRefused = 2,      // the registry refused, or the caller or plug-in is unknown to it
     InvalidRequest = 4,       // malformed or unusable request; also a failed exchange in the client
-    BadProtocolSpec = 6,      // a plug-in's protocol specification is malformed
+    BadProtocolSpec = 6,      // a plug-in's protocol description is malformed
     VersionMismatch = 7,      // protocol or annotation-file version
     BadPath = 9,              // bad or unknown path
     NotEntitled = 11,         // caller not entitled or not authorised

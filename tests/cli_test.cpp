@@ -87,11 +87,11 @@ TEST(Cli, KeygenRefusesToReplaceAKeyUnlessForced) {
 }
 
 TEST(Cli, ParsesOptionsValuesAndOperands) {
-    const cli::Spec spec{"x [--flag] [--value V] A...", {"--flag"}, {"--value"}, 1, 3};
-    auto p = cli::parse("tool", spec, {"a", "--value", "1", "--flag", "--value", "2", "--", "-b"});
+    const cli::Syntax syntax{"x [--flag] [--value V] A...", {"--flag"}, {"--value"}, 1, 3};
+    auto p = cli::parse("tool", syntax, {"a", "--value", "1", "--flag", "--value", "2", "--", "-b"});
     ASSERT_TRUE(p.parsed);
     EXPECT_TRUE(p.parsed->has("--flag"));
     EXPECT_EQ(p.parsed->value("--value"), std::optional<std::string>("2"));
     EXPECT_EQ(p.parsed->operands, (std::vector<std::string>{"a", "-b"}));
-    EXPECT_EQ(cli::parse("tool", spec, {"-"}).parsed->operands, std::vector<std::string>{"-"});
+    EXPECT_EQ(cli::parse("tool", syntax, {"-"}).parsed->operands, std::vector<std::string>{"-"});
 }

@@ -22,12 +22,12 @@ namespace {
 
 constexpr const char* kTool = "axctl";
 
-const cli::Spec kSend{"[-S servicename] send [FILE]", {}, {}, 0, 1};
-const cli::Spec kAdd{"[-S servicename] add PATH...", {}, {}, 1};
-const cli::Spec kRemove{"[-S servicename] remove PATH...", {}, {}, 1};
-const cli::Spec kAnnotate{"[-S servicename] annotate [--election N] [--extension FILE.plist] UUID...", {},
+const cli::Syntax kSend{"[-S servicename] send [FILE]", {}, {}, 0, 1};
+const cli::Syntax kAdd{"[-S servicename] add PATH...", {}, {}, 1};
+const cli::Syntax kRemove{"[-S servicename] remove PATH...", {}, {}, 1};
+const cli::Syntax kAnnotate{"[-S servicename] annotate [--election N] [--extension FILE.plist] UUID...", {},
                           {"--election", "--extension"}, 1};
-const cli::Spec kBulkAnnotate{"[-S servicename] bulk-annotate FILE.plist", {}, {}, 1, 1};
+const cli::Syntax kBulkAnnotate{"[-S servicename] bulk-annotate FILE.plist", {}, {}, 1, 1};
 
 const char* kHelp =
     "usage: axctl [-S servicename] COMMAND [ARGS]\n"
@@ -154,30 +154,15 @@ int main(int argc, char** argv) {
         service = args[1];
         args.erase(args.begin(), args.begin() + 2);
     }
-    if (args.empty()) return cli::usageError(kTool, "no command", "[-S servicename] COMMAND [ARGS]");
-    if (args[0] == "--help" || args[0] == "-h") {
-        std::fputs(kHelp, stdout);
-        return cli::kSuccess;
-    }
-    std::string command = args[0];
-    args.erase(args.begin());
-    struct Entry {
-        const char* name;
-        const cli::Spec* spec;
-        int (*run)(const std::string&, const cli::Parsed&);
+    auto with = [&service](int (*run)(const std::string&, const cli::Parsed&)) {
+        return [&service, run](const cli::Parsed& p) { return run(service, p); };
     };
-    const Entry commands[] = {
-        {"send", &kSend, send},
-        {"add", &kAdd, [](const std::string& s, const cli::Parsed& p) { return addOrRemove(s, true, p); }},
-        {"remove", &kRemove, [](const std::string& s, const cli::Parsed& p) { return addOrRemove(s, false, p); }},
-        {"annotate", &kAnnotate, annotate},
-        {"bulk-annotate", &kBulkAnnotate, bulkAnnotate},
+    const std::vector<cli::Command> commands = {
+        {"send", kSend, with(send)},
+        {"add", kAdd, [&](const cli::Parsed& p) { return addOrRemove(service, true, p); }},
+        {"remove", kRemove, [&](const cli::Parsed& p) { return addOrRemove(service, false, p); }},
+        {"annotate", kAnnotate, with(annotate)},
+        {"bulk-annotate", kBulkAnnotate, with(bulkAnnotate)},
     };
-    for (const auto& c : commands) {
-        if (command != c.name) continue;
-        cli::Outcome parsed = cli::parse(kTool, *c.spec, args);
-        return parsed.parsed ? c.run(service, *parsed.parsed) : parsed.exitStatus;
-    }
-    std::fprintf(stderr, "axctl: unknown command %s\n%s", command.c_str(), kHelp);
-    return cli::kUsage;
+    return cli::runCommand(kTool, kHelp, commands, std::move(args));
 }

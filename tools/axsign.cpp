@@ -18,12 +18,12 @@ namespace {
 
 constexpr const char* kTool = "axsign";
 
-const cli::Spec kKeygen{"keygen --out KEY [--force]", {"--force"}, {"--out"}, 0, 0};
-const cli::Spec kTrust{"trust KEY.pub", {}, {}, 1, 1};
-const cli::Spec kSign{"sign --key KEY [--identifier ID] [--entitlements FILE.plist] PATH", {},
+const cli::Syntax kKeygen{"keygen --out KEY [--force]", {"--force"}, {"--out"}, 0, 0};
+const cli::Syntax kTrust{"trust KEY.pub", {}, {}, 1, 1};
+const cli::Syntax kSign{"sign --key KEY [--identifier ID] [--entitlements FILE.plist] PATH", {},
                       {"--key", "--identifier", "--entitlements"}, 1, 1};
-const cli::Spec kShow{"show PATH", {}, {}, 1, 1};
-const cli::Spec kVerify{"verify PATH", {}, {}, 1, 1};
+const cli::Syntax kShow{"show PATH", {}, {}, 1, 1};
+const cli::Syntax kVerify{"verify PATH", {}, {}, 1, 1};
 
 const char* kUsage =
     "usage: axsign keygen --out KEY [--force]\n"
@@ -110,29 +110,8 @@ int verifyCommand(const cli::Parsed& p) {
 
 int main(int argc, char** argv) {
     log::setStandardErrorFallback(true);
-    std::vector<std::string> args(argv + 1, argv + argc);
-    if (args.empty()) {
-        std::fputs(kUsage, stderr);
-        return cli::kUsage;
-    }
-    if (args[0] == "--help" || args[0] == "-h") {
-        std::fputs(kUsage, stdout);
-        return cli::kSuccess;
-    }
-    std::string command = args[0];
-    args.erase(args.begin());
-    struct Entry {
-        const char* name;
-        const cli::Spec* spec;
-        int (*run)(const cli::Parsed&);
-    };
-    const Entry commands[] = {{"keygen", &kKeygen, keygen}, {"trust", &kTrust, trust}, {"sign", &kSign, sign},
-                              {"show", &kShow, show},       {"verify", &kVerify, verifyCommand}};
-    for (const auto& c : commands) {
-        if (command != c.name) continue;
-        cli::Outcome parsed = cli::parse(kTool, *c.spec, args);
-        return parsed.parsed ? c.run(*parsed.parsed) : parsed.exitStatus;
-    }
-    std::fprintf(stderr, "axsign: unknown command %s\n%s", command.c_str(), kUsage);
-    return cli::kUsage;
+    const std::vector<cli::Command> commands = {{"keygen", kKeygen, keygen}, {"trust", kTrust, trust},
+                                                {"sign", kSign, sign},       {"show", kShow, show},
+                                                {"verify", kVerify, verifyCommand}};
+    return cli::runCommand(kTool, kUsage, commands, std::vector<std::string>(argv + 1, argv + argc));
 }

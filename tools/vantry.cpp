@@ -20,12 +20,12 @@ namespace {
 
 constexpr const char* kTool = "vantry";
 
-const cli::Spec kRegister{"register [--placeholder] PATH...", {"--placeholder"}, {}, 1};
-const cli::Spec kUnregister{"unregister PATH...", {}, {}, 1};
-const cli::Spec kList{"list [--json]", {"--json"}, {}, 0, 0};
-const cli::Spec kShow{"show [--json] UUID|PATH", {"--json"}, {}, 1, 1};
-const cli::Spec kWatch{"watch", {}, {}, 0, 0};
-const cli::Spec kRebuild{"rebuild", {}, {}, 0, 0};
+const cli::Syntax kRegister{"register [--placeholder] PATH...", {"--placeholder"}, {}, 1};
+const cli::Syntax kUnregister{"unregister PATH...", {}, {}, 1};
+const cli::Syntax kList{"list [--json]", {"--json"}, {}, 0, 0};
+const cli::Syntax kShow{"show [--json] UUID|PATH", {"--json"}, {}, 1, 1};
+const cli::Syntax kWatch{"watch", {}, {}, 0, 0};
+const cli::Syntax kRebuild{"rebuild", {}, {}, 0, 0};
 
 const char* kUsage =
     "usage: vantry register [--placeholder] PATH...   register application or plug-in bundles\n"
@@ -150,35 +150,13 @@ int rebuild(const cli::Parsed&) {
 
 int main(int argc, char** argv) {
     log::setStandardErrorFallback(true);
-    std::vector<std::string> args(argv + 1, argv + argc);
-    if (args.empty()) {
-        std::fputs(kUsage, stderr);
-        return cli::kUsage;
-    }
-    if (args[0] == "--help" || args[0] == "-h") {
-        std::fputs(kUsage, stdout);
-        return cli::kSuccess;
-    }
-    std::string command = args[0];
-    args.erase(args.begin());
-    struct Entry {
-        const char* name;
-        const cli::Spec* spec;
-        int (*run)(const cli::Parsed&);
+    const std::vector<cli::Command> commands = {
+        {"register", kRegister, [](const cli::Parsed& p) { return registration(true, p); }},
+        {"unregister", kUnregister, [](const cli::Parsed& p) { return registration(false, p); }},
+        {"list", kList, list},
+        {"show", kShow, show},
+        {"watch", kWatch, watch},
+        {"rebuild", kRebuild, rebuild},
     };
-    const Entry commands[] = {
-        {"register", &kRegister, [](const cli::Parsed& p) { return registration(true, p); }},
-        {"unregister", &kUnregister, [](const cli::Parsed& p) { return registration(false, p); }},
-        {"list", &kList, list},
-        {"show", &kShow, show},
-        {"watch", &kWatch, watch},
-        {"rebuild", &kRebuild, rebuild},
-    };
-    for (const auto& c : commands) {
-        if (command != c.name) continue;
-        cli::Outcome parsed = cli::parse(kTool, *c.spec, args);
-        return parsed.parsed ? c.run(*parsed.parsed) : parsed.exitStatus;
-    }
-    std::fprintf(stderr, "vantry: unknown command %s\n%s", command.c_str(), kUsage);
-    return cli::kUsage;
+    return cli::runCommand(kTool, kUsage, commands, std::vector<std::string>(argv + 1, argv + argc));
 }

@@ -21,7 +21,7 @@ int fail(const std::string& tool, const std::string& message, int status) {
     return status;
 }
 
-Outcome parse(const std::string& tool, const Spec& spec, const std::vector<std::string>& args) {
+Outcome parse(const std::string& tool, const Syntax& syntax, const std::vector<std::string>& args) {
     auto contains = [](const std::vector<std::string>& list, const std::string& word) {
         return std::find(list.begin(), list.end(), word) != list.end();
     };
@@ -37,22 +37,43 @@ Outcome parse(const std::string& tool, const Spec& spec, const std::vector<std::
         if (word == "--") {
             optionsEnded = true;
         } else if (word == "--help" || word == "-h") {
-            std::printf("usage: %s %s\n", tool.c_str(), spec.usage.c_str());
+            std::printf("usage: %s %s\n", tool.c_str(), syntax.usage.c_str());
             return {std::nullopt, kSuccess};
-        } else if (contains(spec.flags, word)) {
+        } else if (contains(syntax.flags, word)) {
             parsed.options[word].emplace_back();
-        } else if (contains(spec.valued, word)) {
-            if (i + 1 >= args.size()) return {std::nullopt, usageError(tool, "option " + word + " needs a value", spec.usage)};
+        } else if (contains(syntax.valued, word)) {
+            if (i + 1 >= args.size()) return {std::nullopt, usageError(tool, "option " + word + " needs a value", syntax.usage)};
             parsed.options[word].push_back(args[++i]);
         } else {
-            return {std::nullopt, usageError(tool, "unknown option " + word, spec.usage)};
+            return {std::nullopt, usageError(tool, "unknown option " + word, syntax.usage)};
         }
     }
-    if (parsed.operands.size() < spec.minOperands)
-        return {std::nullopt, usageError(tool, "missing operand", spec.usage)};
-    if (parsed.operands.size() > spec.maxOperands)
-        return {std::nullopt, usageError(tool, "unexpected argument " + parsed.operands[spec.maxOperands], spec.usage)};
+    if (parsed.operands.size() < syntax.minOperands)
+        return {std::nullopt, usageError(tool, "missing operand", syntax.usage)};
+    if (parsed.operands.size() > syntax.maxOperands)
+        return {std::nullopt, usageError(tool, "unexpected argument " + parsed.operands[syntax.maxOperands], syntax.usage)};
     return {std::move(parsed), kSuccess};
+}
+
+int runCommand(const std::string& tool, const char* help, const std::vector<Command>& commands,
+               std::vector<std::string> args) {
+    if (args.empty()) {
+        std::fputs(help, stderr);
+        return kUsage;
+    }
+    if (args[0] == "--help" || args[0] == "-h") {
+        std::fputs(help, stdout);
+        return kSuccess;
+    }
+    std::string name = args[0];
+    args.erase(args.begin());
+    for (const auto& command : commands) {
+        if (name != command.name) continue;
+        Outcome parsed = parse(tool, command.syntax, args);
+        return parsed.parsed ? command.run(*parsed.parsed) : parsed.exitStatus;
+    }
+    std::fprintf(stderr, "%s: unknown command %s\n%s", tool.c_str(), name.c_str(), help);
+    return kUsage;
 }
 
 }  // namespace corvane::cli

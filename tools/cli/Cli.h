@@ -1,12 +1,13 @@
 // The command-line convention every tool of the project follows (docs/tools.md): subcommands,
 // `--help` on each, options spelled out and checked, and exit statuses from sysexits.h.
 //
-// A tool describes each subcommand with a Spec and hands it the words after the subcommand; parse()
-// answers the options and operands, or the exit status when the tool is to stop (0 after printing
-// the help, 64 after printing a usage error).
+// A tool describes each subcommand with a Syntax and a function, and runCommand() parses the words
+// after the subcommand and calls it, or answers the exit status when the tool is to stop (0 after
+// printing the help, 64 after printing a usage error).
 #pragma once
 
 #include <cstddef>
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
@@ -24,7 +25,7 @@ enum ExitStatus : int {
     kNoPermission = 77,  // refused for lack of an entitlement
 };
 
-struct Spec {
+struct Syntax {
     std::string usage;                  // "keygen --out KEY [--force]", after the tool's name
     std::vector<std::string> flags;     // options without a value ("--json")
     std::vector<std::string> valued;    // options that take one value ("--out"); may repeat
@@ -47,7 +48,18 @@ struct Outcome {
     std::optional<Parsed> parsed;
     int exitStatus = kSuccess;  // when `parsed` is empty
 };
-Outcome parse(const std::string& tool, const Spec& spec, const std::vector<std::string>& args);
+Outcome parse(const std::string& tool, const Syntax& syntax, const std::vector<std::string>& args);
+
+struct Command {
+    const char* name;
+    Syntax syntax;
+    std::function<int(const Parsed&)> run;
+};
+
+// Runs the command that args[0] names with the rest of `args`. Without a command, or with an unknown
+// one, prints `help` on standard error and returns kUsage; for --help prints it on standard output.
+int runCommand(const std::string& tool, const char* help, const std::vector<Command>& commands,
+               std::vector<std::string> args);
 
 // Prints "<tool>: <message>" and the usage line(s) on standard error; returns kUsage.
 int usageError(const std::string& tool, const std::string& message, const std::string& usage);
