@@ -47,6 +47,23 @@ public:
     // The entries whose keys do not begin with "DT".
     static Dictionary prunedInfoDictionaryFor(const Value& dictionary);
 
+    // ---- the pattern language (AXDPlugInMatching.cpp; docs/discovery.md)
+    // Pure: they read the record, the user's annotation (through the server, so never on the
+    // database queue) and the type system, and change nothing. Everything malformed answers false.
+
+    // `match:`: the plug-in passes every test of the pattern dictionary; null (absent) and an empty
+    // dictionary match every plug-in.
+    bool match(const Value& patterns) const;
+    // `matchKey:pattern:`: one test; the key selects the subject, the pattern tests it.
+    bool matchKeyPattern(const std::string& key, const Value& pattern) const;
+    // `matchValue:patterns:`: a string pattern, or an array of them of which one must match.
+    bool matchValuePatterns(const std::string& subject, const Value& patterns) const;
+    // `matchValue:pattern:`: one operator pattern ("?TY-CONFORMS:", "?TY-IS:", "<>", "<=", ">=",
+    // "=", "<", ">", or plain equality) against a string, by the numeric-aware comparison.
+    bool matchValuePattern(const std::string& subject, const std::string& pattern) const;
+    // `matchDictionary:pattern:`: the plug-in's activation rule (subject) against a host's offer.
+    bool matchDictionaryPattern(const Value& subject, const Value& pattern) const;
+
     // The registry record, replaced whole; readers get their own reference.
     corvane::vantry::PlugInRecordPtr vtproxy() const;
     void setVtproxy(corvane::vantry::PlugInRecordPtr record);

@@ -3,8 +3,10 @@
 #include <filesystem>
 
 #include "axd/AXDPlugIn.h"
+#include "axd/AXDServer.h"
 #include "platform/layout/Layout.h"
 #include "platform/sandbox/Sandbox.h"
+#include "tests/support/Bundles.h"
 #include "tests/support/TestSupport.h"
 
 using annexa::AXDPlugIn;
@@ -186,4 +188,144 @@ TEST(AXDPlugIn, ResourceTokensInTheForm) {
     Dictionary untouched;
     none->augmentForm(untouched);
     EXPECT_TRUE(untouched.empty());
+}
+
+// ---- the pattern language
+
+namespace {
+
+// A plug-in with string, array, number and boolean attributes, a plain Info.plist entry, an
+// entitlement, and (unless `standalone`) a containing application.
+std::shared_ptr<AXDPlugIn> subject(bool standalone = false) {
+    Dictionary changes{
+        {"plugin", dict({{"KSExtensionAttributes", dict({{"KSExtensionVersion", "1.10"},
+                                                         {"Kinds", Value(annexa::Array{Value("a"), Value("b")})},
+                                                         {"Empty", Value(annexa::Array{})},
+                                                         {"Count", 3},
+                                                         {"Off", false},
+                                                         {"Text", "no"},
+                                                         {"NamedLikeAnEntitlement", true},
+                                                         {"Rule", dict({{"image/*", 2}})},
+                                                         {"Type", "image/png"},
+                                                         {"General", "image/*"}})}})},
+        {"info", dict({{"KSExtension", dict({})}, {"KFBundleIdentifier", "com.example.app.share"}, {"Plain", "x"}})},
+        {"entitlements", dict({{"com.example.held", true}, {"com.example.zero", 0}})},
+    };
+    if (standalone) {
+        changes["application"] = Value();
+        changes["path"] = Value(corvane::layout::systemRoot() + "/P.appex");
+    }
+    return AXDPlugIn::fromRegistryRecord(record(changes));
+}
+
+}  // namespace
+
+TEST(AXDPlugInMatching, KeysPatternsAndOperators) {
+    axtest::PlatformRoot root;
+    auto p = subject();
+    ASSERT_TRUE(p);
+    const std::string uuid = p->uuid()->string();
+    std::string lowerUuid = uuid;
+    for (char& c : lowerUuid) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    const struct {
+        const char* key;
+        Value pattern;
+        bool matches;
+    } cases[] = {
+        // Presence tests.
+        {"Text", true, true},  // any string, even one that reads as no
+        {"Missing", true, false},
+        {"Missing", false, true},
+        {"Off", false, true},
+        {"Text", false, false},
+        {"Count", 1, true},  // the number 1 acts as true
+        {"Count", 0, false},
+        // Subjects: the identifier, the UUID's upper-case text, the containing application,
+        // entitlements (never attributes), attributes before the Info.plist.
+        {"KSExtensionIdentifier", "com.example.share", true},
+        {"com.corvane.uuid", Value(uuid), true},
+        {"com.corvane.uuid", Value(lowerUuid), false},
+        {"KSExtensionContainingApp", "/Apps/Example.app", true},
+        {"ENTITLEMENT:com.example.held", true, true},
+        {"ENTITLEMENT:com.example.zero", true, false},
+        {"ENTITLEMENT:NamedLikeAnEntitlement", true, false},
+        {"Plain", "x", true},
+        // Operators, by the numeric-aware comparison; operands taken as written.
+        {"KSExtensionVersion", "1.10", true},
+        {"KSExtensionVersion", ">1.9", true},
+        {"KSExtensionVersion", "<1.9", false},
+        {"KSExtensionVersion", "<=1.10", true},
+        {"KSExtensionVersion", ">=1.11", false},
+        {"KSExtensionVersion", "<>1.10", false},
+        {"KSExtensionVersion", "=1.10", true},
+        {"KSExtensionVersion", "= 1.10", false},  // the blank is part of the operand
+        {"KSExtensionVersion", "1.10.0", false},  // a proper prefix orders first
+        {"Text", "=<no", false},                  // equality with "<no"
+        {"Text", "No", false},                    // case-sensitive
+        // Arrays of patterns and array subjects.
+        {"KSExtensionVersion", Value(annexa::Array{Value("x"), Value(">1.5")}), true},
+        {"KSExtensionVersion", Value(annexa::Array{}), false},
+        {"Kinds", "b", true},
+        {"Kinds", "<>c", true},
+        {"Empty", "<>c", false},
+        // Numbers never match string patterns.
+        {"Count", "3", false},
+        // Unknown "?" operators never match.
+        {"Text", "?", false},
+        {"Text", "?SOMETHING:x", false},
+        // Type operators.
+        {"Type", "?TY-CONFORMS:image/*", true},
+        {"Type", "?TY-CONFORMS:text/plain", false},
+        {"General", "?TY-IS:image/gif", true},
+        {"General", "?TY-IS:text/plain", false},
+        // Activation rules: the plug-in's rule against the host's offer.
+        {"Rule", dict({{"items", Value(annexa::Array{Value("image/png")})}}), true},
+        {"Rule", dict({{"items", Value(annexa::Array{Value("text/plain")})}}), false},
+        {"Missing", dict({{"items", Value(annexa::Array{Value("image/png")})}}), false},
+    };
+    log::CaptureSink capture;
+    for (const auto& c : cases) EXPECT_EQ(p->matchKeyPattern(c.key, c.pattern), c.matches) << c.key << " " << c.pattern.description();
+    EXPECT_EQ(capture.count("unrecognized match operator:"), 2u);
+
+    // Dictionaries of tests: every one must pass; absent and empty match everything.
+    EXPECT_TRUE(p->match(Value()));
+    EXPECT_TRUE(p->match(dict({})));
+    EXPECT_TRUE(p->match(dict({{"Text", true}, {"KSExtensionVersion", ">1"}})));
+    EXPECT_FALSE(p->match(dict({{"Text", true}, {"KSExtensionVersion", "<1"}})));
+    EXPECT_FALSE(p->match(Value("not a dictionary")));
+
+    // Without a containing application the key answers false, whatever the pattern.
+    auto alone = subject(true);
+    ASSERT_TRUE(alone);
+    EXPECT_FALSE(alone->matchKeyPattern("KSExtensionContainingApp", false));
+    EXPECT_FALSE(alone->matchKeyPattern("KSExtensionContainingApp", true));
+    // Without a server or an annotation, the election reads 0.
+    EXPECT_TRUE(p->matchKeyPattern("KSUserElection", "0"));
+}
+
+// "KSUserElection" reads the user's election through the server, with bits 8 to 15 cleared.
+TEST(AXDPlugInMatching, TheElectionIsReadThroughTheServer) {
+    axtest::PlatformRoot root;
+    std::string app = axtest::makeBundle(root.path(), "Example.app", axtest::appInfo("com.example.app"), "/bin/true");
+    axtest::makeBundle(app + "/PlugIns", "One.appex",
+                       axtest::plugInInfo("com.example.one", dict({{"KSExtensionAttributes", dict({})}})), "/bin/true");
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    ASSERT_TRUE(registry);
+    std::shared_ptr<vantry::Registry> shared = std::move(*registry);
+    ASSERT_TRUE(shared->registerBundle(app).ok());
+    auto server = annexa::AXDServer::initForService("com.test.matching", nullptr, shared);
+    ASSERT_TRUE(server);
+    auto one = server->findPlugInAtPath(app + "/PlugIns/One.appex");
+    ASSERT_TRUE(one);
+    const std::pair<int, std::vector<std::pair<const char*, bool>>> elections[] = {
+        {1, {{"1", true}, {"0", false}}},
+        {257, {{"1", true}, {"257", false}}},  // 257 is 1 once bits 8 to 15 are cleared
+        {65537, {{"65537", true}}},            // bit 16 and up stay
+        {0, {{"0", true}, {">0", false}}},
+    };
+    for (const auto& [election, patterns] : elections) {
+        server->setAnnotationForPlugIn(dict({{"election", election}}), *one);
+        for (const auto& [pattern, matches] : patterns)
+            EXPECT_EQ(one->matchKeyPattern("KSUserElection", Value(pattern)), matches) << election << " " << pattern;
+    }
 }
