@@ -46,6 +46,15 @@ inline constexpr const char* kLock = "lock";
 inline constexpr const char* kReceipt = "receipt";
 }  // namespace request
 
+// The option bits of a "match" request's "flags".
+namespace discovery {
+inline constexpr uint64_t kAllVersions = 0x1;  // every version of an identifier
+inline constexpr uint64_t kDuplicates = 0x4;   // with kAllVersions: equal versions too
+inline constexpr uint64_t kSystemOnly = 0x8;   // only plug-ins on the system volume
+inline constexpr uint64_t kAll = 0x200;        // privileged: no visibility rules, no authorization
+inline constexpr uint64_t kExplain = 0x10000;  // our own: say, for every plug-in, why it was left out
+}  // namespace discovery
+
 // Keys of requests and replies.
 namespace message {
 inline constexpr const char* kRequest = "request";

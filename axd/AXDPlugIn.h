@@ -12,6 +12,8 @@
 
 namespace annexa {
 
+class AXDRpxClient;
+
 // Thread-safe: the registry record is set once, before the record is published; the three name
 // caches are replaced whole under a lock.
 class AXDPlugIn : public AXPlugInCore {
@@ -63,6 +65,13 @@ public:
     bool matchValuePattern(const std::string& subject, const std::string& pattern) const;
     // `matchDictionary:pattern:`: the plug-in's activation rule (subject) against a host's offer.
     bool matchDictionaryPattern(const Value& subject, const Value& pattern) const;
+
+    // ---- host authorization (AXDPlugInAuthorization.cpp)
+
+    // `allowForClient:`: nothing when the client may use the plug-in, else the reason. The host's
+    // restricting entitlement (a pattern dictionary) is tested first, then the plug-in's
+    // "KSExtensionHostEntitlement".
+    std::optional<std::string> allowForClient(const AXDRpxClient& client) const;
 
     // The registry record, replaced whole; readers get their own reference.
     corvane::vantry::PlugInRecordPtr vtproxy() const;

@@ -1,5 +1,6 @@
 #include "axd/AXDatabase.h"
 
+#include <cctype>
 #include <cstdlib>
 
 #include "platform/notify/Notify.h"
@@ -104,6 +105,93 @@ Status AXDatabase::removePlugIn(const std::string& path) {
     if (unregistered.ok()) return {};
     log::info(logOps(), "Vantry cannot unregister %@: %{public}@", path, unregistered.error().description());
     return makeError(AXErrorCode::RegistryRefused, "Vantry failed to deregister the plug-in");
+}
+
+namespace {
+
+// The registry's answer as the log shows it.
+std::string recordsText(const std::vector<PlugInRecordPtr>& records) {
+    std::string text = "(";
+    for (const auto& r : records) text += (text.size() > 1 ? ", " : "") + r->description();
+    return text + ")";
+}
+
+}  // namespace
+
+std::optional<std::set<std::string>> AXDatabase::electionFilter(const Value& entry) {
+    std::vector<Value> elements;
+    if (entry.isString()) {
+        elements.push_back(entry);
+    } else if (const Array* list = entry.asArray()) {
+        elements = *list;
+    } else {
+        return std::nullopt;
+    }
+    std::set<std::string> allowed;
+    for (const Value& e : elements) {
+        const std::string* text = e.asString();
+        if (!text || text->empty()) return std::nullopt;
+        auto first = static_cast<unsigned char>((*text)[0]);
+        if (first == '=') {
+            allowed.insert(text->substr(1));
+        } else if (std::isalnum(first) || first >= 0x80) {  // a letter, mark or digit
+            allowed.insert(*text);
+        } else {
+            return std::nullopt;
+        }
+    }
+    return allowed;
+}
+
+std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
+    databaseQueue_->assertNotCurrent();
+    std::vector<corvane::vantry::PlugInRecordPtr> records;
+    const Dictionary* tests = query.asDictionary();
+    if (!tests || tests->empty()) {
+        records = workspace_->installedPlugIns();
+        if (logVt().enabled(log::Level::Debug))
+            log::debug(logVt(), "%d installedPlugins: %@", static_cast<int>(records.size()), recordsText(records));
+    } else {
+        auto allowed = electionFilter(query["KSUserElection"]);
+        auto filter = [&](const std::string& identifier, const Value& entitlements) {
+            if (!allowed) return true;
+            const std::string* replaced = entitlements[keys::kReplaceEntitlement].asString();
+            std::string key = replaced ? *replaced : identifier;
+            Value annotation = databaseQueue_->syncResult([&] {
+                databaseQueue_->assertCurrent();
+                return annotations_->annotationForIdentifier(key);
+            });
+            const Value* stored = annotation.find(keys::kElection);
+            const Value& autoElect = entitlements[keys::kAutoElectEntitlement];
+            int64_t election = stored ? integerValueOf(*stored) : (autoElect.isNumber() && !autoElect.isFalse() ? 1 : 0);
+            std::string text = std::to_string(static_cast<uint64_t>(election) & 0xff);
+            bool kept = allowed->count(text) > 0;
+            log::debug(logOps(), "vt filter %@ -> %d", key, static_cast<int>(kept));
+            return kept;
+        };
+        records = workspace_->query(query, filter);
+        if (logVt().enabled(log::Level::Debug))
+            log::debug(logVt(), "%d plugin(s) matching %@ = %@", static_cast<int>(records.size()), query,
+                       recordsText(records));
+    }
+    size_t before = cacheCount();
+    std::vector<AXDPlugInPtr> result;
+    std::set<UUID> seen;
+    for (const auto& r : records) {
+        if (r->bundlePath().empty()) {
+            log::info(logOps(), "skipping vt proxy %@ with nil bundleURL", r->description());
+            continue;
+        }
+        if (const auto& app = r->containingApplication(); app && app->isPlaceholder()) {
+            log::info(logOps(), "skipping vt proxy %@ because its app is a placeholder", r->description());
+            continue;
+        }
+        if (!seen.insert(r->uuid()).second) continue;
+        if (auto p = plugInForProxy(r)) result.push_back(std::move(p));
+    }
+    log::debug(logOps(), "VT reported %u plug-ins (cache %u/%u)", static_cast<unsigned>(result.size()),
+               static_cast<unsigned>(before), static_cast<unsigned>(cacheCount()));
+    return result;
 }
 
 uint32_t AXDatabase::cacheLimitFromText(const char* text) {

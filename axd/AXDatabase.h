@@ -11,6 +11,8 @@
 #include <atomic>
 #include <memory>
 #include <optional>
+#include <set>
+#include <string>
 #include <unordered_map>
 #include <vector>
 
@@ -48,6 +50,14 @@ public:
     void purgeCachesToLimit(int32_t limit) REQUIRES(*databaseQueue_);
     AXDPlugInPtr findPlugIn(const UUID& uuid);
     AXDPlugInPtr findPlugInAtPath(const std::string& path);
+    // `findPlugIns:`: the candidates for a host's pattern dictionary (null or empty: every
+    // installed plug-in), in the registry's order, each once; the registry drops plug-ins whose
+    // election the query's "KSUserElection" excludes before any record is built. Called on the
+    // service queue.
+    std::vector<AXDPlugInPtr> findPlugIns(const Value& query);
+    // The election texts a "KSUserElection" entry allows, or nothing when it filters nothing.
+    static std::optional<std::set<std::string>> electionFilter(const Value& entry);
+
     // Null (not empty) when the application has no plug-ins or is not known.
     std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& path);
     Status addPlugIn(const std::string& path);

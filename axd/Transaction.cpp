@@ -20,11 +20,12 @@ namespace {
 using Handler = void (Transaction::*)();
 
 // Tested in this order, by exact, case-sensitive comparison. Requests whose handlers are not part
-// of this daemon yet ("match", "ready", "access", "lock", "receipt") are not in the table.
+// of this daemon yet ("ready", "access", "lock", "receipt") are not in the table.
 const std::pair<const char*, Handler> kRequests[] = {
     {request::kAdd, &Transaction::addPlugIns},
     {request::kRemove, &Transaction::removePlugIns},
     {request::kBulk, &Transaction::bulkPlugIns},
+    {request::kMatch, &Transaction::matchPlugIns},
     {request::kAnnotate, &Transaction::annotatePlugIns},
     {request::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
 };

@@ -4,7 +4,9 @@
 
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "Annexa/AXUtilities.h"
 #include "axd/AXDPlugIn.h"
@@ -50,6 +52,7 @@ public:
     void bulkPlugIns();
     void annotatePlugIns();
     void bulkAnnotatePlugIns();
+    void matchPlugIns();
 
     const std::shared_ptr<AXDRpxClient>& client() const { return client_; }
     const Value& request() const { return request_.message; }
@@ -59,6 +62,11 @@ public:
     corvane::rpx::ConnectionPtr connection() const;
 
 private:
+    // Why "match" leaves the plug-in out before export (visibility, rules, exclusions,
+    // authorization), or nothing.
+    std::optional<std::string> matchRefusal(const AXDPlugIn& plugIn, const Value& rules, uint64_t flags,
+                                            const std::vector<Value>& exclusions);
+
     // The request's "annotations" dictionary as a Value; nullopt after answering that it is
     // missing or holds what the annotation file cannot keep.
     std::optional<Value> annotationsArgument();

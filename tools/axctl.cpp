@@ -28,6 +28,12 @@ const cli::Syntax kRemove{"[-S servicename] remove PATH...", {}, {}, 1};
 const cli::Syntax kAnnotate{"[-S servicename] annotate [--election N] [--extension FILE.plist] UUID...", {},
                           {"--election", "--extension"}, 1};
 const cli::Syntax kBulkAnnotate{"[-S servicename] bulk-annotate FILE.plist", {}, {}, 1, 1};
+const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN]... [--rules FILE.plist] [--all-versions] [--duplicates] "
+                         "[--system-only] [--all] [--explain] [--json]",
+                         {"--all-versions", "--duplicates", "--system-only", "--all", "--explain", "--json"},
+                         {"-r", "--rules"},
+                         0,
+                         0};
 
 const char* kHelp =
     "usage: axctl [-S servicename] COMMAND [ARGS]\n"
@@ -39,6 +45,10 @@ const char* kHelp =
     "                                               set the user's choices about plug-ins\n"
     "  bulk-annotate FILE.plist                     set each plug-in's extension dictionary:\n"
     "                                               FILE.plist maps UUID texts to dictionaries\n"
+    "  match [-r KEY=PATTERN]... [--rules FILE.plist] [--all-versions] [--duplicates]\n"
+    "        [--system-only] [--all] [--explain] [--json]\n"
+    "                                               the plug-ins that fit; --explain says why\n"
+    "                                               each installed plug-in was left out\n"
     "The service name defaults to com.corvane.annexa.axd. COMMAND --help shows one command's usage.\n"
     "Exit status: 0 success, 1 the daemon refused (its error text on standard error), 64 usage,\n"
     "65 unreadable input, 69 daemon not reachable, 77 refused for lack of an entitlement.\n"
@@ -143,6 +153,62 @@ int bulkAnnotate(const std::string& service, const cli::Parsed& p) {
     return finish(reply, service);
 }
 
+// One line per plug-in: UUID, identifier, version, path.
+void printForms(const Value& matches) {
+    const corvane::Array* forms = matches.asArray();
+    if (!forms) return;
+    for (const Value& f : *forms) {
+        const Value& version = f["version"];
+        std::printf("%s  %s  %s  %s\n", f["uuid"].asString() ? f["uuid"].asString()->c_str() : "-",
+                    f["identifier"].asString() ? f["identifier"].asString()->c_str() : "-",
+                    version.isString() ? version.asString()->c_str() : version.description().c_str(),
+                    f["path"].asString() ? f["path"].asString()->c_str() : "-");
+    }
+}
+
+int match(const std::string& service, const cli::Parsed& p) {
+    annexa::Dictionary rules;
+    if (auto file = p.value("--rules")) {
+        auto read = corvane::plist::readFile(*file);
+        if (!read || !read->isDictionary()) return cli::fail(kTool, *file + " is not a property-list dictionary", cli::kDataError);
+        rules = *read->asDictionary();
+    }
+    if (p.has("-r")) {
+        for (const auto& rule : p.options.at("-r")) {
+            size_t eq = rule.find('=');
+            if (eq == std::string::npos || eq == 0) return cli::usageError(kTool, "-r needs KEY=PATTERN: " + rule, kMatch.usage);
+            // A pattern in the text notation (true, ["a", ">2"], {"items": [...]}) is taken as that
+            // value; anything else is one operator pattern, as written.
+            std::string text = rule.substr(eq + 1);
+            auto value = Value::parse(text);
+            rules[rule.substr(0, eq)] = value ? *value : Value(text);
+        }
+    }
+    uint64_t flags = 0;
+    if (p.has("--all-versions")) flags |= annexa::discovery::kAllVersions;
+    if (p.has("--duplicates")) flags |= annexa::discovery::kDuplicates;
+    if (p.has("--system-only")) flags |= annexa::discovery::kSystemOnly;
+    if (p.has("--all")) flags |= annexa::discovery::kAll;
+    if (p.has("--explain")) flags |= annexa::discovery::kExplain;
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.matchPlugIns(rules.empty() ? Value() : Value(rules), flags, done); });
+    if (int status = finish(reply, service); status != cli::kSuccess) return status;
+    const Value& matches = reply.value[annexa::message::kMatches];
+    if (p.has("--json")) {
+        std::printf("%s\n", (p.has("--explain") ? reply.value : matches).json().c_str());
+        return cli::kSuccess;
+    }
+    if (p.has("--explain")) {
+        if (const corvane::Array* explained = reply.value["explanations"].asArray())
+            for (const Value& e : *explained)
+                std::printf("%s  %s  %s\n", e["uuid"].asString()->c_str(), e["identifier"].asString()->c_str(),
+                            e["outcome"].asString()->c_str());
+        return cli::kSuccess;
+    }
+    printForms(matches);
+    return cli::kSuccess;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -163,6 +229,7 @@ int main(int argc, char** argv) {
         {"remove", kRemove, [&](const cli::Parsed& p) { return addOrRemove(service, false, p); }},
         {"annotate", kAnnotate, with(annotate)},
         {"bulk-annotate", kBulkAnnotate, with(bulkAnnotate)},
+        {"match", kMatch, with(match)},
     };
     return cli::runCommand(kTool, kHelp, commands, std::move(args));
 }

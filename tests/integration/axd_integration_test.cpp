@@ -7,6 +7,7 @@
 
 #include <fcntl.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstring>
@@ -19,6 +20,7 @@
 #include "platform/layout/Layout.h"
 #include "platform/notify/Notify.h"
 #include "platform/plist/Plist.h"
+#include "platform/prefs/Prefs.h"
 #include "platform/rpx/Rpx.h"
 #include "platform/vantry/Vantry.h"
 #include "tests/support/Bundles.h"
@@ -411,6 +413,111 @@ TEST(Axd, UnexpectedMessagesAreLoggedSparingly) {
     }
     EXPECT_GE(lines, 1u);
     EXPECT_LE(lines, 15u);
+}
+
+// Discovery through the real daemon: visibility, rules, collapsing by version, the election,
+// exclusions, replacement marks, authorization of signed hosts and the explanation.
+TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
+    Daemon d;
+    auto key = codesign::generateKey();
+    ASSERT_TRUE(codesign::writeKeyPair(d.root / "key", key).ok());
+    ASSERT_TRUE(codesign::trustKey(d.root / "key.pub").ok());
+    auto plugIn = [&](const std::string& app, const char* name, const char* id, const char* version, const Value& ents) {
+        std::string path = axtest::makeBundle(
+            app + "/PlugIns", std::string(name) + ".appex",
+            axtest::plugInInfo(id, dict({{"KSExtensionProtocol", "P"},
+                                         {"KSExtensionAttributes", dict({{"KSExtensionVersion", version}})}})),
+            "/bin/true");
+        EXPECT_TRUE(codesign::sign(path, key, std::nullopt, ents).ok());
+    };
+    std::string app = axtest::makeBundle(d.root.path(), "Example.app", axtest::appInfo("com.example.app"), "/bin/true");
+    plugIn(app, "Old", "com.example.one", "1.9", dict({}));
+    plugIn(app, "Two", "com.example.two", "1", dict({}));
+    std::string other = axtest::makeBundle(d.root.path(), "Other.app", axtest::appInfo("com.example.other"), "/bin/true");
+    plugIn(other, "New", "com.example.one", "1.10", dict({}));
+    plugIn(other, "Replacer", "com.example.replacer", "1", dict({{"com.corvane.developer.replace-plugin", "com.example.two"}}));
+    ASSERT_EQ(d.axctl({"add", app, other}).status, 0);
+
+    auto identifiers = [](const Value& reply) {
+        std::vector<std::string> out;
+        if (const Array* forms = reply["matches"].asArray())
+            for (const Value& f : *forms) out.push_back(*f["identifier"].asString() + "@" + *f["version"].asString());
+        std::sort(out.begin(), out.end());
+        return out;
+    };
+    using Ids = std::vector<std::string>;
+    EXPECT_EQ(identifiers(d.send(request("match"))),
+              (Ids{"com.example.one@1.10", "com.example.replacer@1", "com.example.two@1"}));
+    EXPECT_EQ(identifiers(d.send(request("match", {{"flags", uint64_t{1}}}))),
+              (Ids{"com.example.one@1.10", "com.example.one@1.9", "com.example.replacer@1", "com.example.two@1"}));
+    EXPECT_EQ(identifiers(d.send(request("match", {{"rules", dict({{"KSExtensionVersion", "<1.10"}})}}))),
+              (Ids{"com.example.one@1.9", "com.example.replacer@1", "com.example.two@1"}));
+    EXPECT_EQ(identifiers(d.send(request("match", {{"rules", dict({{"KSExtensionIdentifier", "com.example.two"}})}}))),
+              (Ids{"com.example.two@1"}));
+    EXPECT_EQ(d.send(request("match", {{"rules", "x"}})), error(4, "invalid request format (bad rules dictionary)"));
+    EXPECT_EQ(d.send(request("match", {{"flags", uint64_t{0x200}}})), error(11, "unauthorized discovery flag (AXDiscoverAll)"));
+    EXPECT_EQ(d.send(dict({{"request", "match"}, {"version", uint64_t{2}}})), dict({}));  // no "matches" at version 2
+
+    // The replaced plug-in names its replacer, the replacer what it replaces; both stay.
+    Value all = d.send(request("match"));
+    for (const Value& f : *all["matches"].asArray()) {
+        if (f["identifier"] == Value("com.example.two")) {
+            EXPECT_TRUE(f["overrider"].isString());
+        }
+        if (f["identifier"] == Value("com.example.replacer")) {
+            EXPECT_EQ(f["overriding"], Value("com.example.two"));
+        }
+    }
+
+    // The election: only what the user elected.
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    UUID two = (*registry)->plugInForPath(app + "/PlugIns/Two.appex")->uuid();
+    ASSERT_EQ(d.axctl({"annotate", "--election", "1", two.string()}).status, 0);
+    // The replacer keeps its annotations under the identifier it replaces: elected with it.
+    EXPECT_EQ(identifiers(d.send(request("match", {{"rules", dict({{"KSUserElection", "1"}})}}))),
+              (Ids{"com.example.replacer@1", "com.example.two@1"}));
+
+    // The user's exclusions leave plug-ins out, also those the rules name.
+    ASSERT_TRUE(prefs::setValue("exclusions", Value(Array{dict({{"KSExtensionIdentifier", "com.example.replacer"}})}),
+                                "com.corvane.annexa.userprefs").ok());
+    EXPECT_EQ(identifiers(d.send(request("match", {{"rules", dict({{"KSExtensionIdentifier", "com.example.replacer"}})}}))),
+              Ids{});
+
+    // Hosts: restricted by their entitlement, or privileged.
+    auto signedAxctl = [&](const std::string& name, const Value& ents) {
+        std::string path = d.root / ("bin/" + name);
+        fs::create_directories(d.root / "bin");
+        fs::copy_file(axtest::binary("axctl"), path);
+        EXPECT_TRUE(codesign::sign(path, key, std::nullopt, ents).ok());
+        return path;
+    };
+    std::string restricted = signedAxctl("restricted", dict({{"com.corvane.developer.annexa.allowedplugins",
+                                                              dict({{"KSExtensionIdentifier", "com.example.two"}})}}));
+    auto onlyTwo = d.axctl({"match"}, {}, restricted);
+    EXPECT_EQ(onlyTwo.status, 0) << onlyTwo.err;
+    EXPECT_NE(onlyTwo.out.find("com.example.two"), std::string::npos) << onlyTwo.out;
+    EXPECT_EQ(onlyTwo.out.find("com.example.one"), std::string::npos) << onlyTwo.out;
+    std::string invalid = signedAxctl("invalid", dict({{"com.corvane.developer.annexa.allowedplugins", "com.example.two"}}));
+    EXPECT_EQ(d.axctl({"match"}, {}, invalid).out, "");
+    std::string manager = signedAxctl("manager", dict({{"com.corvane.private.annexa.manager", true}}));
+    auto privileged = d.axctl({"match", "--all"}, {}, manager);
+    EXPECT_EQ(privileged.status, 0) << privileged.err;
+    EXPECT_EQ(d.axctl({"match", "--all"}).status, 77);
+
+    // The explanation: one line per installed plug-in, with the step that left it out.
+    auto explained = d.axctl({"match", "--explain", "-r", "KSExtensionIdentifier=<>com.example.two"});
+    ASSERT_EQ(explained.status, 0) << explained.err;
+    auto line = [&](const std::string& path) {
+        auto r = (*registry)->plugInForPath(path);
+        std::string lines = "\n" + explained.out;
+        size_t at = lines.find("\n" + r->uuid().string());
+        return at == std::string::npos ? std::string() : lines.substr(at + 1, lines.find('\n', at + 1) - at - 1);
+    };
+    EXPECT_NE(line(app + "/PlugIns/Old.appex").find("collapsed in favour of"), std::string::npos) << explained.out;
+    EXPECT_NE(line(other + "/PlugIns/New.appex").find("returned"), std::string::npos) << explained.out;
+    EXPECT_NE(line(app + "/PlugIns/Two.appex").find("rule KSExtensionIdentifier does not match"), std::string::npos)
+        << explained.out;
+    EXPECT_NE(line(other + "/PlugIns/Replacer.appex").find("excluded by the user"), std::string::npos) << explained.out;
 }
 
 TEST(Axd, SendRoundTripsTheTextNotation) {
