@@ -79,6 +79,24 @@ int64_t annexa_send(annexa_client* client, const char* message, char** reply, ch
     return report(0, {}, error_text);
 }
 
+int64_t annexa_match(annexa_client* client, const char* rules, uint64_t flags, char** matches, char** error_text) {
+    if (matches) *matches = nullptr;
+    if (!client || !matches) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    corvane::Value pattern;
+    if (rules) {
+        auto parsed = corvane::Value::parseReporting(rules);
+        if (!parsed) return report(ANNEXA_EINVAL, "rules are not one value in the text notation: " + parsed.error().description(), error_text);
+        pattern = *parsed;
+    }
+    AXDaemonClient& c = client->client;
+    Reply r = c.wait([&](AXDaemonClient::Completion done) { c.matchPlugIns(pattern, flags, std::move(done)); });
+    int64_t code = finish(c, r, error_text);
+    if (code != 0) return code;
+    const corvane::Value& found = r.value[annexa::message::kMatches];
+    *matches = copyText(found.isNull() ? corvane::Value(corvane::Array{}).description() : found.description());
+    return 0;
+}
+
 void annexa_log_to_stderr(int enabled) { corvane::log::setStandardErrorFallback(enabled != 0); }
 
 int64_t annexa_add(annexa_client* client, const char* const* paths, size_t count, char** error_text) {

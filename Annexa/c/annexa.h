@@ -60,6 +60,12 @@ int64_t annexa_bulk_annotate(annexa_client* client, const char* annotations, cha
 /* With a non-zero argument, log lines the journal cannot take go to standard error. */
 void annexa_log_to_stderr(int enabled);
 
+/* Discovery: the plug-ins that fit `rules` (a pattern dictionary in the notation, or null for
+ * every plug-in) under `flags` (docs/discovery.md). `matches` receives the array of plug-in forms
+ * in the notation (release it with annexa_free); each form carries "uuid", "identifier", "version",
+ * "path" and the rest of docs/discovery.md. */
+int64_t annexa_match(annexa_client* client, const char* rules, uint64_t flags, char** matches, char** error_text);
+
 /* Releases text returned by this interface. */
 void annexa_free(void* text);
 

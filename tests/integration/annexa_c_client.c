@@ -3,6 +3,7 @@
  *     annexa_c_client APP_PATH PLUGIN_UUID */
 #include <inttypes.h>
 #include <stdio.h>
+#include <string.h>
 
 #include "Annexa/c/annexa.h"
 
@@ -41,6 +42,14 @@ int main(int argc, char** argv) {
     const char* bad[] = {"not-a-uuid"};
     code = annexa_annotate(client, bad, 1, "{\"election\": 1}", &text);
     line("annotate bad uuid", code, text);
+
+    char* found = NULL;
+    code = annexa_match(client, "{\"KSExtensionIdentifier\": \"com.example.One\"}", 0, &found, &text);
+    printf("match: %" PRId64 " %s\n", code, found && strstr(found, "\"identifier\": \"com.example.One\"") ? "One" : "-");
+    annexa_free(found);
+    annexa_free(text);
+    code = annexa_match(client, "{bad", 0, &found, &text);
+    line("match garbage", code, text);
 
     char table[200];
     snprintf(table, sizeof table, "{\"%s\": {\"from\": \"C\"}}", argv[2]);

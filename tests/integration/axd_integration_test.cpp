@@ -316,6 +316,8 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
               "annotate: 0 -\n"
               "annotate string election: 4 invalid request format (annotation election)\n"
               "annotate bad uuid: -1 not a UUID: not-a-uuid\n"
+              "match: 0 One\n"
+              "match garbage: -1 rules are not one value in the text notation: at offset 1: expected a key in double quotes\n"
               "bulk-annotate: 0 -\n"
               "remove: 11 caller lacks entitlement for this operation\n"
               "unreachable: -2 cannot reach the daemon at com.nobody.here: Connection invalid\n"
