@@ -83,7 +83,6 @@ void drain(const std::shared_ptr<State>& state) {
         task = nullptr;  // what it captured goes before the next task runs
         MutexLock lock(state->mutex);
         state->busy = false;
-        state->wake.notify_all();
     }
 }
 
@@ -103,7 +102,8 @@ bool runHereIfIdle(State& state, const std::function<void()>& task) {
     }
     MutexLock lock(state.mutex);
     state.busy = false;
-    state.wake.notify_all();
+    // The queue's thread waits only for tasks; wake it when some came meanwhile.
+    if (!state.tasks.empty()) state.wake.notify_one();
     return true;
 }
 

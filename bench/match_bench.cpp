@@ -1,0 +1,234 @@
+// axbench match: discovery over N generated plug-ins through a real axd, beside what a host would
+// spend finding the same plug-ins by reading their bundles itself, and beside a plain Unix-socket
+// ping-pong of the same sizes between two processes pinned to different cores.
+#include <sched.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "Annexa/AXDaemonClient.h"
+#include "Annexa/AXUtilities.h"
+#include "bench/Bench.h"
+#include "platform/plist/Plist.h"
+#include "platform/rpx/Rpx.h"
+#include "platform/rpx/Wire.h"
+#include "platform/vantry/Vantry.h"
+
+extern char** environ;
+
+using namespace corvane;
+
+namespace {
+
+constexpr int kPerApp = 100;
+
+void pinTo(int cpu) {
+    cpu_set_t set;
+    CPU_ZERO(&set);
+    CPU_SET(cpu, &set);
+    sched_setaffinity(0, sizeof set, &set);
+}
+
+bool readFull(int fd, char* p, size_t n) {
+    while (n) {
+        ssize_t r = ::read(fd, p, n);
+        if (r <= 0) return false;
+        p += r;
+        n -= static_cast<size_t>(r);
+    }
+    return true;
+}
+
+// The ping-pong's far end: reads `request` bytes, answers `reply` bytes, until the socket closes.
+[[noreturn]] void echo(int fd, size_t request, size_t reply) {
+    pinTo(1);
+    std::vector<char> in(request), out(reply, 'x');
+    while (readFull(fd, in.data(), in.size()))
+        if (::write(fd, out.data(), out.size()) != static_cast<ssize_t>(out.size())) break;
+    _exit(0);
+}
+
+long rssKiB(pid_t pid) {
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    std::string line;
+    while (std::getline(status, line))
+        if (line.rfind("VmRSS:", 0) == 0) return std::atol(line.c_str() + 6);
+    return 0;
+}
+
+int runMatch(int argc, char** argv) {
+    int plugins = 10000;
+    int requests = 500;
+    for (int i = 1; i + 1 < argc; i += 2) {
+        if (std::strcmp(argv[i], "--plugins") == 0) plugins = std::max(kPerApp, std::atoi(argv[i + 1]));
+        if (std::strcmp(argv[i], "--requests") == 0) requests = std::atoi(argv[i + 1]);
+    }
+    // The ping-pong's far end is forked first, before this process has any thread. Its sizes are
+    // those of a "ten" request and reply, measured below; it is told them through the socket.
+    int pair[2];
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return 1;
+    int sizes[2];
+    if (pipe(sizes) != 0) return 1;
+    pid_t echoPid = fork();
+    if (echoPid == 0) {
+        close(pair[0]);
+        uint64_t n[2];
+        if (!readFull(sizes[0], reinterpret_cast<char*>(n), sizeof n)) _exit(1);
+        echo(pair[1], n[0], n[1]);
+    }
+    close(pair[1]);
+    pinTo(0);
+
+    char tmpl[] = "/tmp/axbench-match.XXXXXX";
+    std::string root = mkdtemp(tmpl);
+    setenv("CORVANE_ROOT", root.c_str(), 1);
+    setenv("CORVANE_LOG", "error", 1);
+    std::string self = std::filesystem::read_symlink("/proc/self/exe");
+    std::string bin = self.substr(0, self.rfind('/'));
+
+    // N plug-ins, 100 to an application; every extension point name served by 10 of them; one in
+    // ten elected; every 50th shares its identifier with the one before, at a higher version.
+    int points = plugins / 10;
+    std::vector<std::string> apps;
+    std::vector<std::string> plugInPaths;
+    Dictionary annotations;
+    for (int a = 0; a * kPerApp < plugins; ++a) {
+        std::string app = root + "/Apps/App" + std::to_string(a) + ".app";
+        std::filesystem::create_directories(app + "/PlugIns");
+        (void)plist::writeXMLFile(app + "/Info.plist", dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)}}));
+        for (int p = 0; p < kPerApp && a * kPerApp + p < plugins; ++p) {
+            int n = a * kPerApp + p;
+            bool twin = n % 50 == 1;
+            std::string identifier = "com.bench.plugin" + std::to_string(twin ? n - 1 : n);
+            std::string dir = app + "/PlugIns/P" + std::to_string(p) + ".appex";
+            std::filesystem::create_directories(dir);
+            Value attrs = dict({{"KSExtensionPointName", "point" + std::to_string(n % points)},
+                                {"KSExtensionVersion", twin ? "2.0" : "1.0"}});
+            (void)plist::writeXMLFile(dir + "/Info.plist",
+                                      dict({{"KFBundleIdentifier", identifier},
+                                            {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
+                                                                  {"KSExtensionProtocol", "#Data"},
+                                                                  {"KSExtensionAttributes", attrs}})}}));
+            plugInPaths.push_back(dir);
+            if (n % 10 == 0) annotations[identifier] = dict({{"election", 1}});
+        }
+        apps.push_back(app);
+    }
+    {
+        auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+        if (!registry) return 1;
+        for (const auto& app : apps)
+            if (!(*registry)->registerBundle(app).ok()) return 1;
+    }
+    std::string annotationFile = root + "/Annotations";
+    (void)plist::writeXMLFile(annotationFile, dict({{"version", 16}, {"data", Value(annotations)}}));
+
+    pid_t axd = -1;
+    std::string axdPath = bin + "/axd";
+    std::vector<char*> args{axdPath.data(), const_cast<char*>("-d"), annotationFile.data(), nullptr};
+    if (posix_spawn(&axd, axdPath.c_str(), nullptr, nullptr, args.data(), environ) != 0) return 1;
+    std::string endpoint = rpx::endpointPath(annexa::kDefaultServiceName);
+    for (int i = 0; i < 1000 && !std::filesystem::exists(endpoint); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+
+    annexa::AXDaemonClient client;
+    auto match = [&](const Value& rules) {
+        return client.wait([&](auto done) { client.matchPlugIns(rules, 0, done); });
+    };
+    Value ten = dict({{"KSExtensionPointName", "point7"}});
+    auto coldStart = std::chrono::steady_clock::now();
+    auto first = match(ten);
+    double coldMs = axbench::microsSince(coldStart) / 1000;
+    const Array* firstForms = first.value["matches"].asArray();
+    if (!first.ok() || !firstForms) {
+        std::fprintf(stderr, "axbench match: no answer from axd\n");
+        kill(axd, SIGKILL);
+        return 1;
+    }
+    for (int i = 0; i < 50; ++i) (void)match(dict({{"KSExtensionPointName", "point" + std::to_string(i % points)}}));
+    std::vector<double> tenSamples;
+    for (int i = 0; i < requests; ++i) {
+        auto start = std::chrono::steady_clock::now();
+        (void)match(ten);
+        tenSamples.push_back(axbench::microsSince(start));
+    }
+
+    // The same sizes, plain: the request message and the reply as the wire carries them.
+    size_t requestSize = rpx::wire::kHeaderSize + 200;
+    size_t replySize = rpx::wire::kHeaderSize + first.value.description().size();
+    uint64_t told[2] = {requestSize, replySize};
+    (void)!::write(sizes[1], told, sizeof told);
+    std::vector<char> out(requestSize, 'r'), in(replySize);
+    for (int i = 0; i < 200; ++i) {
+        (void)!::write(pair[0], out.data(), out.size());
+        readFull(pair[0], in.data(), in.size());
+    }
+    std::vector<double> pingSamples;
+    for (int i = 0; i < requests; ++i) {
+        auto start = std::chrono::steady_clock::now();
+        (void)!::write(pair[0], out.data(), out.size());
+        readFull(pair[0], in.data(), in.size());
+        pingSamples.push_back(axbench::microsSince(start));
+    }
+    close(pair[0]);
+    waitpid(echoPid, nullptr, 0);
+
+    // Every plug-in, through the daemon, warm; then as a host would find them itself.
+    std::vector<double> allSamples;
+    size_t allCount = 0;
+    for (int i = 0; i < 5; ++i) {
+        auto start = std::chrono::steady_clock::now();
+        auto all = match(Value());
+        allSamples.push_back(axbench::microsSince(start) / 1000);
+        if (const Array* forms = all.value["matches"].asArray()) allCount = forms->size();
+    }
+    long rss = rssKiB(axd);
+    std::vector<double> scanSamples;
+    size_t scanCount = 0;
+    for (int i = 0; i < 3; ++i) {
+        auto start = std::chrono::steady_clock::now();
+        std::map<std::string, std::string> best;  // identifier -> highest version
+        for (const auto& dir : plugInPaths) {
+            auto info = plist::readFile(dir + "/Info.plist");
+            if (!info) continue;
+            const std::string* id = (*info)["KFBundleIdentifier"].asString();
+            const std::string* version = (*info)["KSExtension"]["KSExtensionAttributes"]["KSExtensionVersion"].asString();
+            if (!id || !version) continue;
+            auto it = best.find(*id);
+            if (it == best.end() || annexa::compareVersionString(*version, it->second) == annexa::Ordering::Descending)
+                best[*id] = *version;
+        }
+        scanCount = best.size();
+        scanSamples.push_back(axbench::microsSince(start) / 1000);
+    }
+    kill(axd, SIGTERM);
+    waitpid(axd, nullptr, 0);
+    std::error_code ignored;
+    std::filesystem::remove_all(root, ignored);
+
+    double tenP50 = axbench::percentile(tenSamples, 50), tenP99 = axbench::percentile(tenSamples, 99);
+    double pingP50 = axbench::percentile(pingSamples, 50);
+    double allMs = axbench::percentile(allSamples, 50), scanMs = axbench::percentile(scanSamples, 50);
+    std::printf("ten: %zu plug-ins; all: %zu through axd, %zu by scanning\n", firstForms->size(), allCount, scanCount);
+    std::printf("RESULT match n=%d ten_p50_us=%.1f ten_p99_us=%.1f pingpong_p50_us=%.1f ratio_ten=%.2f all_ms=%.1f "
+                "scan_ms=%.1f speedup_all=%.1f cold_ms=%.1f rss_mb=%.1f\n",
+                plugins, tenP50, tenP99, pingP50, tenP50 / pingP50, allMs, scanMs, scanMs / allMs, coldMs,
+                static_cast<double>(rss) / 1024);
+    return 0;
+}
+
+}  // namespace
+
+AX_BENCH_SUBCOMMAND("match", "discovery over N plug-ins through axd, against a host scanning bundles itself", runMatch);
