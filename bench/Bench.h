@@ -3,9 +3,13 @@
 // figures and, as its last line, "RESULT <name> key=value ...".
 #pragma once
 
+#include <sys/types.h>
+
 #include <algorithm>
 #include <chrono>
 #include <cstdint>
+#include <cstdlib>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -20,6 +24,15 @@ inline double percentile(std::vector<double>& samples, double p) {
     std::sort(samples.begin(), samples.end());
     size_t i = static_cast<size_t>(p / 100.0 * static_cast<double>(samples.size() - 1) + 0.5);
     return samples[std::min(i, samples.size() - 1)];
+}
+
+// A process's resident memory in KiB, from /proc; 0 when it cannot be read.
+inline long residentKiB(pid_t pid) {
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    std::string line;
+    while (std::getline(status, line))
+        if (line.rfind("VmRSS:", 0) == 0) return std::atol(line.c_str() + 6);
+    return 0;
 }
 
 inline double microsSince(std::chrono::steady_clock::time_point start) {

@@ -160,14 +160,6 @@ struct Sampled {
     std::atomic<long> maxFds{0};
 };
 
-long rssKiB(pid_t pid) {
-    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-    std::string line;
-    while (std::getline(status, line))
-        if (line.rfind("VmRSS:", 0) == 0) return std::atol(line.c_str() + 6);
-    return 0;
-}
-
 long openFds(pid_t pid) {
     std::error_code ec;
     long n = 0;
@@ -192,7 +184,7 @@ Phase measure(pid_t axd, double seconds) {
     Sampled sampled;
     std::thread sampler([&] {
         while (!sampled.stop) {
-            sampled.maxRssKiB = std::max(sampled.maxRssKiB.load(), rssKiB(axd));
+            sampled.maxRssKiB = std::max(sampled.maxRssKiB.load(), axbench::residentKiB(axd));
             sampled.maxFds = std::max(sampled.maxFds.load(), openFds(axd));
             std::this_thread::sleep_for(std::chrono::milliseconds(20));
         }

@@ -61,14 +61,6 @@ bool readFull(int fd, char* p, size_t n) {
     _exit(0);
 }
 
-long rssKiB(pid_t pid) {
-    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-    std::string line;
-    while (std::getline(status, line))
-        if (line.rfind("VmRSS:", 0) == 0) return std::atol(line.c_str() + 6);
-    return 0;
-}
-
 int runMatch(int argc, char** argv) {
     int plugins = 10000;
     int requests = 500;
@@ -194,7 +186,7 @@ int runMatch(int argc, char** argv) {
         allSamples.push_back(axbench::microsSince(start) / 1000);
         if (const Array* forms = all.value["matches"].asArray()) allCount = forms->size();
     }
-    long rss = rssKiB(axd);
+    long rss = axbench::residentKiB(axd);
     std::vector<double> scanSamples;
     size_t scanCount = 0;
     for (int i = 0; i < 3; ++i) {
