@@ -505,6 +505,13 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     auto privileged = d.axctl({"match", "--all"}, {}, manager);
     EXPECT_EQ(privileged.status, 0) << privileged.err;
     EXPECT_EQ(d.axctl({"match", "--all"}).status, 77);
+    // The same entitled host, confined (here: in a mount namespace of its own), is refused the
+    // privileged flag and the explanation.
+    for (const char* flag : {"--all", "--explain"}) {
+        auto confined = axtest::run({"/usr/bin/unshare", "-m", manager, "match", flag});
+        EXPECT_EQ(confined.status, 77) << flag << ": " << confined.err;
+        EXPECT_NE(confined.err.find("unauthorized discovery flag"), std::string::npos) << confined.err;
+    }
 
     // The explanation: one line per installed plug-in, with the step that left it out.
     auto explained = d.axctl({"match", "--explain", "-r", "KSExtensionIdentifier=<>com.example.two"});
@@ -520,6 +527,13 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("rule KSExtensionIdentifier does not match"), std::string::npos)
         << explained.out;
     EXPECT_NE(line(other + "/PlugIns/Replacer.appex").find("excluded by the user"), std::string::npos) << explained.out;
+    explained = d.axctl({"match", "--explain", "--system-only"});
+    EXPECT_NE(line(app + "/PlugIns/Two.appex").find("not on the system volume"), std::string::npos) << explained.out;
+    explained = d.axctl({"match", "--explain"}, {}, restricted);
+    EXPECT_NE(line(other + "/PlugIns/New.appex").find("not allowed: the host's plug-in entitlement does not allow this plug-in"),
+              std::string::npos)
+        << explained.out;
+    EXPECT_NE(line(app + "/PlugIns/Two.appex").find("returned"), std::string::npos) << explained.out;
 }
 
 TEST(Axd, SendRoundTripsTheTextNotation) {
