@@ -14,6 +14,7 @@ namespace corvane::rpx {
 
 namespace {
 constexpr int kAcceptsPerWakeup = 16;
+constexpr size_t kRememberedProcesses = 1024;
 }  // namespace
 
 struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
@@ -61,10 +62,17 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     // connection counts until it is gone entirely, also when it has ended but still waits to be
     // set up or to deliver its end: what a flood of connections holds stays bounded too.
     bool admit(pid_t pid, const std::shared_ptr<Connection::Impl>& impl) REQUIRES(mutex) {
+        auto gone = [](const std::weak_ptr<Connection::Impl>& w) { return w.expired(); };
+        // Processes come and go: now and then the table forgets those without connections.
+        if (byProcess.size() > kRememberedProcesses) {
+            for (auto it = byProcess.begin(); it != byProcess.end();) {
+                auto& list = it->second;
+                list.erase(std::remove_if(list.begin(), list.end(), gone), list.end());
+                it = list.empty() ? byProcess.erase(it) : std::next(it);
+            }
+        }
         auto& mine = byProcess[pid];
-        mine.erase(std::remove_if(mine.begin(), mine.end(),
-                                  [](const std::weak_ptr<Connection::Impl>& w) { return w.expired(); }),
-                   mine.end());
+        mine.erase(std::remove_if(mine.begin(), mine.end(), gone), mine.end());
         if (mine.size() >= limits().connectionsPerProcess) return false;
         mine.push_back(impl);
         return true;
