@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <map>
 #include <fstream>
 #include <mutex>
 #include <sstream>
@@ -29,11 +30,26 @@ const log::Handle& sandboxLog() {
 
 std::string keyPath() { return layout::userDataDir() + "/sandbox/token.key"; }
 
-// The user's secret key, made on first use. Two processes making it at once agree: the file is
-// created exclusively and the loser reads the winner's.
+std::optional<Bytes> readOrMakeKey(const std::string& path);
+
+// The key of the current platform root, read once per process: a daemon issues a read token for
+// nearly every plug-in of a discovery reply.
 std::optional<Bytes> secretKey() {
+    static Mutex mutex;
+    static auto* known = new std::map<std::string, Bytes>();  // for the process's life
     if (sodium_init() < 0) return std::nullopt;
     std::string path = keyPath();
+    MutexLock lock(mutex);
+    auto it = known->find(path);
+    if (it != known->end()) return it->second;
+    auto key = readOrMakeKey(path);
+    if (key) known->emplace(path, *key);
+    return key;
+}
+
+// The user's secret key, made on first use. Two processes making it at once agree: the file is
+// created exclusively and the loser reads the winner's.
+std::optional<Bytes> readOrMakeKey(const std::string& path) {
     for (int attempt = 0; attempt < 2; ++attempt) {
         int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
         if (fd >= 0) {
