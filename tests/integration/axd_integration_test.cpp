@@ -438,6 +438,13 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     std::string other = axtest::makeBundle(d.root.path(), "Other.app", axtest::appInfo("com.example.other"), "/bin/true");
     plugIn(other, "New", "com.example.one", "1.10", dict({}));
     plugIn(other, "Replacer", "com.example.replacer", "1", dict({{"com.corvane.developer.replace-plugin", "com.example.two"}}));
+    // Dedicated to its own application: a host outside it (axctl is in no bundle) never sees it.
+    std::string dedicated = axtest::makeBundle(
+        other + "/PlugIns", "Own.appex",
+        axtest::plugInInfo("com.example.own", dict({{"KSExtensionProtocol", "P"},
+                                                    {"Dedicated", true},
+                                                    {"KSExtensionAttributes", dict({{"KSExtensionVersion", "1"}})}})),
+        "/bin/true");
     ASSERT_EQ(d.axctl({"add", app, other}).status, 0);
 
     auto identifiers = [](const Value& reply) {
@@ -527,6 +534,7 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("rule KSExtensionIdentifier does not match"), std::string::npos)
         << explained.out;
     EXPECT_NE(line(other + "/PlugIns/Replacer.appex").find("excluded by the user"), std::string::npos) << explained.out;
+    EXPECT_NE(line(dedicated).find("dedicated to another application"), std::string::npos) << explained.out;
     explained = d.axctl({"match", "--explain", "--system-only"});
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("not on the system volume"), std::string::npos) << explained.out;
     explained = d.axctl({"match", "--explain"}, {}, restricted);
