@@ -14,8 +14,8 @@ namespace annexa {
 
 class AXDRpxClient;
 
-// Thread-safe: the registry record is set once, before the record is published; the three name
-// caches are replaced whole under a lock.
+// Thread-safe: the registry record and the three name caches are replaced whole under one lock, and
+// readers take their own reference.
 class AXDPlugIn : public AXPlugInCore {
 public:
     // A record for the registry's record, or null: no bundle location, no identifier, or a
