@@ -1,6 +1,7 @@
 // Connection: the public face of one connection (docs/rpx-wire.md).
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <fcntl.h>
 
 #include <atomic>
 #include <chrono>
@@ -43,17 +44,37 @@ std::shared_ptr<Connection> Connection::connect(const std::string& name, dispatc
             std::this_thread::sleep_for(std::chrono::milliseconds(5));
         ok = rc == 0;
     }
-    PeerIdentity peer;
-    if (ok) {
-        peer = identityOfSocket(fd);
-    } else if (fd >= 0) {
+    if (!ok && fd >= 0) {
         ::close(fd);
         fd = -1;
     }
-    auto impl = std::make_shared<Impl>(fd, std::move(queue), kDefaultClientMaxFrame);
+    return open(fd, std::move(queue), kDefaultClientMaxFrame);
+}
+
+std::shared_ptr<Connection> Connection::adopt(std::shared_ptr<FileDescriptor> socket,
+                                              dispatch::QueuePtr queue, size_t maxFrameSize) {
+    int fd = socket ? socket->release() : -1;
+    if (fd >= 0) {
+        int flags = ::fcntl(fd, F_GETFL);
+        int type = 0;
+        socklen_t length = sizeof type;
+        bool stream = ::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &length) == 0 && type == SOCK_STREAM;
+        if (flags < 0 || !stream || ::fcntl(fd, F_SETFL, flags | O_NONBLOCK) != 0 ||
+            ::fcntl(fd, F_SETFD, FD_CLOEXEC) != 0) {
+            ::close(fd);
+            fd = -1;
+        }
+    }
+    return open(fd, std::move(queue), maxFrameSize);
+}
+
+std::shared_ptr<Connection> Connection::open(int fd, dispatch::QueuePtr queue, size_t maxFrameSize) {
+    PeerIdentity peer;
+    if (fd >= 0) peer = identityOfSocket(fd);
+    auto impl = std::make_shared<Impl>(fd, std::move(queue), maxFrameSize);
     impl->peerPid = peer.pid;
     auto connection = std::shared_ptr<Connection>(new Connection(impl, std::move(peer)));
-    if (ok) {
+    if (fd >= 0) {
         impl->start();
     } else {
         MutexLock lock(impl->mutex);

@@ -122,6 +122,13 @@ public:
     // "connection invalid" and every send gets that error.
     static std::shared_ptr<Connection> connect(const std::string& name, dispatch::QueuePtr queue);
 
+    // Adopts a connected stream socket (one end of a socketpair, or a descriptor received in a
+    // message) as a connection, suspended like one that connect() made. The peer's identity is
+    // what the kernel says of the socket: for a socketpair, the process that made the pair. A
+    // descriptor that is not a stream socket gives a connection that is invalid at once.
+    static std::shared_ptr<Connection> adopt(std::shared_ptr<FileDescriptor> socket, dispatch::QueuePtr queue,
+                                             size_t maxFrameSize = kDefaultListenerMaxFrame);
+
     ~Connection();
     Connection(const Connection&) = delete;
     Connection& operator=(const Connection&) = delete;
@@ -163,6 +170,7 @@ private:
     friend class Listener;
     friend struct Impl;
     Connection(std::shared_ptr<Impl> impl, PeerIdentity peer);
+    static std::shared_ptr<Connection> open(int fd, dispatch::QueuePtr queue, size_t maxFrameSize);
 
     std::shared_ptr<Impl> impl_;
     PeerIdentity peer_;

@@ -1,0 +1,72 @@
+// spawnd: the per-user service manager that runs plug-ins for their hosts in sandboxes, with the
+// process-assertion service, the sandbox token broker and privacy consent (docs/spawnd.md).
+#include <signal.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+#include <vector>
+
+#include "platform/log/Log.h"
+#include "platform/spawn/Daemon.h"
+#include "tools/cli/Cli.h"
+
+using namespace corvane;
+
+namespace {
+
+constexpr const char* kTool = "spawnd";
+constexpr const char* kUsage =
+    "usage: spawnd [--grace-ms MS] [--idle-ms MS] [--accept-timeout-ms MS]\n"
+    "Serves com.corvane.spawnd, com.corvane.vigild, com.corvane.sandbox and com.corvane.pcx until\n"
+    "SIGTERM or SIGINT, then ends the plug-in instances it runs.\n";
+
+bool readMilliseconds(const cli::Parsed& parsed, const char* option, std::chrono::milliseconds& out) {
+    auto text = parsed.value(option);
+    if (!text) return true;
+    char* end = nullptr;
+    long long value = std::strtoll(text->c_str(), &end, 10);
+    if (text->empty() || *end != '\0' || value < 0 || value > 86'400'000) return false;
+    out = std::chrono::milliseconds(value);
+    return true;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    log::setStandardErrorFallback(true);
+    const cli::Syntax syntax{"[--grace-ms MS] [--idle-ms MS] [--accept-timeout-ms MS]", {},
+                             {"--grace-ms", "--idle-ms", "--accept-timeout-ms"}, 0, 0};
+    std::vector<std::string> args(argv + 1, argv + argc);
+    for (const std::string& arg : args) {
+        if (arg == "--help") {
+            std::fputs(kUsage, stdout);
+            return cli::kSuccess;
+        }
+    }
+    auto outcome = cli::parse(kTool, syntax, args);
+    if (!outcome.parsed) return outcome.exitStatus;
+    spawn::Options options;
+    if (!readMilliseconds(*outcome.parsed, "--grace-ms", options.grace) ||
+        !readMilliseconds(*outcome.parsed, "--idle-ms", options.idle) ||
+        !readMilliseconds(*outcome.parsed, "--accept-timeout-ms", options.acceptTimeout)) {
+        return cli::usageError(kTool, "a time must be a whole number of milliseconds", syntax.usage);
+    }
+
+    // Before any thread starts, so that the signals reach only the wait below.
+    sigset_t stopSignals;
+    sigemptyset(&stopSignals);
+    sigaddset(&stopSignals, SIGTERM);
+    sigaddset(&stopSignals, SIGINT);
+    pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+
+    auto daemon = spawn::Daemon::start(options);
+    if (!daemon) return cli::fail(kTool, daemon.error().description(), cli::kUnavailable);
+    log::info(log::defaultLog(), "spawnd is serving");
+    int received = 0;
+    sigwait(&stopSignals, &received);
+    log::info(log::defaultLog(), "spawnd is stopping");
+    daemon->reset();
+    return cli::kSuccess;
+}
