@@ -204,6 +204,8 @@ TEST(Spawnd, APlugInRunsConfinedByItsProfile) {
     };
     for (const Row& row : rows) EXPECT_EQ(session.errnoOf(row.message), row.expected) << row.what;
     EXPECT_FALSE(fs::exists("/tmp/annexa-sandbox-escape"));
+    EXPECT_EQ(session.send(dict({{"do", "confined"}})),
+              dict({{"unshare", int64_t{EPERM}}, {"clone", int64_t{EPERM}}, {"ptrace", int64_t{EPERM}}, {"setsid", int64_t{EPERM}}}));
 
     // One instance per host and plug-in: a second connection reaches the same process.
     Session again("com.example.plugin");

@@ -92,8 +92,9 @@ constexpr int kDeniedCalls[] = {
     SCMP_SYS(bpf), SCMP_SYS(swapon), SCMP_SYS(swapoff), SCMP_SYS(acct),
     SCMP_SYS(setsid), SCMP_SYS(setpgid),
 };
+// (CLONE_NEWTIME only exists for clone3 and unshare: in clone's flags its bit is the exit signal's.)
 constexpr uint64_t kNamespaceFlags = CLONE_NEWNS | CLONE_NEWUTS | CLONE_NEWIPC | CLONE_NEWUSER | CLONE_NEWPID |
-                                     CLONE_NEWNET | CLONE_NEWCGROUP | CLONE_NEWTIME;
+                                     CLONE_NEWNET | CLONE_NEWCGROUP;
 
 Result<std::vector<sock_filter>> compileFilter(const Profile& profile) {
     scmp_filter_ctx ctx = seccomp_init(SCMP_ACT_ALLOW);
@@ -106,14 +107,18 @@ Result<std::vector<sock_filter>> compileFilter(const Profile& profile) {
     // libraries fall back to clone, whose flags the filter sees.
     if (rc == 0) rc = seccomp_rule_add(ctx, SCMP_ACT_ERRNO(ENOSYS), SCMP_SYS(clone3), 0);
     if (rc == 0) {
-        rc = seccomp_rule_add(ctx, SCMP_ACT_ERRNO(EPERM), SCMP_SYS(clone), 1,
-                              SCMP_A0(SCMP_CMP_MASKED_EQ, kNamespaceFlags, kNamespaceFlags) );
+        // Any namespace flag: the masked flags are not zero.
+        for (uint64_t flag = 1; flag != 0; flag <<= 1) {
+            if (!(kNamespaceFlags & flag) || rc != 0) continue;
+            scmp_arg_cmp withFlag{0, SCMP_CMP_MASKED_EQ, flag, flag};
+            rc = seccomp_rule_add_array(ctx, SCMP_ACT_ERRNO(EPERM), SCMP_SYS(clone), 1, &withFlag);
+        }
     }
     if (!profile.inetSockets) {
         for (int family : {AF_INET, AF_INET6}) {
             if (rc == 0) {
-                rc = seccomp_rule_add(ctx, SCMP_ACT_ERRNO(EACCES), SCMP_SYS(socket), 1,
-                                      SCMP_A0(SCMP_CMP_EQ, static_cast<scmp_datum_t>(family)));
+                scmp_arg_cmp ofFamily{0, SCMP_CMP_EQ, static_cast<scmp_datum_t>(family), 0};
+                rc = seccomp_rule_add_array(ctx, SCMP_ACT_ERRNO(EACCES), SCMP_SYS(socket), 1, &ofFamily);
             }
         }
     }

@@ -8,13 +8,19 @@
 //   {"do": "busy", "reason": R}     take a busy assertion: {"assertion": id}
 //   {"do": "unbusy", "assertion": id}
 //   {"do": "fork"}                  start a child that sleeps: {"child": pid}
+//   {"do": "confined"}              try what every sandbox forbids: {"unshare": errno, "clone": errno,
+//                                   "ptrace": errno, "setsid": errno}
 //   {"do": "environment"}           {"environment": {...}, "directory": working directory}
 //   {"do": "exit", "status": N}     exit at once, without a reply
 // SAMPLE_AT_START in its environment ("crash", "hang" or "exit") makes it fail before serving.
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
+#include <sched.h>
 #include <signal.h>
+#include <sys/ptrace.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -69,6 +75,19 @@ Value environment() {
     return dict({{"environment", Value(std::move(variables))}, {"directory", std::string(directory)}});
 }
 
+// What no sandbox profile allows; each outcome an errno value (0 when it was allowed).
+Value confined() {
+    auto outcome = [](long rc) { return Value(int64_t{rc < 0 ? errno : 0}); };
+    Value unshared = outcome(::unshare(CLONE_NEWUSER));
+    long child = ::syscall(SYS_clone, CLONE_NEWUSER | SIGCHLD, nullptr, nullptr, nullptr, 0);
+    if (child == 0) ::_exit(0);
+    if (child > 0) ::waitpid(static_cast<pid_t>(child), nullptr, 0);
+    Value cloned = outcome(child);
+    Value traced = outcome(::ptrace(PTRACE_ATTACH, ::getppid(), nullptr, nullptr));
+    Value session = outcome(::setsid());
+    return dict({{"unshare", unshared}, {"clone", cloned}, {"ptrace", traced}, {"setsid", session}});
+}
+
 Value answer(const Value& message) {
     const std::string* action = message["do"].asString();
     if (!action) {
@@ -104,12 +123,17 @@ Value answer(const Value& message) {
         return dict({{"child", int64_t{child}}});
     }
     if (*action == "environment") return environment();
+    if (*action == "confined") return confined();
     if (*action == "exit") ::_exit(static_cast<int>(message["status"].int64Value().value_or(0)));
     return dict({{"error", "unknown action " + *action}});
 }
 
 void failAtStart(const char* how) {
-    if (std::strcmp(how, "crash") == 0) ::raise(SIGSEGV);
+    if (std::strcmp(how, "crash") == 0) {
+        // A crash as the kernel reports it, whatever handler a sanitizer put in place.
+        ::signal(SIGSEGV, SIG_DFL);
+        ::raise(SIGSEGV);
+    }
     if (std::strcmp(how, "exit") == 0) ::_exit(3);
     if (std::strcmp(how, "hang") == 0) {
         for (;;) ::pause();
