@@ -12,6 +12,7 @@
 #include <filesystem>
 
 #include "Annexa/AXPlugInRuntime.h"
+#include "Annexa/c/annexa.h"
 #include "platform/codesign/CodeSign.h"
 #include "platform/pcx/Pcx.h"
 #include "platform/sandbox/Sandbox.h"
@@ -207,9 +208,19 @@ TEST(Spawnd, APlugInRunsConfinedByItsProfile) {
     EXPECT_EQ(session.send(dict({{"do", "confined"}})),
               dict({{"unshare", int64_t{EPERM}}, {"clone", int64_t{EPERM}}, {"ptrace", int64_t{EPERM}}, {"setsid", int64_t{EPERM}}}));
 
-    // One instance per host and plug-in: a second connection reaches the same process.
-    Session again("com.example.plugin");
-    EXPECT_EQ(again.pid(), session.pid());
+    // One instance per host and plug-in: a host that connects in a loop reaches the same process
+    // every time, and a connection it drops is dropped by the plug-in too.
+    pid_t pid = session.pid();
+    for (int i = 0; i < 100; ++i) {
+        Session again("com.example.plugin");
+        ASSERT_EQ(again.pid(), pid) << i;
+    }
+    auto open = [pid] {
+        size_t count = 0;
+        for ([[maybe_unused]] auto& entry : fs::directory_iterator("/proc/" + std::to_string(pid) + "/fd")) ++count;
+        return count;
+    };
+    EXPECT_TRUE(axtest::eventually([&] { return open() < 20; })) << open() << " descriptors open in the plug-in";
 }
 
 TEST(Spawnd, EachProfileGrantsWhatItNames) {
@@ -396,4 +407,37 @@ TEST(Spawnd, HostsTheTokenBrokerAndConsentAndStopsItsInstancesOnSigterm) {
     d.daemon->signal(SIGTERM);
     EXPECT_EQ(d.daemon->wait(std::chrono::seconds(10)), 0);
     EXPECT_TRUE(processGone(pid));
+}
+
+TEST(Spawnd, APlugInAndAHostWrittenInCTalkThroughTheLibrary) {
+    Spawnd d;
+    // The plug-in brings its copy of the library in its bundle.
+    fs::create_directories(d.root / "apps/C.app/PlugIns");
+    std::string bundle = axtest::makeBundle(d.root / "apps/C.app/PlugIns", "Echo.appex",
+                                            axtest::plugInInfo("com.example.c-echo", dict({}), "echo"),
+                                            axtest::binary("annexa_c_plugin"));
+    fs::copy_file(axtest::binary("../lib/libannexa.so.1"), bundle + "/libannexa.so.1");
+    ASSERT_EQ(d.add(::getpid(), bundle + "/echo", d.overlay("plugin", "")), 0);
+
+    char* error = nullptr;
+    annexa_plugin* plugin = annexa_plugin_connect("com.example.c-echo", &error);
+    ASSERT_NE(plugin, nullptr) << (error ? error : "");
+    char* reply = nullptr;
+    EXPECT_EQ(annexa_plugin_send(plugin, "{\"n\": 1}", &reply, &error), 0);
+    EXPECT_STREQ(reply, "{\"echo\": {\"n\": 1}}");
+    annexa_free(reply);
+    EXPECT_EQ(annexa_plugin_send(plugin, "\"busy\"", &reply, &error), 0);
+    annexa_free(reply);
+    auto busy = spawn::busyExtensionInstances({"com.example.c-echo"});
+    ASSERT_TRUE(busy);
+    ASSERT_EQ(busy->size(), 1u);
+    EXPECT_EQ((*busy)[0]["reason"], Value("written in C"));
+    EXPECT_EQ(annexa_plugin_send(plugin, "{", &reply, &error), ANNEXA_EINVAL);
+    EXPECT_NE(std::string(error).find("at offset 1"), std::string::npos) << error;
+    annexa_free(error);
+    annexa_plugin_close(plugin);
+
+    EXPECT_EQ(annexa_plugin_connect("com.example.unregistered", &error), nullptr);
+    EXPECT_NE(std::string(error).find("no service com.example.unregistered"), std::string::npos) << error;
+    annexa_free(error);
 }

@@ -9,6 +9,11 @@
 #include <vector>
 
 #include "Annexa/AXDaemonClient.h"
+#include "Annexa/AXPlugInRuntime.h"
+
+struct annexa_plugin {
+    corvane::rpx::ConnectionPtr connection;
+};
 
 struct annexa_client {
     annexa::AXDaemonClient client;
@@ -96,6 +101,61 @@ int64_t annexa_match(annexa_client* client, const char* rules, uint64_t flags, c
     *matches = copyText(found.isNull() ? corvane::Value(corvane::Array{}).description() : found.description());
     return 0;
 }
+
+annexa_plugin* annexa_plugin_connect(const char* bundle_identifier, char** error_text) {
+    if (!bundle_identifier) {
+        report(ANNEXA_EINVAL, "invalid argument", error_text);
+        return nullptr;
+    }
+    auto connection = annexa::connectToPlugIn(bundle_identifier, corvane::dispatch::Queue::create("annexa_plugin"),
+                                              [](const corvane::rpx::Event&) {});
+    if (!connection) {
+        report(ANNEXA_EUNREACHABLE, connection.error().description(), error_text);
+        return nullptr;
+    }
+    report(0, {}, error_text);
+    return new annexa_plugin{*connection};
+}
+
+int64_t annexa_plugin_send(annexa_plugin* plugin, const char* message, char** reply, char** error_text) {
+    if (reply) *reply = nullptr;
+    if (!plugin || !message || !reply) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    auto value = corvane::Value::parseReporting(message);
+    if (!value) return report(ANNEXA_EINVAL, "not one value in the text notation: " + value.error().description(), error_text);
+    Reply r = plugin->connection->sendWithReplySync(*value);
+    if (!r.ok()) return report(ANNEXA_EUNREACHABLE, "the plug-in's connection ended: " + r.description(), error_text);
+    *reply = copyText(r.value.description());
+    return report(0, {}, error_text);
+}
+
+void annexa_plugin_close(annexa_plugin* plugin) {
+    if (!plugin) return;
+    plugin->connection->cancel();
+    delete plugin;
+}
+
+int64_t annexa_plugin_run(annexa_plugin_handler handler, void* context) {
+    if (!handler) return ANNEXA_EINVAL;
+    int served = annexa::AXPlugInRuntime::run([handler, context](const corvane::rpx::ConnectionPtr& host,
+                                                                 const corvane::rpx::Event& ev) {
+        char* answer = handler(ev.message.description().c_str(), context);
+        corvane::Value reply = corvane::Value(corvane::Dictionary{});
+        if (answer) {
+            // A reply the handler wrote badly is an error for the host, not silence.
+            auto parsed = corvane::Value::parseReporting(answer);
+            reply = parsed ? *parsed : corvane::dict({{"error", "the plug-in's reply is not one value: " + parsed.error().description()}});
+            std::free(answer);
+        }
+        if (ev.wantsReply) host->sendReply(ev.messageId, reply);
+    });
+    return served == 0 ? 0 : ANNEXA_EINVAL;
+}
+
+uint64_t annexa_plugin_begin_busy(const char* reason) {
+    return annexa::AXPlugInRuntime::beginBusy(reason ? reason : "busy");
+}
+
+void annexa_plugin_end_busy(uint64_t assertion) { annexa::AXPlugInRuntime::endBusy(assertion); }
 
 void annexa_log_to_stderr(int enabled) { corvane::log::setStandardErrorFallback(enabled != 0); }
 

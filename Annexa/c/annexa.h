@@ -66,6 +66,31 @@ void annexa_log_to_stderr(int enabled);
  * "path" and the rest of docs/discovery.md. */
 int64_t annexa_match(annexa_client* client, const char* rules, uint64_t flags, char** matches, char** error_text);
 
+/* ---- Running plug-ins (docs/spawnd.md) */
+
+/* A host's connection to a running instance of a plug-in. */
+typedef struct annexa_plugin annexa_plugin;
+
+/* Connects to an instance of the plug-in with this bundle identifier, which axd got ready for this
+ * process; the service manager spawnd starts it when it is not running. Null on failure, with the
+ * reason (spawnd's, e.g. that the plug-in crashed before accepting) in `error_text`. */
+annexa_plugin* annexa_plugin_connect(const char* bundle_identifier, char** error_text);
+/* Sends one message in the text notation to the plug-in and waits for its reply, which `reply`
+ * receives in the notation. ANNEXA_EUNREACHABLE when the plug-in's connection ended. */
+int64_t annexa_plugin_send(annexa_plugin* plugin, const char* message, char** reply, char** error_text);
+void annexa_plugin_close(annexa_plugin* plugin);
+
+/* The plug-in's side. The handler receives each message from a host in the text notation and
+ * returns the reply in the notation, allocated with malloc (the library frees it), or null to reply
+ * {}. Handlers run one at a time, on a thread of the library. */
+typedef char* (*annexa_plugin_handler)(const char* message, void* context);
+/* Serves host connections until spawnd ends the instance, then returns 0; ANNEXA_EINVAL at once when
+ * this process was not launched by spawnd. */
+int64_t annexa_plugin_run(annexa_plugin_handler handler, void* context);
+/* Busy assertions: while one is held, the instance is reported busy with its reason. */
+uint64_t annexa_plugin_begin_busy(const char* reason);
+void annexa_plugin_end_busy(uint64_t assertion);
+
 /* Releases text returned by this interface. */
 void annexa_free(void* text);
 
