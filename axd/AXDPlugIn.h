@@ -5,6 +5,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 
 #include "Annexa/AXPlugInCore.h"
@@ -72,6 +73,19 @@ public:
     // restricting entitlement (a pattern dictionary) is tested first, then the plug-in's
     // "KSExtensionHostEntitlement".
     std::optional<std::string> allowForClient(const AXDRpxClient& client) const;
+    // `allowedPCXServices`: the privacy-consent services granted to the plug-in's containing
+    // application; empty when there are none or they cannot be learnt.
+    std::set<std::string> allowedPCXServices() const;
+
+    // ---- activation (AXDPlugInActivation.cpp; docs/spawnd.md)
+
+    // The sandbox profile the plug-in runs under, by its extension point.
+    std::string sandboxProfile() const;
+    // `enableForClient:`: registers the plug-in's executable with the service manager for the
+    // host, with its activation overlay. An error of code 4 when that fails.
+    Status enableForClient(const AXDRpxClient& client) const;
+    // `checkBusy`: {"bundleIdentifier": ID} when a process of the plug-in is busy, else nothing.
+    std::optional<Value> checkBusy() const;
 
     // The registry record, replaced whole; readers get their own reference.
     corvane::vantry::PlugInRecordPtr vtproxy() const;

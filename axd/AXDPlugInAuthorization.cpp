@@ -1,6 +1,8 @@
 // Whether a connected host may use a plug-in.
 #include "axd/AXDPlugIn.h"
 #include "axd/AXDRpxClient.h"
+#include "platform/bundle/Bundle.h"
+#include "platform/pcx/Pcx.h"
 
 namespace annexa {
 
@@ -18,6 +20,28 @@ std::optional<std::string> AXDPlugIn::allowForClient(const AXDRpxClient& client)
             return corvane::log::formatText("the host does not have the \"%@\" entitlement", required);
     }
     return std::nullopt;
+}
+
+std::set<std::string> AXDPlugIn::allowedPCXServices() const {
+    std::set<std::string> services;
+    auto container = containingUrl();
+    if (!container) return services;
+    auto bundle = corvane::bundle::Bundle::openPath(*container);
+    if (!bundle) {
+        corvane::log::info(logOps(), "failed to create bundle for %@", url());
+        return services;
+    }
+    bundle->flush();
+    auto records = corvane::pcx::consentInformationForBundle(*container);
+    if (!records) {
+        corvane::log::info(logOps(), "PCXAccessCopyInformationForBundle failed for %@", bundle->description());
+        return services;
+    }
+    for (const Value& record : *records) {
+        const std::string* service = record[corvane::pcx::kServiceKey].asString();
+        if (service && record[corvane::pcx::kGrantedKey].isTrue()) services.insert(*service);
+    }
+    return services;
 }
 
 }  // namespace annexa

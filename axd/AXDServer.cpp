@@ -4,6 +4,7 @@
 
 #include "axd/AXDRpxClient.h"
 #include "platform/notify/Notify.h"
+#include "platform/spawn/Spawn.h"
 
 namespace annexa {
 
@@ -119,11 +120,24 @@ size_t AXDServer::holdCount() {
 }
 
 void AXDServer::removedPlugIns(const std::vector<corvane::vantry::PlugInRecordPtr>& records) {
-    // Ending the processes of uninstalled plug-ins is the service manager's work; until the
-    // daemon talks to one, it records what it would ask.
+    // The service manager is asked from a queue of its own, so that an unreachable one holds up
+    // neither the registry's events nor requests; the outcome is only logged, on the service queue.
+    static const corvane::dispatch::QueuePtr terminations = corvane::dispatch::Queue::create("spawnd-terminations");
     for (const auto& r : records) {
         log::debug(logOps(), "requesting spawnd termination of plug-in: %s(%s) %{public}@", r->bundleIdentifier(),
                    r->bundleVersion(), r->uuid().string());
+        terminations->async([identifier = r->bundleIdentifier(), version = r->bundleVersion(), main = mainQueue_] {
+            int result = corvane::spawn::removeExternalService(identifier, version);
+            main->async([result] {
+                if (result == 0) {
+                    log::debug(logOps(), "spawnd reported plug-ins have been terminated");
+                } else if (result == corvane::spawn::kNothingOnRecord) {
+                    log::debug(logOps(), "spawnd reported no plug-ins on record");
+                } else {
+                    log::info(logOps(), "spawnd error attempting to terminate plug-ins: error=%d", result);
+                }
+            });
+        });
     }
 }
 

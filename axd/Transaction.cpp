@@ -19,15 +19,18 @@ namespace {
 
 using Handler = void (Transaction::*)();
 
-// Tested in this order, by exact, case-sensitive comparison. Requests whose handlers are not part
-// of this daemon yet ("ready", "access", "lock", "receipt") are not in the table.
+// Tested in this order, by exact, case-sensitive comparison.
 const std::pair<const char*, Handler> kRequests[] = {
     {request::kAdd, &Transaction::addPlugIns},
     {request::kRemove, &Transaction::removePlugIns},
     {request::kBulk, &Transaction::bulkPlugIns},
+    {request::kReady, &Transaction::readyPlugIns},
+    {request::kAccess, &Transaction::accessPlugIns},
     {request::kMatch, &Transaction::matchPlugIns},
     {request::kAnnotate, &Transaction::annotatePlugIns},
     {request::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
+    {request::kLock, &Transaction::lockDownPlugIns},
+    {request::kReceipt, &Transaction::fetchReceipt},
 };
 
 }  // namespace

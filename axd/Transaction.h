@@ -53,6 +53,10 @@ public:
     void annotatePlugIns();
     void bulkAnnotatePlugIns();
     void matchPlugIns();
+    void readyPlugIns();
+    void accessPlugIns();
+    void lockDownPlugIns();
+    void fetchReceipt();
 
     const std::shared_ptr<AXDRpxClient>& client() const { return client_; }
     const Value& request() const { return request_.message; }

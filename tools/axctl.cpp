@@ -1,14 +1,21 @@
 // axctl: talks to axd. `send` is the raw form (any message in the text notation); the other
 // commands are friendly forms of the requests. See docs/axctl.md and docs/tools.md.
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/signalfd.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <iostream>
 #include <iterator>
 #include <string>
 #include <vector>
 
 #include "Annexa/AXDaemonClient.h"
+#include "Annexa/AXPlugInRuntime.h"
 #include "platform/log/Log.h"
 #include "platform/plist/Plist.h"
 #include "platform/vantry/Vantry.h"
@@ -35,6 +42,12 @@ const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN]... [--rules FI
                          0,
                          0};
 
+const cli::Syntax kReady{"[-S servicename] ready UUID...", {}, {}, 1};
+const cli::Syntax kAccess{"[-S servicename] access [--json] UUID...", {"--json"}, {}, 1};
+const cli::Syntax kLock{"[-S servicename] lock --apps|--plugins [--json] PATH...", {"--apps", "--plugins", "--json"}, {}, 0};
+const cli::Syntax kUnlock{"[-S servicename] unlock TOKEN...", {}, {}, 1};
+const cli::Syntax kRun{"[-S servicename] run [--keep] UUID [MESSAGE]", {"--keep"}, {}, 1, 2};
+
 const char* kHelp =
     "usage: axctl [-S servicename] COMMAND [ARGS]\n"
     "  send [FILE]                                  send one message written in the text notation\n"
@@ -49,6 +62,14 @@ const char* kHelp =
     "        [--system-only] [--all] [--explain] [--json]\n"
     "                                               the plug-ins that fit; --explain says why\n"
     "                                               each installed plug-in was left out\n"
+    "  ready UUID...                                get plug-ins ready for this process\n"
+    "  access [--json] UUID...                      read tokens for the plug-ins' bundles\n"
+    "  lock --apps|--plugins [--json] PATH...       hold plug-ins (of applications, or themselves);\n"
+    "                                               prints the hold's token\n"
+    "  unlock TOKEN...                              release holds\n"
+    "  run [--keep] UUID [MESSAGE]                  ready a plug-in, connect to it through spawnd,\n"
+    "                                               send MESSAGE (default {}) and print the reply;\n"
+    "                                               --keep stays connected until standard input ends\n"
     "The service name defaults to com.corvane.annexa.axd. COMMAND --help shows one command's usage.\n"
     "Exit status: 0 success, 1 the daemon refused (its error text on standard error), 64 usage,\n"
     "65 unreadable input, 69 daemon not reachable, 77 refused for lack of an entitlement.\n"
@@ -209,6 +230,126 @@ int match(const std::string& service, const cli::Parsed& p) {
     return cli::kSuccess;
 }
 
+bool readUuids(const std::vector<std::string>& texts, std::vector<corvane::UUID>& uuids) {
+    for (const auto& text : texts) {
+        auto uuid = corvane::UUID::parse(text);
+        if (!uuid) return false;
+        uuids.push_back(*uuid);
+    }
+    return true;
+}
+
+int ready(const std::string& service, const cli::Parsed& p) {
+    std::vector<corvane::UUID> uuids;
+    if (!readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID among the operands", kReady.usage);
+    AXDaemonClient client(service);
+    return finish(client.wait([&](auto done) { client.readyPlugIns(uuids, 0, done); }), service);
+}
+
+int access(const std::string& service, const cli::Parsed& p) {
+    std::vector<corvane::UUID> uuids;
+    if (!readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID among the operands", kAccess.usage);
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.accessPlugIns(uuids, 0, done); });
+    if (int status = finish(reply, service); status != cli::kSuccess) return status;
+    const Value& tokens = reply.value[annexa::message::kExtensions];
+    if (p.has("--json")) {
+        std::printf("%s\n", tokens.json().c_str());
+    } else if (const corvane::Array* list = tokens.asArray()) {
+        for (const Value& token : *list) std::printf("%s\n", token.asString() ? token.asString()->c_str() : "");
+    }
+    return cli::kSuccess;
+}
+
+int lock(const std::string& service, const cli::Parsed& p) {
+    if (p.has("--apps") == p.has("--plugins")) return cli::usageError(kTool, "give one of --apps and --plugins", kLock.usage);
+    std::vector<std::string> paths;
+    for (const auto& path : p.operands) paths.push_back(absolute(path));
+    uint64_t flags = p.has("--apps") ? 1 : 2;
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.holdPlugIns(paths, flags, done); });
+    if (p.has("--json")) {
+        std::printf("%s\n", reply.value.json().c_str());
+    } else if (const corvane::Array* conflicts = reply.value[annexa::message::kConflicts].asArray()) {
+        for (const Value& conflict : *conflicts) std::printf("busy: %s\n", conflict.description().c_str());
+    }
+    if (int status = finish(reply, service); status != cli::kSuccess) return status;
+    const corvane::UUID* token = reply.value[annexa::message::kUuids].asUUID();
+    if (!p.has("--json")) std::printf("%s\n", token ? token->string().c_str() : "");
+    return cli::kSuccess;
+}
+
+int unlock(const std::string& service, const cli::Parsed& p) {
+    std::vector<corvane::UUID> tokens;
+    if (!readUuids(p.operands, tokens)) return cli::usageError(kTool, "not a UUID among the operands", kUnlock.usage);
+    AXDaemonClient client(service);
+    for (const corvane::UUID& token : tokens) {
+        if (int status = finish(client.wait([&](auto done) { client.releaseHold(token, done); }), service)) return status;
+    }
+    return cli::kSuccess;
+}
+
+// Waits until standard input ends, a stop signal comes, or the plug-in's connection ends; the
+// exit status says which.
+int keepConnected(int ended) {
+    sigset_t stops;
+    sigemptyset(&stops);
+    sigaddset(&stops, SIGINT);
+    sigaddset(&stops, SIGTERM);
+    int signals = signalfd(-1, &stops, SFD_CLOEXEC);
+    pollfd watched[3] = {{0, POLLIN, 0}, {signals, POLLIN, 0}, {ended, POLLIN, 0}};
+    for (;;) {
+        if (::poll(watched, 3, -1) < 0 && errno != EINTR) return cli::kFailure;
+        if (watched[2].revents) return cli::fail(kTool, "the plug-in's connection ended", cli::kUnavailable);
+        if (watched[1].revents) return cli::kSuccess;
+        if (watched[0].revents) {
+            char buffer[256];
+            if (::read(0, buffer, sizeof buffer) <= 0) return cli::kSuccess;
+        }
+    }
+}
+
+int run(const std::string& service, const cli::Parsed& p) {
+    auto uuid = corvane::UUID::parse(p.operands[0]);
+    if (!uuid) return cli::usageError(kTool, "not a UUID: " + p.operands[0], kRun.usage);
+    Value message{annexa::Dictionary{}};
+    if (p.operands.size() > 1) {
+        auto parsed = Value::parseReporting(p.operands[1]);
+        if (!parsed) return cli::fail(kTool, "MESSAGE " + parsed.error().description(), cli::kDataError);
+        message = *parsed;
+    }
+    if (p.has("--keep")) {
+        // Before any thread starts, so that the signals reach only the wait.
+        sigset_t stops;
+        sigemptyset(&stops);
+        sigaddset(&stops, SIGINT);
+        sigaddset(&stops, SIGTERM);
+        pthread_sigmask(SIG_BLOCK, &stops, nullptr);
+    }
+    auto registry = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
+    auto record = registry ? (*registry)->plugInForUUID(*uuid) : nullptr;
+    if (!record) return cli::fail(kTool, "no plug-in with the UUID " + uuid->string(), cli::kDataError);
+    AXDaemonClient client(service);
+    if (int status = finish(client.wait([&](auto done) { client.readyPlugIns({*uuid}, 0, done); }), service)) return status;
+
+    int ended[2];
+    if (::pipe2(ended, O_CLOEXEC) != 0) return cli::fail(kTool, "pipe: " + std::string(std::strerror(errno)));
+    int endedWrite = ended[1];
+    auto connection = annexa::connectToPlugIn(record->bundleIdentifier(), corvane::dispatch::Queue::create("axctl.run"),
+                                              [endedWrite](const corvane::rpx::Event& ev) {
+        if (ev.isError()) {
+            [[maybe_unused]] ssize_t n = ::write(endedWrite, "x", 1);
+        }
+    });
+    if (!connection) return cli::fail(kTool, "cannot connect to the plug-in: " + connection.error().description(), cli::kUnavailable);
+    corvane::rpx::Reply reply = (*connection)->sendWithReplySync(message);
+    if (!reply.ok()) return cli::fail(kTool, "the plug-in's connection ended before it replied", cli::kUnavailable);
+    std::printf("%s\n", reply.value.description().c_str());
+    std::fflush(stdout);
+    if (!p.has("--keep")) return cli::kSuccess;
+    return keepConnected(ended[0]);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -230,6 +371,11 @@ int main(int argc, char** argv) {
         {"annotate", kAnnotate, with(annotate)},
         {"bulk-annotate", kBulkAnnotate, with(bulkAnnotate)},
         {"match", kMatch, with(match)},
+        {"ready", kReady, with(ready)},
+        {"access", kAccess, with(access)},
+        {"lock", kLock, with(lock)},
+        {"unlock", kUnlock, with(unlock)},
+        {"run", kRun, with(run)},
     };
     return cli::runCommand(kTool, kHelp, commands, std::move(args));
 }

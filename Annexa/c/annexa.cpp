@@ -49,6 +49,17 @@ int64_t finish(const AXDaemonClient& client, const Reply& reply, char** errorTex
     return report(0, {}, errorText);
 }
 
+// The UUIDs of texts; ANNEXA_EINVAL (reported) when one is missing or does not parse, else 0.
+int64_t readUuids(const char* const* texts, size_t count, std::vector<corvane::UUID>& out, char** errorText) {
+    if (count > 0 && !texts) return report(ANNEXA_EINVAL, "invalid argument", errorText);
+    for (size_t i = 0; i < count; ++i) {
+        auto uuid = texts[i] ? corvane::UUID::parse(texts[i]) : std::nullopt;
+        if (!uuid) return report(ANNEXA_EINVAL, std::string("not a UUID: ") + (texts[i] ? texts[i] : "(null)"), errorText);
+        out.push_back(*uuid);
+    }
+    return 0;
+}
+
 bool readPaths(const char* const* paths, size_t count, std::vector<std::string>& out) {
     if (!paths && count) return false;
     for (size_t i = 0; i < count; ++i) {
@@ -99,6 +110,63 @@ int64_t annexa_match(annexa_client* client, const char* rules, uint64_t flags, c
     if (code != 0) return code;
     const corvane::Value& found = r.value[annexa::message::kMatches];
     *matches = copyText(found.isNull() ? corvane::Value(corvane::Array{}).description() : found.description());
+    return 0;
+}
+
+int64_t annexa_ready(annexa_client* client, const char* const* uuids, size_t count, char** error_text) {
+    std::vector<corvane::UUID> list;
+    if (!client) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    if (int64_t bad = readUuids(uuids, count, list, error_text)) return bad;
+    AXDaemonClient& c = client->client;
+    return finish(c, c.wait([&](AXDaemonClient::Completion done) { c.readyPlugIns(list, 0, std::move(done)); }), error_text);
+}
+
+int64_t annexa_access(annexa_client* client, const char* const* uuids, size_t count, char** tokens, char** error_text) {
+    std::vector<corvane::UUID> list;
+    if (tokens) *tokens = nullptr;
+    if (!client || !tokens) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    if (int64_t bad = readUuids(uuids, count, list, error_text)) return bad;
+    AXDaemonClient& c = client->client;
+    Reply r = c.wait([&](AXDaemonClient::Completion done) { c.accessPlugIns(list, 0, std::move(done)); });
+    if (int64_t code = finish(c, r, error_text)) return code;
+    *tokens = copyText(r.value[annexa::message::kExtensions].description());
+    return 0;
+}
+
+int64_t annexa_lock(annexa_client* client, const char* const* paths, size_t count, uint64_t flags, char** token,
+                    char** error_text) {
+    std::vector<std::string> list;
+    if (token) *token = nullptr;
+    if (!client || !token || !readPaths(paths, count, list)) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    AXDaemonClient& c = client->client;
+    Reply r = c.wait([&](AXDaemonClient::Completion done) { c.holdPlugIns(list, flags, std::move(done)); });
+    if (int64_t code = finish(c, r, error_text)) return code;
+    const corvane::UUID* hold = r.value[annexa::message::kUuids].asUUID();
+    *token = copyText(hold ? hold->string() : std::string());
+    return 0;
+}
+
+int64_t annexa_unlock(annexa_client* client, const char* token, char** error_text) {
+    std::vector<corvane::UUID> list;
+    if (!client || !token) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    if (int64_t bad = readUuids(&token, 1, list, error_text)) return bad;
+    AXDaemonClient& c = client->client;
+    return finish(c, c.wait([&](AXDaemonClient::Completion done) { c.releaseHold(list[0], std::move(done)); }), error_text);
+}
+
+int64_t annexa_receipt(annexa_client* client, void** bytes, size_t* size, char** error_text) {
+    if (bytes) *bytes = nullptr;
+    if (size) *size = 0;
+    if (!client || !bytes || !size) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    AXDaemonClient& c = client->client;
+    Reply r = c.wait([&](AXDaemonClient::Completion done) { c.copyReceipt(std::move(done)); });
+    if (int64_t code = finish(c, r, error_text)) return code;
+    const corvane::Bytes* data = r.value[annexa::message::kData].asData();
+    size_t n = data ? data->size() : 0;
+    *bytes = std::malloc(n ? n : 1);
+    if (!*bytes) return report(ANNEXA_EINVAL, "out of memory", error_text);
+    if (n) std::memcpy(*bytes, data->data(), n);
+    *size = n;
     return 0;
 }
 
@@ -176,15 +244,9 @@ int64_t annexa_remove(annexa_client* client, const char* const* paths, size_t co
 
 int64_t annexa_annotate(annexa_client* client, const char* const* uuids, size_t count, const char* annotations,
                         char** error_text) {
-    std::vector<std::string> texts;
-    if (!client || !annotations || !readPaths(uuids, count, texts))
-        return report(ANNEXA_EINVAL, "invalid argument", error_text);
     std::vector<corvane::UUID> list;
-    for (const auto& text : texts) {
-        auto uuid = corvane::UUID::parse(text);
-        if (!uuid) return report(ANNEXA_EINVAL, "not a UUID: " + text, error_text);
-        list.push_back(*uuid);
-    }
+    if (!client || !annotations) return report(ANNEXA_EINVAL, "invalid argument", error_text);
+    if (int64_t bad = readUuids(uuids, count, list, error_text)) return bad;
     auto value = corvane::Value::parse(annotations);
     if (!value) return report(ANNEXA_EINVAL, "annotations are not one value in the text notation", error_text);
     AXDaemonClient& c = client->client;

@@ -66,6 +66,21 @@ void annexa_log_to_stderr(int enabled);
  * "path" and the rest of docs/discovery.md. */
 int64_t annexa_match(annexa_client* client, const char* rules, uint64_t flags, char** matches, char** error_text);
 
+/* Gets plug-ins (UUID texts) ready for this process: nothing is enabled unless every one may be
+ * used (not held, the host authorised). */
+int64_t annexa_ready(annexa_client* client, const char* const* uuids, size_t count, char** error_text);
+/* Read tokens for the plug-ins' bundles: `tokens` receives an array of strings in the notation. */
+int64_t annexa_access(annexa_client* client, const char* const* uuids, size_t count, char** tokens, char** error_text);
+/* Holds plug-ins: flags 1 for application paths (refused with code 14 while one of their plug-ins is
+ * busy), 2 for plug-in bundle paths. `token` receives the hold's token, for annexa_unlock. */
+int64_t annexa_lock(annexa_client* client, const char* const* paths, size_t count, uint64_t flags, char** token,
+                    char** error_text);
+/* Releases a hold by its token (anyone's); an unknown token is no error. */
+int64_t annexa_unlock(annexa_client* client, const char* token, char** error_text);
+/* For a running plug-in: the receipt file of the application that contains it; `bytes` (release
+ * with annexa_free) receives `size` bytes. */
+int64_t annexa_receipt(annexa_client* client, void** bytes, size_t* size, char** error_text);
+
 /* ---- Running plug-ins (docs/spawnd.md) */
 
 /* A host's connection to a running instance of a plug-in. */

@@ -1,0 +1,113 @@
+// Getting a plug-in ready for a host: the activation overlay registered with the service manager,
+// and whether any process of the plug-in is busy.
+#include <cstdlib>
+
+#include "Annexa/AXBundle.h"
+#include "Annexa/AXMessage.h"
+#include "axd/AXDPlugIn.h"
+#include "axd/AXDRpxClient.h"
+#include "platform/pcx/Pcx.h"
+#include "platform/spawn/Spawn.h"
+
+namespace annexa {
+
+namespace log = corvane::log;
+
+namespace {
+
+constexpr const char* kKeyboardExtensionPoint = "com.corvane.keyboard-service";
+
+std::string uuidText(const AXDPlugIn& plugIn) { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); }
+std::string identifierText(const AXDPlugIn& plugIn) { return plugIn.identifier().value_or(""); }
+
+}  // namespace
+
+std::string AXDPlugIn::sandboxProfile() const {
+    Value point = pluginKey(keys::kPointIdentifier);
+    if (point == Value(kKeyboardExtensionPoint)) {
+        if (attribute("RequestsOpenAccess").isTrue() &&
+            allowedPCXServices().count(corvane::pcx::kKeyboardNetworkService)) {
+            return "plugin";
+        }
+        return "keyboard";
+    }
+    if (point == Value("com.corvane.netshield.filter-data")) return "network-filter";
+    Value stored = plugInDictionary()[keys::kPointIdentifier];
+    if (stored == Value("com.corvane.glancer.extension.preview")) return "glancerd";
+    if (stored == Value("com.corvane.app.non-ui-extension") ||
+        stored == Value("com.corvane.app.non-ui-extension.multiple-instances")) {
+        return "sandpit-devtools";
+    }
+    return "plugin";
+}
+
+Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
+    const std::string identifier = identifierText(*this);
+    const std::string uuid = uuidText(*this);
+    const Value version = this->version();
+    Dictionary environment;
+    auto record = vtproxy();
+    if (record && record->dataContainerPath()) {
+        const std::string& container = *record->dataContainerPath();
+        environment["HOME"] = Value(container);
+        environment["KFFIXED_USER_HOME"] = Value(container);
+        environment["TMPDIR"] = Value(container + "/tmp");
+    } else {
+        log::debug(logOps(), "no data container for plug-in %@(%@) %{public}@ at %@", identifier, version, uuid, path());
+    }
+    std::string profile = sandboxProfile();
+    if (const char* sdk = std::getenv("AXTEST_SDK")) environment["AXTEST_SDK"] = Value(sdk);
+
+    Dictionary service;
+    Value raw = infoKey("RPXService");
+    if (raw.isDictionary()) {
+        log::debug(logVt(), "raw RPXService=%@", raw);
+        service = *raw.asDictionary();
+    } else {
+        log::info(logOps(), "no RPXService for plug-in; database returned %@", raw);
+    }
+    if (const Dictionary* own = service["EnvironmentVariables"].asDictionary()) {
+        for (const auto& [name, value] : *own) environment[name] = value;
+    }
+    service["EnvironmentVariables"] = Value(std::move(environment));
+    service["_SandboxProfile"] = Value(profile);
+    service["_OmitSandboxParameters"] = Value(true);
+    log::info(logOps(), "assigning plug-in %@(%@) %{public}@ to %s sandbox", identifier, version, uuid, profile);
+
+    Value overlay = corvane::dict({{"RPXService", convertValueToMessage(Value(std::move(service)))},
+                                   {"KFBundlePackageType", "RPX!"}});
+    log::notice(logOps(), "allowing host %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", client.pid(), client.path(),
+             identifier, version, uuid, url());
+    auto bundle = AXBundle::initWithURL(url());
+    auto executable = bundle ? bundle->executablePath() : std::nullopt;
+    if (!executable) {
+        log::error(logOps(), "failed to obtain execPath for plug-in %@(%{public}@) bundle=%@", description(), uuid,
+                   bundle ? bundle->description() : std::string("(null)"));
+        return makeErrorWithFormat(AXErrorCode::InvalidRequest, "cannot obtain executable path for plug-in %@(%@)",
+                                   identifier, uuid);
+    }
+    log::debug(logOps(), "activation overlay=%@", overlay);
+    int result = corvane::spawn::addExternalService(client.pid(), *executable, overlay);
+    if (result != 0) {
+        log::error(logOps(), "spawnd error %d trying to allow %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", result,
+                   client.pid(), client.path(), identifier, version, uuid, path());
+        return makeErrorWithFormat(AXErrorCode::InvalidRequest, "unable to enable plug-in %@(%@)", identifier, uuid);
+    }
+    return {};
+}
+
+std::optional<Value> AXDPlugIn::checkBusy() const {
+    Value bundleIdentifier = infoKey("KFBundleIdentifier");
+    const std::string* text = bundleIdentifier.asString();
+    auto instances = corvane::spawn::busyExtensionInstances({text ? *text : std::string()});
+    if (!instances) return std::nullopt;
+    for (const Value& instance : *instances) {
+        const Value* busy = instance.find(corvane::spawn::kBundleIdentifierKey);
+        if (busy) return corvane::dict({{corvane::spawn::kBundleIdentifierKey, *busy}});
+        log::error(logOps(), "vigild reported incomplete bundle for plug-in %@/%{public}@", identifierText(*this),
+                   uuidText(*this));
+    }
+    return std::nullopt;
+}
+
+}  // namespace annexa
