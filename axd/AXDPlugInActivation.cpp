@@ -1,5 +1,6 @@
 // Getting a plug-in ready for a host: the activation overlay registered with the service manager,
 // and whether any process of the plug-in is busy.
+#include <cerrno>
 #include <cstdlib>
 
 #include "Annexa/AXBundle.h"
@@ -19,6 +20,12 @@ constexpr const char* kKeyboardExtensionPoint = "com.corvane.keyboard-service";
 
 std::string uuidText(const AXDPlugIn& plugIn) { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); }
 std::string identifierText(const AXDPlugIn& plugIn) { return plugIn.identifier().value_or(""); }
+// A version is a string in the bundle; the log shows it as written, not quoted.
+std::string versionText(const AXDPlugIn& plugIn) {
+    Value version = plugIn.version();
+    const std::string* text = version.asString();
+    return text ? *text : version.description();
+}
 
 }  // namespace
 
@@ -44,7 +51,7 @@ std::string AXDPlugIn::sandboxProfile() const {
 Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
     const std::string identifier = identifierText(*this);
     const std::string uuid = uuidText(*this);
-    const Value version = this->version();
+    const std::string version = versionText(*this);
     Dictionary environment;
     auto record = vtproxy();
     if (record && record->dataContainerPath()) {
@@ -91,6 +98,12 @@ Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
     if (result != 0) {
         log::error(logOps(), "spawnd error %d trying to allow %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", result,
                    client.pid(), client.path(), identifier, version, uuid, path());
+        if (result == EPERM) {
+            log::error(logOps(), "spawnd refused: this axd's signature lacks the %{public}s entitlement",
+                       corvane::spawn::kDomainExtensionProxyEntitlement);
+        } else if (result == EHOSTUNREACH) {
+            log::error(logOps(), "spawnd cannot be reached on %{public}s", corvane::spawn::kEndpoint);
+        }
         return makeErrorWithFormat(AXErrorCode::InvalidRequest, "unable to enable plug-in %@(%@)", identifier, uuid);
     }
     return {};

@@ -45,6 +45,16 @@ const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN]... [--rules FI
 const cli::Syntax kReady{"[-S servicename] ready UUID...", {}, {}, 1};
 const cli::Syntax kAccess{"[-S servicename] access [--json] UUID...", {"--json"}, {}, 1};
 const cli::Syntax kLock{"[-S servicename] lock --apps|--plugins [--json] PATH...", {"--apps", "--plugins", "--json"}, {}, 0};
+
+// SIGINT and SIGTERM end the commands that stay connected (lock, run --keep) through a wait, so
+// they are blocked before any thread starts.
+void blockStopSignals() {
+    sigset_t stops;
+    sigemptyset(&stops);
+    sigaddset(&stops, SIGINT);
+    sigaddset(&stops, SIGTERM);
+    pthread_sigmask(SIG_BLOCK, &stops, nullptr);
+}
 const cli::Syntax kUnlock{"[-S servicename] unlock TOKEN...", {}, {}, 1};
 const cli::Syntax kRun{"[-S servicename] run [--keep] UUID [MESSAGE]", {"--keep"}, {}, 1, 2};
 
@@ -65,7 +75,8 @@ const char* kHelp =
     "  ready UUID...                                get plug-ins ready for this process\n"
     "  access [--json] UUID...                      read tokens for the plug-ins' bundles\n"
     "  lock --apps|--plugins [--json] PATH...       hold plug-ins (of applications, or themselves);\n"
-    "                                               prints the hold's token\n"
+    "                                               prints the hold's token and keeps the hold\n"
+    "                                               until standard input ends\n"
     "  unlock TOKEN...                              release holds\n"
     "  run [--keep] UUID [MESSAGE]                  ready a plug-in, connect to it through spawnd,\n"
     "                                               send MESSAGE (default {}) and print the reply;\n"
@@ -261,36 +272,8 @@ int access(const std::string& service, const cli::Parsed& p) {
     return cli::kSuccess;
 }
 
-int lock(const std::string& service, const cli::Parsed& p) {
-    if (p.has("--apps") == p.has("--plugins")) return cli::usageError(kTool, "give one of --apps and --plugins", kLock.usage);
-    std::vector<std::string> paths;
-    for (const auto& path : p.operands) paths.push_back(absolute(path));
-    uint64_t flags = p.has("--apps") ? 1 : 2;
-    AXDaemonClient client(service);
-    auto reply = client.wait([&](auto done) { client.holdPlugIns(paths, flags, done); });
-    if (p.has("--json")) {
-        std::printf("%s\n", reply.value.json().c_str());
-    } else if (const corvane::Array* conflicts = reply.value[annexa::message::kConflicts].asArray()) {
-        for (const Value& conflict : *conflicts) std::printf("busy: %s\n", conflict.description().c_str());
-    }
-    if (int status = finish(reply, service); status != cli::kSuccess) return status;
-    const corvane::UUID* token = reply.value[annexa::message::kUuids].asUUID();
-    if (!p.has("--json")) std::printf("%s\n", token ? token->string().c_str() : "");
-    return cli::kSuccess;
-}
-
-int unlock(const std::string& service, const cli::Parsed& p) {
-    std::vector<corvane::UUID> tokens;
-    if (!readUuids(p.operands, tokens)) return cli::usageError(kTool, "not a UUID among the operands", kUnlock.usage);
-    AXDaemonClient client(service);
-    for (const corvane::UUID& token : tokens) {
-        if (int status = finish(client.wait([&](auto done) { client.releaseHold(token, done); }), service)) return status;
-    }
-    return cli::kSuccess;
-}
-
-// Waits until standard input ends, a stop signal comes, or the plug-in's connection ends; the
-// exit status says which.
+// Waits until standard input ends, a stop signal comes, or (when `ended` is a descriptor) the
+// plug-in's connection ends; the exit status says which.
 int keepConnected(int ended) {
     sigset_t stops;
     sigemptyset(&stops);
@@ -309,6 +292,37 @@ int keepConnected(int ended) {
     }
 }
 
+int lock(const std::string& service, const cli::Parsed& p) {
+    if (p.has("--apps") == p.has("--plugins")) return cli::usageError(kTool, "give one of --apps and --plugins", kLock.usage);
+    std::vector<std::string> paths;
+    for (const auto& path : p.operands) paths.push_back(absolute(path));
+    uint64_t flags = p.has("--apps") ? 1 : 2;
+    blockStopSignals();
+    AXDaemonClient client(service);
+    auto reply = client.wait([&](auto done) { client.holdPlugIns(paths, flags, done); });
+    if (p.has("--json")) {
+        std::printf("%s\n", reply.value.json().c_str());
+    } else if (const corvane::Array* conflicts = reply.value[annexa::message::kConflicts].asArray()) {
+        for (const Value& conflict : *conflicts) std::printf("busy: %s\n", conflict.description().c_str());
+    }
+    if (int status = finish(reply, service); status != cli::kSuccess) return status;
+    const corvane::UUID* token = reply.value[annexa::message::kUuids].asUUID();
+    if (!p.has("--json")) std::printf("%s\n", token ? token->string().c_str() : "");
+    std::fflush(stdout);
+    // A hold lasts as long as its client's connection: keep it until told to let go.
+    return keepConnected(-1);
+}
+
+int unlock(const std::string& service, const cli::Parsed& p) {
+    std::vector<corvane::UUID> tokens;
+    if (!readUuids(p.operands, tokens)) return cli::usageError(kTool, "not a UUID among the operands", kUnlock.usage);
+    AXDaemonClient client(service);
+    for (const corvane::UUID& token : tokens) {
+        if (int status = finish(client.wait([&](auto done) { client.releaseHold(token, done); }), service)) return status;
+    }
+    return cli::kSuccess;
+}
+
 int run(const std::string& service, const cli::Parsed& p) {
     auto uuid = corvane::UUID::parse(p.operands[0]);
     if (!uuid) return cli::usageError(kTool, "not a UUID: " + p.operands[0], kRun.usage);
@@ -318,14 +332,7 @@ int run(const std::string& service, const cli::Parsed& p) {
         if (!parsed) return cli::fail(kTool, "MESSAGE " + parsed.error().description(), cli::kDataError);
         message = *parsed;
     }
-    if (p.has("--keep")) {
-        // Before any thread starts, so that the signals reach only the wait.
-        sigset_t stops;
-        sigemptyset(&stops);
-        sigaddset(&stops, SIGINT);
-        sigaddset(&stops, SIGTERM);
-        pthread_sigmask(SIG_BLOCK, &stops, nullptr);
-    }
+    if (p.has("--keep")) blockStopSignals();
     auto registry = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
     auto record = registry ? (*registry)->plugInForUUID(*uuid) : nullptr;
     if (!record) return cli::fail(kTool, "no plug-in with the UUID " + uuid->string(), cli::kDataError);

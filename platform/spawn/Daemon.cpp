@@ -245,6 +245,7 @@ int Manager::add(const rpx::Connection& registrar, const Value& request) {
     domain.services[*identifier] = Registration{*executable, *bundlePath, *identifier, version ? *version : "", overlay};
     log::info(spawnLog(), "pid %d %@ registered %{public}@ for host %d", registrar.pid(),
               registrar.peer().executablePath, *identifier, pid);
+    log::debug(spawnLog(), "overlay of %{public}@ for host %d: %@", *identifier, pid, overlay);
     return 0;
 }
 

@@ -100,8 +100,10 @@ namespace {
 
 // Starts argv[0] with the environment changed by `env`, standard input from `inPath` and standard
 // output and error into `outPath` and `errPath`; 0 or the error number of posix_spawn.
+// Standard input is the file `inPath`, or the descriptor `inFd` when that is not negative.
 int spawn(std::vector<std::string> argv, const std::map<std::string, std::string>& env,
-          const std::string& inPath, const std::string& outPath, const std::string& errPath, pid_t* pid) {
+          const std::string& inPath, const std::string& outPath, const std::string& errPath, pid_t* pid,
+          int inFd = -1) {
     std::vector<std::string> envStrings;
     for (char** e = environ; *e; ++e) {
         std::string entry = *e;
@@ -117,7 +119,11 @@ int spawn(std::vector<std::string> argv, const std::map<std::string, std::string
 
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 0, inPath.c_str(), O_RDONLY, 0);
+    if (inFd >= 0) {
+        posix_spawn_file_actions_adddup2(&actions, inFd, 0);
+    } else {
+        posix_spawn_file_actions_addopen(&actions, 0, inPath.c_str(), O_RDONLY, 0);
+    }
     posix_spawn_file_actions_addopen(&actions, 1, outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
     posix_spawn_file_actions_addopen(&actions, 2, errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
     int rc = posix_spawn(pid, args[0], &actions, nullptr, args.data(), envp.data());
@@ -127,12 +133,22 @@ int spawn(std::vector<std::string> argv, const std::map<std::string, std::string
 
 }  // namespace
 
-Process::Process(std::vector<std::string> argv, std::map<std::string, std::string> env) {
-    int rc = spawn(argv, env, "/dev/null", files_ / "out", files_ / "err", &pid_);
+Process::Process(std::vector<std::string> argv, std::map<std::string, std::string> env, Input input) {
+    int ends[2] = {-1, -1};
+    if (input == Input::OpenPipe && ::pipe2(ends, O_CLOEXEC) != 0) throw std::runtime_error("pipe");
+    int rc = spawn(argv, env, "/dev/null", files_ / "out", files_ / "err", &pid_, ends[0]);
+    if (ends[0] >= 0) ::close(ends[0]);
+    input_ = ends[1];
     if (rc != 0) throw std::runtime_error("cannot start " + argv[0] + ": " + std::strerror(rc));
 }
 
+void Process::closeInput() {
+    if (input_ >= 0) ::close(input_);
+    input_ = -1;
+}
+
 Process::~Process() {
+    closeInput();
     if (!reaped_ && pid_ > 0) {
         kill(pid_, SIGKILL);
         int status = 0;

@@ -57,13 +57,17 @@ bool endpointAnswers(const std::string& path);
 // A child process with its standard output and error collected in files.
 class Process {
 public:
+    // Standard input: /dev/null, or a pipe that stays open until closeInput() or destruction.
+    enum class Input { Null, OpenPipe };
     // Starts argv[0] (a path) with the current environment plus `env`.
-    Process(std::vector<std::string> argv, std::map<std::string, std::string> env = {});
+    Process(std::vector<std::string> argv, std::map<std::string, std::string> env = {}, Input input = Input::Null);
     ~Process();  // kills (SIGKILL) and reaps the child if it still runs
     Process(const Process&) = delete;
     Process& operator=(const Process&) = delete;
 
     pid_t pid() const { return pid_; }
+    // Ends the standard input of an Input::OpenPipe process.
+    void closeInput();
     // Waits for the exit; returns the exit status, 128+signal for a signal, or nullopt on timeout.
     std::optional<int> wait(std::chrono::milliseconds timeout = std::chrono::seconds(30));
     void signal(int sig);
@@ -78,6 +82,7 @@ public:
 
 private:
     pid_t pid_ = -1;
+    int input_ = -1;
     bool reaped_ = false;
     TempDir files_;
 };

@@ -11,6 +11,7 @@
 //   {"do": "confined"}              try what every sandbox forbids: {"unshare": errno, "clone": errno,
 //                                   "ptrace": errno, "setsid": errno}
 //   {"do": "environment"}           {"environment": {...}, "directory": working directory}
+//   {"do": "receipt"}               ask axd for its application's receipt: the daemon's reply
 //   {"do": "exit", "status": N}     exit at once, without a reply
 // SAMPLE_AT_START in its environment ("crash", "hang" or "exit") makes it fail before serving.
 #include <arpa/inet.h>
@@ -30,6 +31,7 @@
 #include <cstring>
 #include <string>
 
+#include "Annexa/AXDaemonClient.h"
 #include "Annexa/AXPlugInRuntime.h"
 #include "platform/sandbox/Sandbox.h"
 
@@ -124,6 +126,11 @@ Value answer(const Value& message) {
     }
     if (*action == "environment") return environment();
     if (*action == "confined") return confined();
+    if (*action == "receipt") {
+        annexa::AXDaemonClient client;
+        auto reply = client.wait([&](auto done) { client.copyReceipt(done); });
+        return reply.ok() ? reply.value : dict({{"error", reply.description()}});
+    }
     if (*action == "exit") ::_exit(static_cast<int>(message["status"].int64Value().value_or(0)));
     return dict({{"error", "unknown action " + *action}});
 }
