@@ -3,7 +3,9 @@
 // figures and, as its last line, "RESULT <name> key=value ...".
 #pragma once
 
+#include <sched.h>
 #include <sys/types.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
@@ -37,6 +39,34 @@ inline long residentKiB(pid_t pid) {
 
 inline double microsSince(std::chrono::steady_clock::time_point start) {
     return std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count();
+}
+
+// Pins the calling thread (and the children it forks from now on) to one CPU.
+inline void pinTo(int cpu) {
+    cpu_set_t set;
+    CPU_ZERO(&set);
+    CPU_SET(cpu, &set);
+    sched_setaffinity(0, sizeof set, &set);
+}
+
+inline bool readFull(int fd, char* p, size_t n) {
+    while (n) {
+        ssize_t r = ::read(fd, p, n);
+        if (r <= 0) return false;
+        p += r;
+        n -= static_cast<size_t>(r);
+    }
+    return true;
+}
+
+// The far end of a ping-pong, pinned to CPU 1: reads `request` bytes and answers `reply` bytes
+// until the socket closes, then exits. For a child forked before the caller starts any thread.
+[[noreturn]] inline void echo(int fd, size_t request, size_t reply) {
+    pinTo(1);
+    std::vector<char> in(request), out(reply, 'x');
+    while (readFull(fd, in.data(), in.size()))
+        if (::write(fd, out.data(), out.size()) != static_cast<ssize_t>(out.size())) break;
+    _exit(0);
 }
 
 }  // namespace axbench

@@ -35,32 +35,6 @@ namespace {
 
 constexpr int kPerApp = 100;
 
-void pinTo(int cpu) {
-    cpu_set_t set;
-    CPU_ZERO(&set);
-    CPU_SET(cpu, &set);
-    sched_setaffinity(0, sizeof set, &set);
-}
-
-bool readFull(int fd, char* p, size_t n) {
-    while (n) {
-        ssize_t r = ::read(fd, p, n);
-        if (r <= 0) return false;
-        p += r;
-        n -= static_cast<size_t>(r);
-    }
-    return true;
-}
-
-// The ping-pong's far end: reads `request` bytes, answers `reply` bytes, until the socket closes.
-[[noreturn]] void echo(int fd, size_t request, size_t reply) {
-    pinTo(1);
-    std::vector<char> in(request), out(reply, 'x');
-    while (readFull(fd, in.data(), in.size()))
-        if (::write(fd, out.data(), out.size()) != static_cast<ssize_t>(out.size())) break;
-    _exit(0);
-}
-
 int runMatch(int argc, char** argv) {
     int plugins = 10000;
     int requests = 500;
@@ -78,11 +52,11 @@ int runMatch(int argc, char** argv) {
     if (echoPid == 0) {
         close(pair[0]);
         uint64_t n[2];
-        if (!readFull(sizes[0], reinterpret_cast<char*>(n), sizeof n)) _exit(1);
-        echo(pair[1], n[0], n[1]);
+        if (!axbench::readFull(sizes[0], reinterpret_cast<char*>(n), sizeof n)) _exit(1);
+        axbench::echo(pair[1], n[0], n[1]);
     }
     close(pair[1]);
-    pinTo(0);
+    axbench::pinTo(0);
 
     char tmpl[] = "/tmp/axbench-match.XXXXXX";
     std::string root = mkdtemp(tmpl);
@@ -165,13 +139,13 @@ int runMatch(int argc, char** argv) {
     std::vector<char> out(requestSize, 'r'), in(replySize);
     for (int i = 0; i < 200; ++i) {
         (void)!::write(pair[0], out.data(), out.size());
-        readFull(pair[0], in.data(), in.size());
+        axbench::readFull(pair[0], in.data(), in.size());
     }
     std::vector<double> pingSamples;
     for (int i = 0; i < requests; ++i) {
         auto start = std::chrono::steady_clock::now();
         (void)!::write(pair[0], out.data(), out.size());
-        readFull(pair[0], in.data(), in.size());
+        axbench::readFull(pair[0], in.data(), in.size());
         pingSamples.push_back(axbench::microsSince(start));
     }
     close(pair[0]);

@@ -4,7 +4,9 @@
 #include <atomic>
 #include <cerrno>
 #include <cstdlib>
+#include <map>
 
+#include "platform/dispatch/ThreadSafety.h"
 #include "platform/spawn/Protocol.h"
 #include "platform/spawn/Spawn.h"
 
@@ -17,15 +19,32 @@ dispatch::QueuePtr clientQueue() {
     return queue;
 }
 
-// One request on a connection of its own; a reply without the connection's error, or nullopt.
+// One request. The process keeps one connection per endpoint (by its path, so per platform root)
+// and makes a new one when that has ended: a daemon that restarted is reached again, and a request
+// sent on a connection that ended meanwhile is sent once more on a fresh one.
 std::optional<Value> roundTrip(const char* endpoint, const Value& request) {
-    auto connection = rpx::Connection::connect(endpoint, clientQueue());
-    connection->setEventHandler([](const rpx::Event&) {});
-    connection->resume();
-    rpx::Reply reply = connection->sendWithReplySync(request);
-    connection->cancel();
-    if (!reply.ok()) return std::nullopt;
-    return reply.value;
+    static Mutex mutex;
+    static std::map<std::string, rpx::ConnectionPtr>* connections = new std::map<std::string, rpx::ConnectionPtr>();
+    std::string path = rpx::endpointPath(endpoint);
+    for (int attempt = 0; attempt < 2; ++attempt) {
+        rpx::ConnectionPtr connection;
+        {
+            MutexLock lock(mutex);
+            rpx::ConnectionPtr& slot = (*connections)[path];
+            if (!slot || !slot->isValid()) {
+                slot = rpx::Connection::connect(endpoint, clientQueue());
+                slot->setEventHandler([](const rpx::Event&) {});
+                slot->resume();
+            }
+            connection = slot;
+        }
+        rpx::Reply reply = connection->sendWithReplySync(request);
+        if (reply.ok()) return reply.value;
+        MutexLock lock(mutex);
+        rpx::ConnectionPtr& slot = (*connections)[path];
+        if (slot == connection) slot = nullptr;
+    }
+    return std::nullopt;
 }
 
 int resultOf(const std::optional<Value>& reply) {
