@@ -1,9 +1,10 @@
 #!/bin/sh
 # Assembles the demo's sample application, Sampler.app with the plug-ins Greeter and Farewell, and
-# signs each bundle with the demo key (made once, kept beside the bundles).
-#   make-samples.sh AXSIGN SAMPLE_EXECUTABLE SOURCE_DIR OUT_DIR
+# signs each bundle with the demo key (made once, kept beside the bundles); signs a copy of axd,
+# bin/axd, with the two platform entitlements it needs to get plug-ins ready.
+#   make-samples.sh AXSIGN SAMPLE_EXECUTABLE SOURCE_DIR OUT_DIR AXD
 set -eu
-axsign=$1 exe=$2 src=$3 out=$4
+axsign=$1 exe=$2 src=$3 out=$4 axd=$5
 app=$out/Sampler.app
 rm -rf "$app"
 mkdir -p "$app/PlugIns"
@@ -19,3 +20,5 @@ done
 "$axsign" sign --key "$out/demo.key" "$app/PlugIns/Greeter.appex" >/dev/null
 "$axsign" sign --key "$out/demo.key" --entitlements "$src/Farewell-entitlements.plist" \
     "$app/PlugIns/Farewell.appex" >/dev/null
+install -m 0755 "$axd" "$out/bin/axd"
+"$axsign" sign --key "$out/demo.key" --entitlements "$src/axd-entitlements.plist" "$out/bin/axd" >/dev/null
