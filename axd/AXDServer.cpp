@@ -1,5 +1,6 @@
 #include "axd/AXDServer.h"
 
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include "axd/AXDRpxClient.h"
@@ -64,6 +65,10 @@ AXDServer* AXDServer::server() { return gServer.get(); }
 
 void AXDServer::run() {
     service_->resume();
+    // A service manager that started us (Type=notify) learns that clients are served from now on;
+    // without one this does nothing.
+    std::string status = "READY=1\nSTATUS=serving " + service_->path();
+    sd_notify(0, status.c_str());
     for (;;) pause();
 }
 

@@ -1,6 +1,7 @@
 // spawnd: the per-user service manager that runs plug-ins for their hosts in sandboxes, with the
 // process-assertion service, the sandbox token broker and privacy consent (docs/spawnd.md).
 #include <signal.h>
+#include <systemd/sd-daemon.h>
 
 #include <cstdio>
 #include <cstdlib>
@@ -64,9 +65,11 @@ int main(int argc, char** argv) {
     auto daemon = spawn::Daemon::start(options);
     if (!daemon) return cli::fail(kTool, daemon.error().description(), cli::kUnavailable);
     log::info(log::defaultLog(), "spawnd is serving");
+    sd_notify(0, "READY=1\nSTATUS=serving com.corvane.spawnd, com.corvane.vigild, com.corvane.sandbox, com.corvane.pcx");
     int received = 0;
     sigwait(&stopSignals, &received);
     log::info(log::defaultLog(), "spawnd is stopping");
+    sd_notify(0, "STOPPING=1\nSTATUS=ending the plug-ins it runs");
     daemon->reset();
     return cli::kSuccess;
 }

@@ -1,6 +1,7 @@
 // Listener: a named endpoint that accepts connections.
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <systemd/sd-daemon.h>
 
 #include <algorithm>
 #include <chrono>
@@ -21,6 +22,7 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     Mutex mutex;
     int fd GUARDED_BY(mutex) = -1;
     std::string path;               // set at creation, then fixed
+    bool inherited = false;         // the service manager's socket: its file is not ours to remove
     dispatch::QueuePtr queue;       // set at creation, then fixed
     dispatch::QueuePtr delivery;    // set at creation, then fixed
     std::function<void(ConnectionPtr)> handler GUARDED_BY(mutex);
@@ -159,9 +161,71 @@ Listener::Listener(std::shared_ptr<Impl> impl) : impl_(std::move(impl)) {}
 
 Listener::~Listener() { cancel(); }
 
+namespace {
+
+// The bound path of a Unix socket, or "".
+std::string boundPath(int fd) {
+    struct sockaddr_un addr {};
+    socklen_t length = sizeof addr;
+    if (::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &length) != 0 || addr.sun_family != AF_UNIX ||
+        length <= offsetof(sockaddr_un, sun_path) || addr.sun_path[0] == '\0') {
+        return "";
+    }
+    return std::string(addr.sun_path, strnlen(addr.sun_path, length - offsetof(sockaddr_un, sun_path)));
+}
+
+// The listening sockets a service manager handed this process (socket activation), read once:
+// each is taken by the listener whose endpoint it serves, found by its name (LISTEN_FDNAMES) or by
+// the path it is bound to. Descriptors that are no listening Unix stream socket are closed.
+Mutex gInheritedMutex;
+std::vector<std::pair<std::string, int>>& inheritedSockets() REQUIRES(gInheritedMutex) {
+    static auto* sockets = [] {
+        auto* list = new std::vector<std::pair<std::string, int>>();
+        char** names = nullptr;
+        int count = sd_listen_fds_with_names(1, &names);
+        for (int i = 0; i < count; ++i) {
+            int fd = SD_LISTEN_FDS_START + i;
+            std::string name = names && names[i] ? names[i] : "";
+            if (sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) > 0) {
+                ::fcntl(fd, F_SETFD, FD_CLOEXEC);
+                ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK);
+                list->emplace_back(name, fd);
+            } else {
+                log::error(rpxLog(), "ignoring inherited descriptor %d (%{public}@): not a listening Unix stream socket", fd, name);
+                ::close(fd);
+            }
+        }
+        if (names) {
+            for (int i = 0; i < count; ++i) free(names[i]);
+            free(names);
+        }
+        return list;
+    }();
+    return *sockets;
+}
+
+int takeInheritedSocket(const std::string& name, const std::string& path) {
+    MutexLock lock(gInheritedMutex);
+    auto& sockets = inheritedSockets();
+    for (auto it = sockets.begin(); it != sockets.end(); ++it) {
+        if (it->first == name || boundPath(it->second) == path) {
+            int fd = it->second;
+            sockets.erase(it);
+            return fd;
+        }
+    }
+    return -1;
+}
+
+}  // namespace
+
 Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, dispatch::QueuePtr queue) {
     if (name.empty() || name.find('/') != std::string::npos || name[0] == '.')
         return Error::posix(EINVAL, "invalid endpoint name: " + name);
+    if (int inherited = takeInheritedSocket(name, endpointPath(name)); inherited >= 0) {
+        log::info(rpxLog(), "serving %{public}@ on the socket the service manager passed", name);
+        return adoptListening(inherited, endpointPath(name), std::move(queue), true);
+    }
     std::string dir = layout::runtimeDir() + "/rpx";
     if (Status made = layout::makeDirectories(dir, 0700); !made.ok()) return made.error();
     std::string path = endpointPath(name);
@@ -198,6 +262,11 @@ Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, disp
         ::unlink(staging.c_str());
         return Error::posix(err, path);
     }
+    return adoptListening(fd, path, std::move(queue), false);
+}
+
+std::shared_ptr<Listener> Listener::adoptListening(int fd, const std::string& path, dispatch::QueuePtr queue,
+                                                   bool inherited) {
     auto impl = std::make_shared<Impl>();
     {
         MutexLock lock(impl->mutex);
@@ -205,6 +274,7 @@ Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, disp
         impl->spare = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
     }
     impl->path = path;
+    impl->inherited = inherited;
     impl->queue = std::move(queue);
     impl->delivery = dispatch::Queue::create("rpx.delivery");
     return std::shared_ptr<Listener>(new Listener(impl));
@@ -241,7 +311,7 @@ void Listener::cancel() {
     if (impl_->resumed) IoLoop::shared().remove(impl_->fd);
     ::close(impl_->fd);
     impl_->fd = -1;
-    ::unlink(impl_->path.c_str());
+    if (!impl_->inherited) ::unlink(impl_->path.c_str());
 }
 
 const std::string& Listener::path() const { return impl_->path; }

@@ -182,7 +182,9 @@ class Listener {
 public:
     // Creates the endpoint, suspended: clients may connect, but nothing is accepted until
     // resume(). Fails when another live process serves the name (a socket left by a dead one is
-    // replaced) or the runtime directory cannot be made. New connections are handed to the
+    // replaced) or the runtime directory cannot be made. Under socket activation the listening
+    // socket the service manager passed for the endpoint (named by LISTEN_FDNAMES, or bound to the
+    // endpoint's path) is used instead, and its file is left in place when the listener ends. New connections are handed to the
     // handler on `queue`; their own events are delivered on a delivery queue of the listener, one
     // connection's events in order.
     static Result<std::shared_ptr<Listener>> create(const std::string& name, dispatch::QueuePtr queue);
@@ -206,6 +208,8 @@ public:
 
 private:
     explicit Listener(std::shared_ptr<Impl> impl);
+    static std::shared_ptr<Listener> adoptListening(int fd, const std::string& path, dispatch::QueuePtr queue,
+                                                    bool inherited);
     std::shared_ptr<Impl> impl_;
 };
 
