@@ -44,6 +44,8 @@ inline constexpr const char* kAnnotate = "annotate";
 inline constexpr const char* kBulkAnnotate = "bulk-annotate";
 inline constexpr const char* kLock = "lock";
 inline constexpr const char* kReceipt = "receipt";
+// Our own: keeps the connection subscribed to the registry's changes (docs/axd.md).
+inline constexpr const char* kWatch = "watch";
 }  // namespace request
 
 // The option bits of a "match" request's "flags".

@@ -20,7 +20,12 @@ std::shared_ptr<AXDServer> gServer;  // set once during construction, never clea
 
 AXDPlugInHold::AXDPlugInHold(const std::vector<AXDPlugInPtr>& plugIns, const std::shared_ptr<AXDRpxClient>& client)
     : uuid_(UUID::random()), client_(client), clientIdentity_(client.get()), created_(Date::now()) {
-    for (const auto& p : plugIns) blocked_.insert(*p->uuid());
+    Array summaries;
+    for (const auto& p : plugIns) {
+        blocked_.insert(*p->uuid());
+        summaries.push_back(AXDWatchers::summary(*p));
+    }
+    plugIns_ = Value(std::move(summaries));
     corvane::rpx::beginWork();
 }
 
@@ -65,6 +70,7 @@ AXDServer* AXDServer::server() { return gServer.get(); }
 
 void AXDServer::run() {
     service_->resume();
+    corvane::rpx::closeUnclaimedSockets();
     // A service manager that started us (Type=notify) learns that clients are served from now on;
     // without one this does nothing.
     std::string status = "READY=1\nSTATUS=serving " + service_->path();
@@ -75,27 +81,41 @@ void AXDServer::run() {
 void AXDServer::submitWork(std::function<void()> work) { mainQueue_->async(std::move(work)); }
 
 void AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
+    Value event = corvane::dict({{"event", "hold"}, {"token", hold->uuid()}, {"plugins", hold->plugIns()}});
     syncQueue_->sync([&] {
         syncQueue_->assertCurrent();
         holds_.push_back(std::move(hold));
     });
     (void)corvane::notify::post(kAnnotationChangeNotification);
+    watchers().publish(event);
 }
 
+namespace {
+
+Value releaseEvent(const AXDPlugInHold& hold) {
+    return corvane::dict({{"event", "release"}, {"token", hold.uuid()}, {"plugins", hold.plugIns()}});
+}
+
+}  // namespace
+
 void AXDServer::unholdToken(const UUID& token) {
+    std::shared_ptr<AXDPlugInHold> released;
     syncQueue_->sync([&] {
         syncQueue_->assertCurrent();
         for (auto it = holds_.begin(); it != holds_.end(); ++it) {
             if ((*it)->uuid() != token) continue;
             log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token.string());
+            released = *it;
             holds_.erase(it);
             (void)corvane::notify::post(kAnnotationChangeNotification);
             return;
         }
     });
+    if (released) watchers().publish(releaseEvent(*released));
 }
 
 void AXDServer::unholdClient(const AXDRpxClient* client) {
+    std::vector<std::shared_ptr<AXDPlugInHold>> released;
     syncQueue_->sync([&] {
         syncQueue_->assertCurrent();
         for (;;) {
@@ -104,10 +124,12 @@ void AXDServer::unholdClient(const AXDRpxClient* client) {
             if (it == holds_.end()) break;
             log::debug(logOps(), "releasing plug-in hold %{public}@ for dead client pid %d", (*it)->uuid().string(),
                        client->pid());
+            released.push_back(*it);
             holds_.erase(it);
             (void)corvane::notify::post(kAnnotationChangeNotification);
         }
     });
+    for (const auto& hold : released) watchers().publish(releaseEvent(*hold));
 }
 
 bool AXDServer::holdOnPlugIn(const AXDPlugIn& plugIn) {

@@ -29,6 +29,8 @@ public:
     const AXDRpxClient* client() const { return client_.lock().get(); }
     bool heldBy(const AXDRpxClient* client) const;
     Date created() const { return created_; }
+    // The held plug-ins as events show them.
+    const Value& plugIns() const { return plugIns_; }
 
 private:
     const UUID uuid_;
@@ -36,6 +38,7 @@ private:
     std::weak_ptr<AXDRpxClient> client_;
     const AXDRpxClient* clientIdentity_;
     const Date created_;
+    Value plugIns_;
 };
 
 // The database part lives on its queue; the holds on "serverSync"; requests run on "service".

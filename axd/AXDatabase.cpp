@@ -208,10 +208,18 @@ Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {
 
 void AXDatabase::setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn) {
     databaseQueue_->assertNotCurrent();
+    bool watched = !watchers_.empty();
+    Value before, after;
     databaseQueue_->sync([&] {
         databaseQueue_->assertCurrent();
+        if (watched) before = annotations_->annotationForPlugIn(plugIn);
         annotations_->changeAnnotationForPlugIn(annotation, plugIn);
+        if (watched) after = annotations_->annotationForPlugIn(plugIn);
     });
+    if (watched && before != after) {
+        watchers_.publish(corvane::dict({{"event", "annotation"}, {"plugin", AXDWatchers::summary(plugIn)},
+                                         {"old", before}, {"new", after}}));
+    }
 }
 
 void AXDatabase::saveAnnotations() {
@@ -237,6 +245,7 @@ void AXDatabase::pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) 
     for (const auto& r : records) {
         log::notice(logOps(), "plug-in INSTALLED:%@ %@(%@) %{public}@ %@", r->bundleIdentifier(), r->identifier(),
                     r->bundleVersion(), r->uuid().string(), r->bundlePath());
+        watchers_.publish(corvane::dict({{"event", "installed"}, {"plugin", AXDWatchers::summary(*r)}}));
     }
 }
 
@@ -250,6 +259,9 @@ void AXDatabase::pluginsWillUninstall(const std::vector<PlugInRecordPtr>& record
             cache_.erase(r->uuid());
         }
     });
+    for (const auto& r : records) {
+        watchers_.publish(corvane::dict({{"event", "uninstalled"}, {"plugin", AXDWatchers::summary(*r)}}));
+    }
     if (AXDatabaseDelegate* d = delegate()) d->removedPlugIns(records);
 }
 

@@ -18,6 +18,7 @@
 
 #include "axd/AXDAnnotationStore.h"
 #include "axd/AXDPlugIn.h"
+#include "axd/AXDWatchers.h"
 #include "platform/dispatch/Dispatch.h"
 #include "platform/vantry/Vantry.h"
 
@@ -83,6 +84,8 @@ public:
     static uint32_t cacheLimitFromText(const char* text);
     void setCacheLimit(uint32_t limit) { cacheLimit_.store(limit); }
     corvane::vantry::Registry& workspace() const { return *workspace_; }
+    // The clients watching changes ("watch").
+    AXDWatchers& watchers() { return watchers_; }
     corvane::dispatch::Queue& databaseQueue() const RETURN_CAPABILITY(*databaseQueue_) { return *databaseQueue_; }
     // The number of cached records (read on the database queue).
     size_t cacheCount();
@@ -92,6 +95,7 @@ public:
 private:
 
     std::atomic<AXDatabaseDelegate*> delegate_{nullptr};
+    AXDWatchers watchers_;
     std::atomic<uint32_t> cacheLimit_{0};
     const std::shared_ptr<corvane::vantry::Registry> workspace_;
     const corvane::dispatch::QueuePtr databaseQueue_;

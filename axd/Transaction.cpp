@@ -31,6 +31,7 @@ const std::pair<const char*, Handler> kRequests[] = {
     {request::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
     {request::kLock, &Transaction::lockDownPlugIns},
     {request::kReceipt, &Transaction::fetchReceipt},
+    {request::kWatch, &Transaction::watchRegistry},
 };
 
 }  // namespace

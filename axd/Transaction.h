@@ -57,6 +57,7 @@ public:
     void accessPlugIns();
     void lockDownPlugIns();
     void fetchReceipt();
+    void watchRegistry();
 
     const std::shared_ptr<AXDRpxClient>& client() const { return client_; }
     const Value& request() const { return request_.message; }

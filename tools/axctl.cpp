@@ -56,6 +56,7 @@ void blockStopSignals() {
     pthread_sigmask(SIG_BLOCK, &stops, nullptr);
 }
 const cli::Syntax kUnlock{"[-S servicename] unlock TOKEN...", {}, {}, 1};
+const cli::Syntax kWatch{"[-S servicename] watch [--json]", {"--json"}, {}, 0, 0};
 const cli::Syntax kRun{"[-S servicename] run [--keep] UUID [MESSAGE]", {"--keep"}, {}, 1, 2};
 
 const char* kHelp =
@@ -81,6 +82,8 @@ const char* kHelp =
     "  run [--keep] UUID [MESSAGE]                  ready a plug-in, connect to it through spawnd,\n"
     "                                               send MESSAGE (default {}) and print the reply;\n"
     "                                               --keep stays connected until standard input ends\n"
+    "  watch [--json]                               print plug-ins installed and uninstalled,\n"
+    "                                               annotation changes and holds as they happen\n"
     "The service name defaults to com.corvane.annexa.axd. COMMAND --help shows one command's usage.\n"
     "Exit status: 0 success, 1 the daemon refused (its error text on standard error), 64 usage,\n"
     "65 unreadable input, 69 daemon not reachable, 77 refused for lack of an entitlement.\n"
@@ -272,18 +275,18 @@ int access(const std::string& service, const cli::Parsed& p) {
     return cli::kSuccess;
 }
 
-// Waits until standard input ends, a stop signal comes, or (when `ended` is a descriptor) the
-// plug-in's connection ends; the exit status says which.
-int keepConnected(int ended) {
+// Waits until standard input ends (when asked), a stop signal comes, or `ended` (when a descriptor)
+// becomes readable, which is reported with `endedText`; the exit status says which.
+int keepConnected(bool untilInputEnds, int ended, const char* endedText) {
     sigset_t stops;
     sigemptyset(&stops);
     sigaddset(&stops, SIGINT);
     sigaddset(&stops, SIGTERM);
     int signals = signalfd(-1, &stops, SFD_CLOEXEC);
-    pollfd watched[3] = {{0, POLLIN, 0}, {signals, POLLIN, 0}, {ended, POLLIN, 0}};
+    pollfd watched[3] = {{untilInputEnds ? 0 : -1, POLLIN, 0}, {signals, POLLIN, 0}, {ended, POLLIN, 0}};
     for (;;) {
         if (::poll(watched, 3, -1) < 0 && errno != EINTR) return cli::kFailure;
-        if (watched[2].revents) return cli::fail(kTool, "the plug-in's connection ended", cli::kUnavailable);
+        if (watched[2].revents) return cli::fail(kTool, endedText, cli::kUnavailable);
         if (watched[1].revents) return cli::kSuccess;
         if (watched[0].revents) {
             char buffer[256];
@@ -310,7 +313,7 @@ int lock(const std::string& service, const cli::Parsed& p) {
     if (!p.has("--json")) std::printf("%s\n", token ? token->string().c_str() : "");
     std::fflush(stdout);
     // A hold lasts as long as its client's connection: keep it until told to let go.
-    return keepConnected(-1);
+    return keepConnected(true, -1, "");
 }
 
 int unlock(const std::string& service, const cli::Parsed& p) {
@@ -354,7 +357,53 @@ int run(const std::string& service, const cli::Parsed& p) {
     std::printf("%s\n", reply.value.description().c_str());
     std::fflush(stdout);
     if (!p.has("--keep")) return cli::kSuccess;
-    return keepConnected(ended[0]);
+    return keepConnected(true, ended[0], "the plug-in's connection ended");
+}
+
+// One line per event: what happened, then the plug-in(s).
+std::string describeEvent(const Value& event) {
+    auto plugIn = [](const Value& p) {
+        auto text = [](const Value& v) { return v.asString() ? *v.asString() : v.description(); };
+        const corvane::UUID* uuid = p["uuid"].asUUID();
+        return text(p["identifier"]) + " " + text(p["version"]) + " " + (uuid ? uuid->string() : "") + " " +
+               text(p["path"]);
+    };
+    const std::string* kind = event["event"].asString();
+    std::string what = kind ? *kind : "?";
+    if (what == "installed" || what == "uninstalled") return what + " " + plugIn(event["plugin"]);
+    if (what == "annotation") {
+        return what + " " + plugIn(event["plugin"]) + ": " + event["old"].description() + " -> " + event["new"].description();
+    }
+    const corvane::UUID* token = event["token"].asUUID();
+    std::string line = what + " " + (token ? token->string() : "");
+    if (const corvane::Array* plugIns = event["plugins"].asArray()) {
+        for (const Value& p : *plugIns) line += "\n    " + plugIn(p);
+    }
+    return line;
+}
+
+int watch(const std::string& service, const cli::Parsed& p) {
+    blockStopSignals();
+    bool json = p.has("--json");
+    int ended[2];
+    if (::pipe2(ended, O_CLOEXEC) != 0) return cli::fail(kTool, "pipe: " + std::string(std::strerror(errno)));
+    int endedWrite = ended[1];
+    auto connection = corvane::rpx::Connection::connect(service, corvane::dispatch::Queue::create("axctl.watch"));
+    connection->setEventHandler([json, endedWrite](const corvane::rpx::Event& ev) {
+        if (ev.isError()) {
+            [[maybe_unused]] ssize_t n = ::write(endedWrite, "x", 1);
+            return;
+        }
+        std::string line = json ? ev.message.json() : describeEvent(ev.message);
+        std::printf("%s\n", line.c_str());
+        std::fflush(stdout);
+    });
+    connection->resume();
+    Value request(annexa::Dictionary{{annexa::message::kRequest, Value(annexa::request::kWatch)},
+                                     {annexa::message::kVersion, Value(annexa::kCurrentProtocolVersion)}});
+    if (int status = finish(connection->sendWithReplySync(request), service)) return status;
+    // Until interrupted; the daemon's going away ends the watch with 69.
+    return keepConnected(false, ended[0], "the daemon ended the watch");
 }
 
 }  // namespace
@@ -383,6 +432,7 @@ int main(int argc, char** argv) {
         {"lock", kLock, with(lock)},
         {"unlock", kUnlock, with(unlock)},
         {"run", kRun, with(run)},
+        {"watch", kWatch, with(watch)},
     };
     return cli::runCommand(kTool, kHelp, commands, std::move(args));
 }

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/log/Log.h"
+#include "platform/rpx/Rpx.h"
 #include "platform/spawn/Daemon.h"
 #include "tools/cli/Cli.h"
 
@@ -64,6 +65,7 @@ int main(int argc, char** argv) {
 
     auto daemon = spawn::Daemon::start(options);
     if (!daemon) return cli::fail(kTool, daemon.error().description(), cli::kUnavailable);
+    corvane::rpx::closeUnclaimedSockets();
     log::info(log::defaultLog(), "spawnd is serving");
     sd_notify(0, "READY=1\nSTATUS=serving com.corvane.spawnd, com.corvane.vigild, com.corvane.sandbox, com.corvane.pcx");
     int received = 0;

@@ -86,6 +86,11 @@ std::shared_ptr<Connection> Connection::open(int fd, dispatch::QueuePtr queue, s
     return connection;
 }
 
+size_t Connection::queuedOutgoingBytes() const {
+    MutexLock lock(impl_->mutex);
+    return impl_->outBytes;
+}
+
 void Connection::setEventHandler(std::function<void(const Event&)> handler) {
     MutexLock lock(impl_->mutex);
     impl_->handler = std::move(handler);

@@ -219,6 +219,16 @@ int takeInheritedSocket(const std::string& name, const std::string& path) {
 
 }  // namespace
 
+void closeUnclaimedSockets() {
+    MutexLock lock(gInheritedMutex);
+    for (const auto& [name, fd] : inheritedSockets()) {
+        log::error(rpxLog(), "closing passed socket %{public}@ (%{public}@): no endpoint of this process serves it",
+                   boundPath(fd), name);
+        ::close(fd);
+    }
+    inheritedSockets().clear();
+}
+
 Result<std::shared_ptr<Listener>> Listener::create(const std::string& name, dispatch::QueuePtr queue) {
     if (name.empty() || name.find('/') != std::string::npos || name[0] == '.')
         return Error::posix(EINVAL, "invalid endpoint name: " + name);

@@ -161,6 +161,8 @@ public:
 
     // The largest frame this side accepts.
     void setMaxFrameSize(size_t bytes);
+    // Bytes sent on this connection that the peer has not read yet.
+    size_t queuedOutgoingBytes() const;
 
     std::string description() const;
 
@@ -212,6 +214,11 @@ private:
                                                     bool inherited);
     std::shared_ptr<Impl> impl_;
 };
+
+// Closes the listening sockets a service manager passed that no listener took (a socket for an
+// endpoint this process does not serve, or one under another platform root): their clients are
+// refused at once instead of waiting for ever. A daemon calls it once all its listeners exist.
+void closeUnclaimedSockets();
 
 // The socket path of an endpoint under the current platform root.
 std::string endpointPath(const std::string& name);
