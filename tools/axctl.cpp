@@ -42,7 +42,7 @@ const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN]... [--rules FI
                          0,
                          0};
 
-const cli::Syntax kReady{"[-S servicename] ready UUID...", {}, {}, 1};
+const cli::Syntax kReady{"[-S servicename] ready [--json] UUID...", {"--json"}, {}, 1};
 const cli::Syntax kAccess{"[-S servicename] access [--json] UUID...", {"--json"}, {}, 1};
 const cli::Syntax kLock{"[-S servicename] lock --apps|--plugins [--json] PATH...", {"--apps", "--plugins", "--json"}, {}, 0};
 
@@ -73,7 +73,7 @@ const char* kHelp =
     "        [--system-only] [--all] [--explain] [--json]\n"
     "                                               the plug-ins that fit; --explain says why\n"
     "                                               each installed plug-in was left out\n"
-    "  ready UUID...                                get plug-ins ready for this process\n"
+    "  ready [--json] UUID...                       get plug-ins ready for this process\n"
     "  access [--json] UUID...                      read tokens for the plug-ins' bundles\n"
     "  lock --apps|--plugins [--json] PATH...       hold plug-ins (of applications, or themselves);\n"
     "                                               prints the hold's token and keeps the hold\n"
@@ -257,7 +257,9 @@ int ready(const std::string& service, const cli::Parsed& p) {
     std::vector<corvane::UUID> uuids;
     if (!readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID among the operands", kReady.usage);
     AXDaemonClient client(service);
-    return finish(client.wait([&](auto done) { client.readyPlugIns(uuids, 0, done); }), service);
+    auto reply = client.wait([&](auto done) { client.readyPlugIns(uuids, 0, done); });
+    if (p.has("--json") && reply.ok()) std::printf("%s\n", reply.value.json().c_str());
+    return finish(reply, service);
 }
 
 int access(const std::string& service, const cli::Parsed& p) {

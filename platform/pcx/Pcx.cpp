@@ -116,18 +116,8 @@ std::optional<Array> consentInformationForBundle(const std::string& bundlePath) 
 }
 
 Result<std::unique_ptr<Service>> Service::start(dispatch::QueuePtr queue) {
-    auto listener = rpx::Listener::create(kEndpoint, std::move(queue));
+    auto listener = rpx::serveRequests(kEndpoint, std::move(queue), answer);
     if (!listener) return listener.error();
-    (*listener)->setConnectionHandler([](rpx::ConnectionPtr c) {
-        std::weak_ptr<rpx::Connection> weak = c;
-        c->setEventHandler([weak](const rpx::Event& ev) {
-            auto connection = weak.lock();
-            if (!connection || ev.isError() || !ev.wantsReply) return;
-            connection->sendReply(ev.messageId, answer(*connection, ev.message));
-        });
-        c->resume();
-    });
-    (*listener)->resume();
     return std::unique_ptr<Service>(new Service(*listener));
 }
 

@@ -327,3 +327,24 @@ void Listener::cancel() {
 const std::string& Listener::path() const { return impl_->path; }
 
 }  // namespace corvane::rpx
+
+namespace corvane::rpx {
+
+Result<std::shared_ptr<Listener>> serveRequests(const std::string& name, dispatch::QueuePtr queue,
+                                                std::function<Value(const Connection&, const Value&)> answer) {
+    auto listener = Listener::create(name, std::move(queue));
+    if (!listener) return listener.error();
+    (*listener)->setConnectionHandler([answer = std::move(answer)](ConnectionPtr c) {
+        std::weak_ptr<Connection> weak = c;
+        c->setEventHandler([weak, answer](const Event& ev) {
+            auto connection = weak.lock();
+            if (!connection || ev.isError() || !ev.wantsReply) return;
+            connection->sendReply(ev.messageId, answer(*connection, ev.message));
+        });
+        c->resume();
+    });
+    (*listener)->resume();
+    return *listener;
+}
+
+}  // namespace corvane::rpx

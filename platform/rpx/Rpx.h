@@ -215,6 +215,12 @@ private:
     std::shared_ptr<Impl> impl_;
 };
 
+// Serves `name` with one answer per request: `answer` gets the connection and the message, on the
+// listener's delivery, and gives the reply; messages that expect none are passed over. The listener
+// is resumed; it serves until cancelled.
+Result<std::shared_ptr<Listener>> serveRequests(const std::string& name, dispatch::QueuePtr queue,
+                                                std::function<Value(const Connection&, const Value&)> answer);
+
 // Closes the listening sockets a service manager passed that no listener took (a socket for an
 // endpoint this process does not serve, or one under another platform root): their clients are
 // refused at once instead of waiting for ever. A daemon calls it once all its listeners exist.

@@ -197,29 +197,21 @@ bool isSandboxed(pid_t pid) {
 }
 
 Result<std::unique_ptr<Broker>> Broker::start(dispatch::QueuePtr queue) {
-    auto listener = rpx::Listener::create(kBrokerEndpoint, std::move(queue));
-    if (!listener) return listener.error();
-    (*listener)->setConnectionHandler([](rpx::ConnectionPtr c) {
-        std::weak_ptr<rpx::Connection> weak = c;
-        c->setEventHandler([weak](const rpx::Event& ev) {
-            auto conn = weak.lock();
-            if (!conn || ev.isError() || !ev.wantsReply) return;
-            auto answer = [&](Value reply) { conn->sendReply(ev.messageId, reply); };
-            const std::string* text = ev.message["token"].asString();
-            auto token = text ? parseToken(*text) : std::nullopt;
-            if (!token || !verifyToken(*token)) {
-                log::notice(sandboxLog(), "refused a sandbox token from pid %d", conn->pid());
-                return answer(dict({{"error", "invalid token"}}));
-            }
-            // The path was canonical when the token was issued: refuse to follow a symbolic link
-            // put in its place since.
-            int fd = ::open(token->path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
-            if (fd < 0) return answer(dict({{"error", std::string(std::strerror(errno))}}));
-            answer(dict({{"fd", Value(std::make_shared<FileDescriptor>(fd))}}));
-        });
-        c->resume();
+    auto listener = rpx::serveRequests(kBrokerEndpoint, std::move(queue), [](const rpx::Connection& connection,
+                                                                             const Value& request) {
+        const std::string* text = request["token"].asString();
+        auto token = text ? parseToken(*text) : std::nullopt;
+        if (!token || !verifyToken(*token)) {
+            log::notice(sandboxLog(), "refused a sandbox token from pid %d", connection.pid());
+            return dict({{"error", "invalid token"}});
+        }
+        // The path was canonical when the token was issued: refuse to follow a symbolic link put
+        // in its place since.
+        int fd = ::open(token->path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+        if (fd < 0) return dict({{"error", std::string(std::strerror(errno))}});
+        return dict({{"fd", Value(std::make_shared<FileDescriptor>(fd))}});
     });
-    (*listener)->resume();
+    if (!listener) return listener.error();
     return std::unique_ptr<Broker>(new Broker(*listener));
 }
 
