@@ -51,6 +51,38 @@ int main(int argc, char** argv) {
     code = annexa_match(client, "{bad", 0, &found, &text);
     line("match garbage", code, text);
 
+    /* Activation without spawnd running: ready fails with the daemon's text; the rest needs no
+     * service manager. */
+    code = annexa_ready(client, uuids, 1, &text);
+    printf("ready: %" PRId64 " %s\n", code, text && strstr(text, "unable to enable plug-in com.example.One(") ? "unable" : "-");
+    annexa_free(text);
+    char* tokens = NULL;
+    const char* twice[] = {argv[2], argv[2]};
+    code = annexa_access(client, twice, 2, &tokens, &text);
+    printf("access: %" PRId64 " %s\n", code,
+           tokens && strstr(tokens, "com.corvane.sandbox.read-only;") && strchr(tokens, ',') ? "two tokens" : "-");
+    annexa_free(tokens);
+    annexa_free(text);
+    char plugIn[512];
+    snprintf(plugIn, sizeof plugIn, "%s/PlugIns/One.appex", argv[1]);
+    const char* held[] = {plugIn};
+    char* token = NULL;
+    code = annexa_lock(client, held, 1, 2, &token, &text);
+    printf("lock: %" PRId64 " %s\n", code, token && strlen(token) == 36 ? "token" : "-");
+    annexa_free(text);
+    code = annexa_ready(client, uuids, 1, &text);
+    line("ready while held", code, text);
+    code = annexa_unlock(client, token, &text);
+    line("unlock", code, text);
+    annexa_free(token);
+    code = annexa_lock(client, held, 1, 3, &token, &text);
+    line("lock bad flags", code, text);
+    void* receipt = NULL;
+    size_t size = 0;
+    code = annexa_receipt(client, &receipt, &size, &text);
+    line("receipt", code, text);
+    annexa_free(receipt);
+
     char table[200];
     snprintf(table, sizeof table, "{\"%s\": {\"from\": \"C\"}}", argv[2]);
     code = annexa_bulk_annotate(client, table, &text);
