@@ -4,6 +4,7 @@
 #pragma once
 
 #include <sched.h>
+#include <spawn.h>
 #include <sys/types.h>
 #include <unistd.h>
 
@@ -14,6 +15,8 @@
 #include <fstream>
 #include <string>
 #include <vector>
+
+extern char** environ;
 
 namespace axbench {
 
@@ -39,6 +42,21 @@ inline long residentKiB(pid_t pid) {
 
 inline double microsSince(std::chrono::steady_clock::time_point start) {
     return std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count();
+}
+
+// Starts a program (argv[0] a path) without waiting for it; 0 when it cannot be started.
+inline pid_t startProgram(std::vector<std::string> argv, const posix_spawn_file_actions_t* actions = nullptr,
+                          char* const* environment = environ) {
+    std::vector<char*> args;
+    for (auto& a : argv) args.push_back(a.data());
+    args.push_back(nullptr);
+    pid_t pid = 0;
+    return posix_spawn(&pid, args[0], actions, nullptr, args.data(), environment) == 0 ? pid : 0;
+}
+
+// Waits (up to five seconds) until a daemon's socket exists.
+inline void waitForSocket(const std::string& path) {
+    for (int i = 0; i < 1000 && ::access(path.c_str(), F_OK) != 0; ++i) ::usleep(5000);
 }
 
 // Pins the calling thread (and the children it forks from now on) to one CPU.

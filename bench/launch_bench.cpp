@@ -23,8 +23,6 @@
 #include "platform/rpx/Rpx.h"
 #include "platform/spawn/Spawn.h"
 
-extern char** environ;
-
 using namespace corvane;
 namespace fs = std::filesystem;
 
@@ -34,21 +32,11 @@ std::string besideMe(const std::string& relative) {
     return (fs::read_symlink("/proc/self/exe").parent_path() / relative).lexically_normal().string();
 }
 
-pid_t start(std::vector<std::string> argv, posix_spawn_file_actions_t* actions = nullptr,
-            char** environment = environ) {
-    std::vector<char*> args;
-    for (auto& a : argv) args.push_back(a.data());
-    args.push_back(nullptr);
-    pid_t pid = 0;
-    if (posix_spawn(&pid, args[0], actions, nullptr, args.data(), environment) != 0) return 0;
-    return pid;
-}
-
 int runQuiet(std::vector<std::string> argv) {
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-    pid_t pid = start(std::move(argv), &actions);
+    pid_t pid = axbench::startProgram(std::move(argv), &actions);
     posix_spawn_file_actions_destroy(&actions);
     int status = 0;
     if (pid <= 0 || waitpid(pid, &status, 0) != pid) return -1;
@@ -79,7 +67,7 @@ double plainSpawnMillis(const std::string& executable, const dispatch::QueuePtr&
     posix_spawn_file_actions_adddup2(&actions, control[1], 3);
     std::string variable = std::string(spawn::kControlDescriptorVariable) + "=3";
     char* environment[] = {variable.data(), nullptr};
-    pid_t pid = start({executable}, &actions, environment);
+    pid_t pid = axbench::startProgram({executable}, &actions, environment);
     posix_spawn_file_actions_destroy(&actions);
     ::close(control[1]);
     auto controlConnection = rpx::Connection::adopt(std::make_shared<FileDescriptor>(control[0]), queue);
@@ -117,10 +105,8 @@ int launchBench(int argc, char** argv) {
     fs::copy_file(besideMe("spawn_peer"), registrar);
     if (!codesign::sign(registrar, key, std::nullopt, dict({{spawn::kDomainExtensionProxyEntitlement, true}})).ok()) return 1;
 
-    pid_t spawnd = start({besideMe("spawnd"), "--idle-ms", "20", "--grace-ms", "200"});
-    for (int i = 0; i < 1000 && !fs::exists(rpx::endpointPath(spawn::kEndpoint)); ++i) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
+    pid_t spawnd = axbench::startProgram({besideMe("spawnd"), "--idle-ms", "20", "--grace-ms", "200"});
+    axbench::waitForSocket(rpx::endpointPath(spawn::kEndpoint));
     std::string overlay = dict({{"RPXService", dict({{"_SandboxProfile", "plugin"}})}, {"KFBundlePackageType", "RPX!"}}).description();
     std::vector<std::string> identifiers;
     for (int i = 0; i < launches; ++i) {

@@ -23,28 +23,12 @@
 #include "platform/spawn/Spawn.h"
 #include "platform/vantry/Vantry.h"
 
-extern char** environ;
-
 using namespace corvane;
 namespace fs = std::filesystem;
 
 namespace {
 
 constexpr size_t kPingBytes = 160;
-
-pid_t startDaemon(std::vector<std::string> argv) {
-    std::vector<char*> args;
-    for (auto& a : argv) args.push_back(a.data());
-    args.push_back(nullptr);
-    pid_t pid = 0;
-    return posix_spawn(&pid, args[0], nullptr, nullptr, args.data(), environ) == 0 ? pid : 0;
-}
-
-void waitForEndpoint(const std::string& name) {
-    for (int i = 0; i < 1000 && !fs::exists(rpx::endpointPath(name)); ++i) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-}
 
 int readyBench(int argc, char** argv) {
     int requests = 300;
@@ -82,10 +66,10 @@ int readyBench(int argc, char** argv) {
                                     {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
                                                           {"KSExtensionAttributes", dict({})}})}}));
     fs::copy_file(bin + "/../samples/bin/ax_sample", app + "/PlugIns/One.appex/One");
-    pid_t spawnd = startDaemon({bin + "/spawnd"});
-    pid_t daemon = startDaemon({axd});
-    waitForEndpoint(spawn::kEndpoint);
-    waitForEndpoint(annexa::kDefaultServiceName);
+    pid_t spawnd = axbench::startProgram({bin + "/spawnd"});
+    pid_t daemon = axbench::startProgram({axd});
+    axbench::waitForSocket(rpx::endpointPath(spawn::kEndpoint));
+    axbench::waitForSocket(rpx::endpointPath(annexa::kDefaultServiceName));
 
     axbench::pinTo(0);
     annexa::AXDaemonClient client;

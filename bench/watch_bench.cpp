@@ -22,8 +22,6 @@
 #include "platform/rpx/Rpx.h"
 #include "platform/vantry/Vantry.h"
 
-extern char** environ;
-
 using namespace corvane;
 namespace fs = std::filesystem;
 
@@ -52,13 +50,9 @@ int watchBench(int argc, char** argv) {
                               dict({{"KFBundleIdentifier", "com.bench.watched.one"},
                                     {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
                                                           {"KSExtensionAttributes", dict({})}})}}));
-    std::string axdPath = bin + "/axd";
-    char* args[] = {axdPath.data(), nullptr};
-    pid_t axd = 0;
-    if (posix_spawn(&axd, args[0], nullptr, nullptr, args, environ) != 0) return 1;
-    for (int i = 0; i < 1000 && !fs::exists(rpx::endpointPath(annexa::kDefaultServiceName)); ++i) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
+    pid_t axd = axbench::startProgram({bin + "/axd"});
+    if (axd == 0) return 1;
+    axbench::waitForSocket(rpx::endpointPath(annexa::kDefaultServiceName));
 
     annexa::AXDaemonClient client;
     auto send = [&](const Value& message) { return client.wait([&](auto done) { client.send(message, done); }); };

@@ -27,9 +27,6 @@ namespace {
 
 std::string sampleExecutable() { return axtest::binary("../samples/bin/ax_sample"); }
 
-bool processGone(pid_t pid) {
-    return axtest::eventually([pid] { return ::kill(pid, 0) != 0 && errno == ESRCH; }, std::chrono::seconds(5));
-}
 
 // A listening TCP socket on the loopback interface; its port.
 struct TcpListener {
@@ -311,8 +308,8 @@ TEST(Spawnd, InstancesEndWithTheirServiceTheirHostAndTheirIdleness) {
         ASSERT_GT(instance, 0);
         ASSERT_GT(child, 0);
         EXPECT_EQ(d.remove("com.example.removed"), 0);
-        EXPECT_TRUE(processGone(instance));
-        EXPECT_TRUE(processGone(child));
+        EXPECT_TRUE(axtest::processGone(instance));
+        EXPECT_TRUE(axtest::processGone(child));
     }
 
     // The host's exit ends its instances.
@@ -325,7 +322,7 @@ TEST(Spawnd, InstancesEndWithTheirServiceTheirHostAndTheirIdleness) {
     pid_t hosted = static_cast<pid_t>((*reply)["pid"].int64Value().value_or(0));
     ASSERT_GT(hosted, 0);
     host.signal(SIGKILL);
-    EXPECT_TRUE(processGone(hosted));
+    EXPECT_TRUE(axtest::processGone(hosted));
 
     // An instance that serves nobody ends after the idle time.
     ASSERT_EQ(d.add(::getpid(), d.plugIn("com.example.idle"), d.overlay("plugin", "")), 0);
@@ -338,7 +335,7 @@ TEST(Spawnd, InstancesEndWithTheirServiceTheirHostAndTheirIdleness) {
         EXPECT_EQ(::kill(idle, 0), 0) << "ended while a host was connected";
         (*session.connection)->cancel();
     }
-    EXPECT_TRUE(processGone(idle));
+    EXPECT_TRUE(axtest::processGone(idle));
 }
 
 TEST(Spawnd, BusyAssertionsAreSeenUntilDroppedOrTheInstanceExits) {
@@ -361,7 +358,7 @@ TEST(Spawnd, BusyAssertionsAreSeenUntilDroppedOrTheInstanceExits) {
     session.send(dict({{"do", "busy"}, {"reason", "again"}}));
     EXPECT_TRUE(axtest::eventually([&] { return busy() != Value(Array{}); }));
     (*session.connection)->send(dict({{"do", "exit"}}));
-    EXPECT_TRUE(processGone(pid));
+    EXPECT_TRUE(axtest::processGone(pid));
     EXPECT_TRUE(axtest::eventually([&] { return busy() == Value(Array{}); }));
 }
 
@@ -406,7 +403,7 @@ TEST(Spawnd, HostsTheTokenBrokerAndConsentAndStopsItsInstancesOnSigterm) {
     ASSERT_GT(pid, 0);
     d.daemon->signal(SIGTERM);
     EXPECT_EQ(d.daemon->wait(std::chrono::seconds(10)), 0);
-    EXPECT_TRUE(processGone(pid));
+    EXPECT_TRUE(axtest::processGone(pid));
 }
 
 TEST(Spawnd, APlugInAndAHostWrittenInCTalkThroughTheLibrary) {

@@ -11,6 +11,7 @@
 #include <cstring>
 #include <iostream>
 #include <iterator>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -155,6 +156,16 @@ int addOrRemove(const std::string& service, bool add, const cli::Parsed& p) {
     return status;
 }
 
+// The UUIDs of the texts; the first text that is no UUID, when there is one.
+std::optional<std::string> readUuids(const std::vector<std::string>& texts, std::vector<corvane::UUID>& uuids) {
+    for (const auto& text : texts) {
+        auto uuid = corvane::UUID::parse(text);
+        if (!uuid) return text;
+        uuids.push_back(*uuid);
+    }
+    return std::nullopt;
+}
+
 int annotate(const std::string& service, const cli::Parsed& p) {
     annexa::Dictionary annotations;
     if (auto election = p.value("--election")) {
@@ -169,11 +180,7 @@ int annotate(const std::string& service, const cli::Parsed& p) {
         annotations["extension"] = *ext;
     }
     std::vector<corvane::UUID> uuids;
-    for (const auto& text : p.operands) {
-        auto uuid = corvane::UUID::parse(text);
-        if (!uuid) return cli::usageError(kTool, "not a UUID: " + text, kAnnotate.usage);
-        uuids.push_back(*uuid);
-    }
+    if (auto bad = readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID: " + *bad, kAnnotate.usage);
     AXDaemonClient client(service);
     auto reply = client.wait([&](auto done) { client.setPlugInAnnotations(uuids, Value(annotations), done); });
     return finish(reply, service);
@@ -244,18 +251,9 @@ int match(const std::string& service, const cli::Parsed& p) {
     return cli::kSuccess;
 }
 
-bool readUuids(const std::vector<std::string>& texts, std::vector<corvane::UUID>& uuids) {
-    for (const auto& text : texts) {
-        auto uuid = corvane::UUID::parse(text);
-        if (!uuid) return false;
-        uuids.push_back(*uuid);
-    }
-    return true;
-}
-
 int ready(const std::string& service, const cli::Parsed& p) {
     std::vector<corvane::UUID> uuids;
-    if (!readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID among the operands", kReady.usage);
+    if (auto bad = readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID: " + *bad, kReady.usage);
     AXDaemonClient client(service);
     auto reply = client.wait([&](auto done) { client.readyPlugIns(uuids, 0, done); });
     if (p.has("--json") && reply.ok()) std::printf("%s\n", reply.value.json().c_str());
@@ -264,7 +262,7 @@ int ready(const std::string& service, const cli::Parsed& p) {
 
 int access(const std::string& service, const cli::Parsed& p) {
     std::vector<corvane::UUID> uuids;
-    if (!readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID among the operands", kAccess.usage);
+    if (auto bad = readUuids(p.operands, uuids)) return cli::usageError(kTool, "not a UUID: " + *bad, kAccess.usage);
     AXDaemonClient client(service);
     auto reply = client.wait([&](auto done) { client.accessPlugIns(uuids, 0, done); });
     if (int status = finish(reply, service); status != cli::kSuccess) return status;
@@ -320,7 +318,7 @@ int lock(const std::string& service, const cli::Parsed& p) {
 
 int unlock(const std::string& service, const cli::Parsed& p) {
     std::vector<corvane::UUID> tokens;
-    if (!readUuids(p.operands, tokens)) return cli::usageError(kTool, "not a UUID among the operands", kUnlock.usage);
+    if (auto bad = readUuids(p.operands, tokens)) return cli::usageError(kTool, "not a UUID: " + *bad, kUnlock.usage);
     AXDaemonClient client(service);
     for (const corvane::UUID& token : tokens) {
         if (int status = finish(client.wait([&](auto done) { client.releaseHold(token, done); }), service)) return status;

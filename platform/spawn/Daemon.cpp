@@ -277,10 +277,11 @@ void Manager::connect(const rpx::ConnectionPtr& host, uint64_t messageId, const 
     if (!identifier) return host->sendReply(messageId, errorReply(EINVAL, "the request names no bundleIdentifier"));
     const rpx::AuditToken& token = host->peer().auditToken;
     auto domain = domains_.find(HostKey{token.pid, token.startTime});
-    auto service = domain == domains_.end() ? nullptr : [&]() -> const Registration* {
+    const Registration* service = nullptr;
+    if (domain != domains_.end()) {
         auto found = domain->second.services.find(*identifier);
-        return found == domain->second.services.end() ? nullptr : &found->second;
-    }();
+        if (found != domain->second.services.end()) service = &found->second;
+    }
     if (!service) {
         return host->sendReply(messageId, errorReply(ENOENT, "no service " + *identifier + " in the domain of pid " +
                                                                  std::to_string(token.pid)));

@@ -31,9 +31,6 @@ Value plugIn(const std::string& point, Dictionary attributes = {}) {
     return dict({{"KSExtensionPointIdentifier", point}, {"KSExtensionAttributes", Value(std::move(attributes))}});
 }
 
-bool processGone(pid_t pid) {
-    return axtest::eventually([pid] { return ::kill(pid, 0) != 0 && errno == ESRCH; }, 5s);
-}
 
 // The platform: spawnd, axd signed with the entitlements it needs (unless told otherwise) and a
 // registered application with plug-ins of several extension points.
@@ -255,7 +252,7 @@ TEST(Activation, UninstallingAnApplicationEndsItsRunningPlugIn) {
     ASSERT_TRUE(codesign::sign(manager, p.key, std::nullopt, dict({{"com.corvane.private.annexa.manager", true}})).ok());
     auto removed = p.axctl({"remove", p.app}, manager);
     ASSERT_EQ(removed.status, 0) << removed.err;
-    EXPECT_TRUE(processGone(instance));
+    EXPECT_TRUE(axtest::processGone(instance));
     EXPECT_TRUE(p.axd->waitForErr("spawnd reported plug-ins have been terminated")) << p.axd->err();
     // The host was told, and said so.
     EXPECT_EQ(host.wait(5s), 69);

@@ -45,6 +45,10 @@ PlatformRoot::~PlatformRoot() {
     }
 }
 
+bool processGone(pid_t pid) {
+    return eventually([pid] { return ::kill(pid, 0) != 0 && errno == ESRCH; }, std::chrono::seconds(5));
+}
+
 std::string binary(const std::string& name) {
     const char* bin = std::getenv("AX_BUILD_BIN");
     if (bin) return std::string(bin) + "/" + name;

@@ -43,6 +43,9 @@ private:
 bool eventually(const std::function<bool()>& predicate,
                 std::chrono::milliseconds timeout = std::chrono::seconds(10));
 
+// Polls until no process has the pid (up to five seconds); whether that happened.
+bool processGone(pid_t pid);
+
 // Path of a program of this build (build/bin/NAME).
 std::string binary(const std::string& name);
 // The source tree's root.

@@ -99,7 +99,7 @@ Value answer(const Value& message) {
     }
     if (*action == "write") {
         const std::string* path = message["path"].asString();
-        return path ? tryWrite(*path) : errnoOf((errno = EINVAL, -1));
+        return path ? tryWrite(*path) : dict({{"errno", int64_t{EINVAL}}});
     }
     if (*action == "tcp") return tryTcp(message["port"].int64Value().value_or(9));
     if (*action == "inet") {
