@@ -7,6 +7,18 @@ namespace annexa {
 namespace log = corvane::log;
 using corvane::rpx::Reply;
 
+namespace {
+// Set while this thread runs the operation of wait(): its request is sent and its reply read on
+// this thread, with no hand-over to the reply queue and back.
+thread_local bool tWaiting = false;
+
+// A reply's text is made only when the traffic log shows it: a large reply's text costs more than
+// decoding it.
+void logReply(const Reply& r) {
+    if (logTraffic().enabled(log::Level::Debug)) log::debug(logTraffic(), "reply: %@", r.description());
+}
+}  // namespace
+
 AXDaemonClient::AXDaemonClient(const std::optional<std::string>& serviceName)
     : serviceName_(serviceName.value_or(kDefaultServiceName)),
       replyQueue_(corvane::dispatch::Queue::create("axd_client")) {
@@ -57,9 +69,18 @@ void AXDaemonClient::setUuids(Dictionary& message, const std::vector<UUID>& uuid
 }
 
 void AXDaemonClient::send(const Value& message, Completion reply) {
-    log::debug(logTraffic(), "request: %@", message);
+    if (logTraffic().enabled(log::Level::Debug)) log::debug(logTraffic(), "request: %@", message);
+    if (tWaiting) {
+        tWaiting = false;  // one request per operation; any further one goes the usual way
+        Reply r = connection()->sendWithReplySync(message);
+        // Completions of earlier requests were queued before this reply came; they run first.
+        replyQueue_->sync([] {});
+        logReply(r);
+        reply(r);
+        return;
+    }
     connection()->sendWithReply(message, replyQueue_, [reply = std::move(reply)](const Reply& r) {
-        log::debug(logTraffic(), "reply: %@", r.description());
+        logReply(r);
         reply(r);
     });
 }
@@ -129,7 +150,11 @@ void AXDaemonClient::copyReceipt(Completion reply) { send(Value(request(request:
 
 Reply AXDaemonClient::wait(const std::function<void(Completion)>& operation) {
     replyQueue_->assertNotCurrent();
-    return corvane::dispatch::waitForCallback<Reply>(operation);
+    return corvane::dispatch::waitForCallback<Reply>([&](Completion done) {
+        tWaiting = true;
+        operation(std::move(done));
+        tWaiting = false;
+    });
 }
 
 Status AXDaemonClient::errorInReply(const Reply& reply) {

@@ -52,6 +52,7 @@ public:
 
     // Runs one request operation and waits for its reply: for tools and tests, e.g.
     //   auto r = client.wait([&](auto done) { client.addPlugIns({path}, done); });
+    // The request is sent and its reply read on the calling thread, and the completion runs there.
     corvane::rpx::Reply wait(const std::function<void(Completion)>& operation);
 
     // The error a reply carries, or an ok status for success. A failed exchange is code 4 with the

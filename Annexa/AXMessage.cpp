@@ -4,21 +4,12 @@ namespace annexa {
 
 namespace {
 
-// Whether every value inside is one an in-memory value can hold.
+// Whether every value inside is one an in-memory value can hold. An encoded container knows what
+// it holds without being decoded.
 bool carriable(const Value& v) {
-    switch (v.kind()) {
-        case Value::Kind::Null:
-        case Value::Kind::Fd: return false;
-        case Value::Kind::Array:
-            for (const Value& e : *v.asArray())
-                if (!carriable(e)) return false;
-            return true;
-        case Value::Kind::Dictionary:
-            for (const auto& [k, e] : *v.asDictionary())
-                if (!carriable(e)) return false;
-            return true;
-        default: return true;
-    }
+    constexpr uint32_t kNotCarried = 1u << static_cast<unsigned>(Value::Kind::Null) |
+                                     1u << static_cast<unsigned>(Value::Kind::Fd);
+    return (v.kindsInside() & kNotCarried) == 0;
 }
 
 }  // namespace

@@ -5,6 +5,7 @@
 
 #include "Annexa/AXSandboxExtension.h"
 #include "platform/layout/Layout.h"
+#include "platform/rpx/Wire.h"
 
 namespace annexa {
 
@@ -65,6 +66,7 @@ corvane::vantry::PlugInRecordPtr AXDPlugIn::vtproxy() const {
 void AXDPlugIn::setVtproxy(corvane::vantry::PlugInRecordPtr record) {
     corvane::MutexLock lock(mutex_);
     vtproxy_ = std::move(record);
+    encodedForm_.reset();
 }
 
 // The caches fill on the first read that gets an answer; a missing answer is asked again next time.
@@ -76,6 +78,7 @@ std::optional<std::string> AXDPlugIn::localizedName() const {
 void AXDPlugIn::setLocalizedName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
     localizedName_ = v;
+    encodedForm_.reset();
 }
 std::optional<std::string> AXDPlugIn::localizedShortName() const {
     corvane::MutexLock lock(mutex_);
@@ -85,6 +88,7 @@ std::optional<std::string> AXDPlugIn::localizedShortName() const {
 void AXDPlugIn::setLocalizedShortName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
     localizedShortName_ = v;
+    encodedForm_.reset();
 }
 std::optional<std::string> AXDPlugIn::localizedContainingName() const {
     corvane::MutexLock lock(mutex_);
@@ -95,6 +99,7 @@ std::optional<std::string> AXDPlugIn::localizedContainingName() const {
 void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
     localizedContainingName_ = v;
+    encodedForm_.reset();
 }
 
 Status AXDPlugIn::diagnose() const {
@@ -146,6 +151,35 @@ Dictionary AXDPlugIn::issueResourceExtensions(const Value& resources) const {
         }
     }
     return result;
+}
+
+corvane::Result<AXDPlugIn::EncodedFormPtr> AXDPlugIn::encodedForm() const {
+    {
+        corvane::MutexLock lock(mutex_);
+        if (encodedForm_) return *encodedForm_;
+    }
+    // Made outside the lock (the export reads the names under it); two threads may both make it,
+    // and the results are the same.
+    corvane::Result<EncodedFormPtr> made = [&]() -> corvane::Result<EncodedFormPtr> {
+        auto exported = exportForm();
+        if (!exported) return exported.error();
+        Dictionary form = *exported->asDictionary();
+        augmentForm(form);
+        form.erase(form::kAnnotations);
+        auto encoded = std::make_shared<EncodedForm>();
+        Value whole(form);
+        encoded->nesting = corvane::rpx::wire::nestingOf(whole);
+        encoded->kindsInside = whole.kindsInside();
+        for (const auto& [key, value] : form) {
+            if (!corvane::rpx::wire::appendEntry(encoded->entries, key, value))
+                return makeError(AXErrorCode::PlugInUnusable, "cannot export plug-in: a value cannot be sent");
+            ++encoded->count;
+        }
+        return EncodedFormPtr(std::move(encoded));
+    }();
+    corvane::MutexLock lock(mutex_);
+    encodedForm_ = made;
+    return made;
 }
 
 Dictionary AXDPlugIn::prunedInfoDictionaryFor(const Value& dictionary) {

@@ -47,6 +47,18 @@ public:
     void augmentForm(Dictionary& form) const;
     // Resource name -> read token, for a name or a list of names ("." is the bundle itself).
     Dictionary issueResourceExtensions(const Value& resources) const;
+    // The form as the match reply sends it, encoded for the wire: every entry of exportForm and
+    // augmentForm but "annotations", which each reply takes from the annotation store. Made once and
+    // kept until the registry record or a name is replaced; the export's error when there is none.
+    struct EncodedForm {
+        std::string entries;  // `count` dictionary entries, one after the other
+        uint32_t count = 0;
+        size_t nesting = 0;       // of the whole form (corvane::rpx::wire::nestingOf)
+        uint32_t kindsInside = 0;  // of the whole form (Value::kindsInside)
+    };
+    using EncodedFormPtr = std::shared_ptr<const EncodedForm>;
+    corvane::Result<EncodedFormPtr> encodedForm() const;
+
     // The entries whose keys do not begin with "DT".
     static Dictionary prunedInfoDictionaryFor(const Value& dictionary);
 
@@ -97,6 +109,7 @@ private:
     mutable std::optional<std::string> localizedName_ GUARDED_BY(mutex_);
     mutable std::optional<std::string> localizedShortName_ GUARDED_BY(mutex_);
     mutable std::optional<std::string> localizedContainingName_ GUARDED_BY(mutex_);
+    mutable std::optional<corvane::Result<EncodedFormPtr>> encodedForm_ GUARDED_BY(mutex_);
 };
 
 using AXDPlugInPtr = std::shared_ptr<AXDPlugIn>;

@@ -2,6 +2,7 @@
 // the host's rules, the user's exclusions, authorization and export; registrations of one
 // identifier collapse to one answer; plug-ins that replace others are marked. With the flag of our
 // own, the reply also says for every installed plug-in the step that left it out.
+#include <algorithm>
 #include <list>
 #include <map>
 #include <unordered_map>
@@ -11,6 +12,7 @@
 #include "axd/AXDRpxClient.h"
 #include "axd/AXDServer.h"
 #include "axd/Transaction.h"
+#include "platform/rpx/Wire.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/trace/Trace.h"
 
@@ -20,10 +22,12 @@ namespace log = corvane::log;
 
 namespace {
 
-// One form chosen so far.
+// One form chosen so far: the plug-in, its encoded form and what this request adds to it.
 struct Chosen {
-    Dictionary form;
     const AXDPlugIn* plugIn;
+    AXDPlugIn::EncodedFormPtr form;
+    Value annotations;
+    std::optional<std::string> overrider, overriding;
 };
 using ResultList = std::list<Chosen>;
 
@@ -48,30 +52,27 @@ private:
     std::unordered_map<std::string, std::vector<ResultList::iterator>> byIdentifier_;
 };
 
-std::string stringIn(const Dictionary& form, const char* key) {
-    auto it = form.find(key);
-    const std::string* s = it == form.end() ? nullptr : it->second.asString();
-    return s ? *s : std::string();
+std::string versionText(const AXDPlugIn& p) {
+    Value version = p.version();
+    const std::string* text = version.asString();
+    return text ? *text : std::string();
 }
 
 // Decides between p and the forms of the same identifier chosen so far: false drops p; true lets
-// it go on, after removing the form it displaces, if any.
+// it go on, after removing the form it displaces, if any. A chosen form says what its plug-in
+// says: its "version", "systemResident", "lastmodified" and "uuid" are read from the plug-in.
 bool collapse(const AXDPlugIn& p, Results& results, uint64_t flags, std::map<const AXDPlugIn*, std::string>& outcome,
               bool explain) {
     using namespace discovery;
     std::string identifier = p.identifier().value_or("");
     auto& same = results.of(identifier);
-    Value version = p.version();
-    const std::string* pVersion = version.asString();
+    std::string pVersion = versionText(p);
     for (size_t i = 0; i < same.size(); ++i) {
-        const Dictionary& m = same[i]->form;
-        Ordering order = compareVersionString(pVersion ? *pVersion : "", stringIn(m, "version"));
+        const AXDPlugIn& m = *same[i]->plugIn;
+        Ordering order = compareVersionString(pVersion, versionText(m));
         bool newer = order == Ordering::Descending;
         bool equal = order == Ordering::Same;
-        auto mSystem = m.find("systemResident");
-        auto mModified = m.find("lastmodified");
-        bool preferP = (p.onSystemVolume() && !(mSystem != m.end() && mSystem->second.isTrue())) ||
-                       p.lastModified() > (mModified != m.end() ? mModified->second.int64Value().value_or(0) : 0);
+        bool preferP = (p.onSystemVolume() && !m.onSystemVolume()) || p.lastModified() > m.lastModified();
         bool decided = false;
         bool keepP = false;
         if (!(flags & kAllVersions)) {
@@ -82,17 +83,44 @@ bool collapse(const AXDPlugIn& p, Results& results, uint64_t flags, std::map<con
             keepP = preferP;
         }
         if (!decided) continue;
-        const AXDPlugIn* other = same[i]->plugIn;
-        std::string otherUuid = stringIn(m, "uuid");
         if (keepP) {
-            if (explain) outcome[other] = "collapsed in favour of " + p.uuid()->string();
+            if (explain) outcome[&m] = "collapsed in favour of " + p.uuid()->string();
             results.remove(identifier, i);
         } else if (explain) {
-            outcome[&p] = "collapsed in favour of " + otherUuid;
+            outcome[&p] = "collapsed in favour of " + m.uuid()->string();
         }
         return keepP;
     }
     return true;
+}
+
+// The "matches" array as the wire carries it: each chosen plug-in's encoded form with this
+// request's annotations and replacement marks in front. Null when a form holds a value that a
+// message cannot carry, as the reply conversion would give.
+Value encodeMatches(const ResultList& list) {
+    namespace wire = corvane::rpx::wire;
+    constexpr uint32_t kNotCarried = 1u << static_cast<unsigned>(Value::Kind::Null) |
+                                     1u << static_cast<unsigned>(Value::Kind::Fd);
+    auto bytes = std::make_shared<std::string>();
+    size_t size = 16;
+    for (const auto& chosen : list) size += chosen.form->entries.size() + 64;
+    bytes->reserve(size);
+    wire::appendArrayHeader(*bytes, static_cast<uint32_t>(list.size()));
+    size_t nesting = 0;
+    uint32_t kinds = 0;
+    for (const auto& chosen : list) {
+        uint32_t count = chosen.form->count + 1 + (chosen.overrider ? 1 : 0) + (chosen.overriding ? 1 : 0);
+        wire::appendDictionaryHeader(*bytes, count);
+        bool written = wire::appendEntry(*bytes, form::kAnnotations, chosen.annotations);
+        if (chosen.overrider) written = written && wire::appendEntry(*bytes, form::kOverrider, Value(*chosen.overrider));
+        if (chosen.overriding) written = written && wire::appendEntry(*bytes, form::kOverriding, Value(*chosen.overriding));
+        if (!written) return Value();
+        bytes->append(chosen.form->entries);
+        nesting = std::max({nesting, chosen.form->nesting + 1, wire::nestingOf(chosen.annotations) + 2});
+        kinds |= chosen.form->kindsInside | chosen.annotations.kindsInside();
+    }
+    if (kinds & kNotCarried) return Value();
+    return wire::encodedContainer(std::move(bytes), nesting, kinds);
 }
 
 }  // namespace
@@ -164,19 +192,16 @@ void Transaction::matchPlugIns() {
             if (explain) outcome[p.get()] = *refusal;
             continue;
         }
-        auto exported = p->exportForm();
-        if (!exported) {
+        auto encoded = p->encodedForm();
+        if (!encoded) {
             log::error(logOps(), "failed to export matching plug-in %{public}@: %{public}@", p->uuid()->string(),
-                       exported.error());
-            if (explain) outcome[p.get()] = "cannot be exported: " + exported.error().description();
+                       encoded.error());
+            if (explain) outcome[p.get()] = "cannot be exported: " + encoded.error().description();
             continue;
         }
         if (!collapse(*p, results, flags, outcome, explain)) continue;
-        Dictionary form = *exported->asDictionary();
-        addAnnotationForPlugIn(*p, form);
-        p->augmentForm(form);
         std::string identifier = p->identifier().value_or("");
-        results.append(identifier, Chosen{std::move(form), p.get()});
+        results.append(identifier, Chosen{p.get(), *encoded, annotationsForForm(*p), {}, {}});
         if (explain) outcome[p.get()] = "returned";
         Value replaces = p->valueForEntitlement(keys::kReplaceEntitlement);
         if (const std::string* one = replaces.asString()) {
@@ -187,16 +212,17 @@ void Transaction::matchPlugIns() {
         }
     }
     for (auto& chosen : results.list()) {
-        auto o = overrides.find(stringIn(chosen.form, "identifier"));
+        auto o = overrides.find(chosen.plugIn->identifier().value_or(""));
         if (o == overrides.end()) continue;
-        chosen.form["overrider"] = o->second->form["uuid"];
-        o->second->form["overriding"] = chosen.form["identifier"];
-        log::info(logOps(), "plug-in %{public}@ overrides %{public}@", o->second->form["uuid"], chosen.form["uuid"]);
+        std::string overriderUuid = o->second->plugIn->uuid()->string();
+        std::string overriddenUuid = chosen.plugIn->uuid()->string();
+        chosen.overrider = overriderUuid;
+        o->second->overriding = chosen.plugIn->identifier().value_or("");
+        log::info(logOps(), "plug-in %{public}@ overrides %{public}@", overriderUuid, overriddenUuid);
     }
     log::info(logOps(), "match returned %u plug-ins", static_cast<unsigned>(results.list().size()));
-    Array forms;
-    for (auto& chosen : results.list()) forms.push_back(Value(std::move(chosen.form)));
-    if (auto converted = AXDaemonClient::convertToRPX(Value(std::move(forms)), version())) reply()[message::kMatches] = *converted;
+    // What the reply conversion gives for this request's version: nothing but at the current one.
+    if (version() == kCurrentProtocolVersion) reply()[message::kMatches] = encodeMatches(results.list());
     if (explain) {
         Array explanations;
         for (const auto& p : candidates) {

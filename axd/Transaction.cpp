@@ -156,9 +156,9 @@ bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>
     return true;
 }
 
-void Transaction::addAnnotationForPlugIn(const AXDPlugIn& plugIn, Dictionary& form) {
+Value Transaction::annotationsForForm(const AXDPlugIn& plugIn) {
     Value annotation = server().annotationForPlugIn(plugIn);
-    form[message::kAnnotations] = annotation.isNull() ? Value(Dictionary{}) : annotation;
+    return annotation.isNull() ? Value(Dictionary{}) : annotation;
 }
 
 // ---- registration

@@ -44,7 +44,8 @@ public:
     void processPaths(const std::function<Walk(const std::string& path, bool resolved)>& handler);
     // Walks "uuids", looking each plug-in up. False when the walk stopped (the reply was sent).
     bool processUuidList(const std::function<Walk(const AXDPlugInPtr& plugIn)>& handler);
-    void addAnnotationForPlugIn(const AXDPlugIn& plugIn, Dictionary& form);
+    // A form's "annotations": the user's annotations of the plug-in, or an empty dictionary.
+    Value annotationsForForm(const AXDPlugIn& plugIn);
 
     // The request handlers.
     void addPlugIns();

@@ -187,7 +187,8 @@ int runMatch(int argc, char** argv) {
     double tenP50 = axbench::percentile(tenSamples, 50), tenP99 = axbench::percentile(tenSamples, 99);
     double pingP50 = axbench::percentile(pingSamples, 50);
     double allMs = axbench::percentile(allSamples, 50), scanMs = axbench::percentile(scanSamples, 50);
-    std::printf("ten: %zu plug-ins; all: %zu through axd, %zu by scanning\n", firstForms->size(), allCount, scanCount);
+    std::printf("ten: %zu plug-ins, reply %zu bytes; all: %zu through axd, %zu by scanning\n", firstForms->size(),
+                replySize, allCount, scanCount);
     std::printf("RESULT match n=%d ten_p50_us=%.1f ten_p99_us=%.1f pingpong_p50_us=%.1f ratio_ten=%.2f all_ms=%.1f "
                 "scan_ms=%.1f speedup_all=%.1f cold_ms=%.1f rss_mb=%.1f\n",
                 plugins, tenP50, tenP99, pingP50, tenP50 / pingP50, allMs, scanMs, scanMs / allMs, coldMs,

@@ -1,5 +1,7 @@
 #include "platform/rpx/Wire.h"
 
+#include <algorithm>
+#include <cstdint>
 #include <cstring>
 
 namespace corvane::rpx::wire {
@@ -36,6 +38,12 @@ uint64_t get(std::string_view s, size_t at, int bytes) {
 
 bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t depth, size_t maxDepth) {
     if (depth > maxDepth) return false;
+    if (const Value::Encoding* e = v.encoding()) {
+        // Never holds a descriptor: the decoder and encodedContainer leave those out.
+        if (depth + e->nesting > maxDepth) return false;
+        out.append(e->bytes);
+        return true;
+    }
     using K = Value::Kind;
     switch (v.kind()) {
         case K::Null: out.push_back(kNull); break;
@@ -98,11 +106,20 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
     return true;
 }
 
+constexpr uint32_t bit(Value::Kind k) { return 1u << static_cast<unsigned>(k); }
+
+// Array elements of at least this many bytes in a large frame are decoded when first looked at.
+constexpr size_t kLazyElementBytes = 512;
+// Frames from this size on are decoded lazily (their payload is kept for the elements).
+constexpr size_t kLazyFrameBytes = 64 * 1024;
+
+Value decodeValidated(std::string_view bytes);
+
 class Decoder {
 public:
     Decoder(std::string_view s, const std::vector<std::shared_ptr<FileDescriptor>>& fds,
-            size_t maxDepth)
-        : s_(s), fds_(fds), maxDepth_(maxDepth) {}
+            size_t maxDepth, std::shared_ptr<const std::string> buffer = nullptr)
+        : s_(s), fds_(fds), maxDepth_(maxDepth), buffer_(std::move(buffer)) {}
 
     std::optional<Value> all() {
         auto v = value(0);
@@ -114,7 +131,14 @@ private:
     std::string_view s_;
     const std::vector<std::shared_ptr<FileDescriptor>>& fds_;
     size_t maxDepth_;
+    // When set, `s_` lies inside it and large array elements are decoded lazily.
+    std::shared_ptr<const std::string> buffer_;
     size_t pos_ = 0;
+
+    struct Shape {
+        size_t nesting = 0;
+        uint32_t kinds = 0;
+    };
 
     bool has(size_t n) const { return n <= s_.size() - pos_; }
     std::optional<uint64_t> take(int bytes) {
@@ -123,13 +147,88 @@ private:
         pos_ += static_cast<size_t>(bytes);
         return v;
     }
-    std::optional<std::string> text() {
+    std::optional<std::string_view> textView() {
         auto n = take(4);
         if (!n || !has(*n)) return std::nullopt;
-        std::string s(s_.substr(pos_, *n));
+        std::string_view s = s_.substr(pos_, *n);
         pos_ += *n;
         if (!isValidUtf8(s)) return std::nullopt;
         return s;
+    }
+    std::optional<std::string> text() {
+        auto s = textView();
+        if (!s) return std::nullopt;
+        return std::string(*s);
+    }
+
+    // Walks one value as value() would decode it, checking the same things, without building it.
+    std::optional<Shape> skip(size_t depth) {
+        using K = Value::Kind;
+        if (depth > maxDepth_ || !has(1)) return std::nullopt;
+        auto tag = static_cast<uint8_t>(s_[pos_++]);
+        auto fixed = [&](K kind, size_t bytes) -> std::optional<Shape> {
+            if (!has(bytes)) return std::nullopt;
+            pos_ += bytes;
+            return Shape{0, bit(kind)};
+        };
+        switch (tag) {
+            case kNull: return Shape{0, bit(K::Null)};
+            case kFalse:
+            case kTrue: return Shape{0, bit(K::Bool)};
+            case kInt64: return fixed(K::Int64, 8);
+            case kUInt64: return fixed(K::UInt64, 8);
+            case kDouble: return fixed(K::Double, 8);
+            case kDate: return fixed(K::Date, 8);
+            case kUUID: return fixed(K::UUID, 16);
+            case kString:
+                if (!textView()) return std::nullopt;
+                return Shape{0, bit(K::String)};
+            case kData: {
+                auto n = take(4);
+                if (!n) return std::nullopt;
+                return fixed(K::Data, *n);
+            }
+            case kArray:
+            case kDictionary: {
+                bool isArray = tag == kArray;
+                auto n = take(4);
+                if (!n || !has(*n * (isArray ? 1 : 5))) return std::nullopt;
+                Shape shape{0, bit(isArray ? K::Array : K::Dictionary)};
+                for (uint64_t i = 0; i < *n; ++i) {
+                    if (!isArray && !textView()) return std::nullopt;
+                    auto e = skip(depth + 1);
+                    if (!e) return std::nullopt;
+                    shape.nesting = std::max(shape.nesting, e->nesting + 1);
+                    shape.kinds |= e->kinds;
+                }
+                return shape;
+            }
+            case kFd: {
+                auto index = take(4);
+                if (!index || *index >= fds_.size()) return std::nullopt;
+                return Shape{0, bit(K::Fd)};
+            }
+            default: return std::nullopt;
+        }
+    }
+
+    // One array element: a large container without descriptors is kept encoded, to be decoded
+    // when it is first looked at; anything else is decoded now.
+    std::optional<Value> element(size_t depth) {
+        if (!buffer_ || !has(1) || (s_[pos_] != kArray && s_[pos_] != kDictionary)) return value(depth);
+        size_t start = pos_;
+        auto shape = skip(depth);
+        if (!shape) return std::nullopt;
+        if (pos_ - start < kLazyElementBytes || (shape->kinds & bit(Value::Kind::Fd))) {
+            pos_ = start;
+            return value(depth);
+        }
+        return Value::encoded({.kind = s_[start] == kArray ? Value::Kind::Array : Value::Kind::Dictionary,
+                               .buffer = buffer_,
+                               .bytes = s_.substr(start, pos_ - start),
+                               .nesting = shape->nesting,
+                               .kindsInside = shape->kinds,
+                               .decode = decodeValidated});
     }
 
     std::optional<Value> value(size_t depth) {
@@ -187,7 +286,7 @@ private:
                 Array a;
                 a.reserve(*n);
                 for (uint64_t i = 0; i < *n; ++i) {
-                    auto e = value(depth + 1);
+                    auto e = element(depth + 1);
                     if (!e) return std::nullopt;
                     a.push_back(std::move(*e));
                 }
@@ -216,7 +315,59 @@ private:
     }
 };
 
+// The bytes were checked when the element was skipped; the depth was checked there too.
+Value decodeValidated(std::string_view bytes) {
+    static const std::vector<std::shared_ptr<FileDescriptor>> kNoFds;
+    auto v = Decoder(bytes, kNoFds, SIZE_MAX).all();
+    return v ? std::move(*v) : Value();
+}
+
 }  // namespace
+
+void appendArrayHeader(std::string& out, uint32_t count) {
+    out.push_back(static_cast<char>(kArray));
+    put32(out, count);
+}
+
+void appendDictionaryHeader(std::string& out, uint32_t count) {
+    out.push_back(static_cast<char>(kDictionary));
+    put32(out, count);
+}
+
+bool appendEntry(std::string& out, std::string_view key, const Value& value) {
+    if (value.kindsInside() & bit(Value::Kind::Fd)) return false;
+    size_t before = out.size();
+    put32(out, static_cast<uint32_t>(key.size()));
+    out += key;
+    std::vector<int> fds;
+    if (!encode(out, value, fds, 0, SIZE_MAX)) {
+        out.resize(before);
+        return false;
+    }
+    return true;
+}
+
+size_t nestingOf(const Value& value) {
+    if (const Value::Encoding* e = value.encoding()) return e->nesting;
+    size_t deepest = 0;
+    if (const Array* a = value.asArray()) {
+        for (const Value& e : *a) deepest = std::max(deepest, nestingOf(e) + 1);
+    } else if (const Dictionary* d = value.asDictionary()) {
+        for (const auto& [k, e] : *d) deepest = std::max(deepest, nestingOf(e) + 1);
+    }
+    return deepest;
+}
+
+Value encodedContainer(std::shared_ptr<const std::string> bytes, size_t nesting, uint32_t kindsInside) {
+    Value::Kind kind = !bytes->empty() && (*bytes)[0] == kArray ? Value::Kind::Array : Value::Kind::Dictionary;
+    std::string_view view = *bytes;
+    return Value::encoded({.kind = kind,
+                           .buffer = std::move(bytes),
+                           .bytes = view,
+                           .nesting = nesting,
+                           .kindsInside = kindsInside | bit(kind),
+                           .decode = decodeValidated});
+}
 
 std::optional<std::string> encodeFrame(const Frame& frame, std::vector<int>& fds, size_t maxDepth) {
     std::string out(kHeaderSize, '\0');
@@ -240,6 +391,13 @@ std::optional<Value> decodeValue(std::string_view payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
                                  size_t maxDepth) {
     return Decoder(payload, fds, maxDepth).all();
+}
+
+std::optional<Value> decodeValue(std::shared_ptr<const std::string> payload,
+                                 const std::vector<std::shared_ptr<FileDescriptor>>& fds,
+                                 size_t maxDepth) {
+    std::string_view view = *payload;
+    return Decoder(view, fds, maxDepth, std::move(payload)).all();
 }
 
 FrameReader::Status FrameReader::next(Frame& frame, std::string& error) {
@@ -266,7 +424,10 @@ FrameReader::Status FrameReader::next(Frame& frame, std::string& error) {
     std::vector<std::shared_ptr<FileDescriptor>> fds(fds_.begin(),
                                                      fds_.begin() + static_cast<long>(fdCount));
     fds_.erase(fds_.begin(), fds_.begin() + static_cast<long>(fdCount));
-    auto body = decodeValue(rest.substr(kHeaderSize, length), fds, maxDepth_);
+    std::string_view payload = rest.substr(kHeaderSize, length);
+    auto body = payload.size() >= kLazyFrameBytes
+                    ? decodeValue(std::make_shared<const std::string>(payload), fds, maxDepth_)
+                    : decodeValue(payload, fds, maxDepth_);
     if (!body) {
         error = "frame does not decode";
         return Status::Error;

@@ -36,6 +36,30 @@ std::optional<Value> decodeValue(std::string_view payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
                                  size_t maxDepth);
 
+// The same for a payload that the decoded value may keep: large array elements (dictionaries and
+// arrays of 512 bytes and more, without descriptors) are checked now and decoded when first looked
+// at. Frames of 64 KiB and more are decoded so.
+std::optional<Value> decodeValue(std::shared_ptr<const std::string> payload,
+                                 const std::vector<std::shared_ptr<FileDescriptor>>& fds,
+                                 size_t maxDepth);
+
+// ---- encodings put together from parts
+// For a sender that keeps parts of its messages encoded once and sends them many times. The
+// entries of a dictionary may come in any order; a key that comes twice keeps its last value.
+
+void appendArrayHeader(std::string& out, uint32_t count);
+void appendDictionaryHeader(std::string& out, uint32_t count);
+// Appends one dictionary entry, its key and value; false (and nothing appended) for a value that
+// holds a descriptor.
+bool appendEntry(std::string& out, std::string_view key, const Value& value);
+// How deep values nest inside `value`: 0 for a scalar or an empty container, 1 for a container of
+// scalars, and so on.
+size_t nestingOf(const Value& value);
+// A dictionary or array given by `bytes`, one whole encoding without descriptors: an encoder copies
+// it, and it is decoded when first looked at. `nesting` and `kindsInside` describe its contents
+// (Value::Encoding).
+Value encodedContainer(std::shared_ptr<const std::string> bytes, size_t nesting, uint32_t kindsInside);
+
 // Reassembles frames from a byte stream that arrives in pieces of any size, with the descriptors
 // that arrived alongside.
 class FrameReader {

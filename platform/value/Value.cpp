@@ -10,6 +10,7 @@
 #include <cmath>
 #include <cstring>
 #include <limits>
+#include <mutex>
 
 namespace corvane {
 
@@ -105,6 +106,47 @@ int FileDescriptor::release() noexcept {
     return fd;
 }
 
+// ---- containers known by their encoding
+
+class EncodedContainer {
+public:
+    explicit EncodedContainer(Value::Encoding encoding) : encoding_(std::move(encoding)) {}
+    const Value::Encoding& encoding() const { return encoding_; }
+    const Value& decoded() const {
+        std::call_once(once_, [this] { decoded_ = encoding_.decode(encoding_.bytes); });
+        return decoded_;
+    }
+
+private:
+    Value::Encoding encoding_;
+    mutable std::once_flag once_;
+    mutable Value decoded_;
+};
+
+Value Value::encoded(Encoding encoding) {
+    Value v;
+    v.v_ = std::make_shared<const EncodedContainer>(std::move(encoding));
+    return v;
+}
+
+const Value::Encoding* Value::encoding() const {
+    const auto* p = std::get_if<std::shared_ptr<const EncodedContainer>>(&v_);
+    return p ? &(*p)->encoding() : nullptr;
+}
+
+Value::Kind Value::encodedKind() const { return encoding()->kind; }
+
+uint32_t Value::kindsInside() const {
+    if (const Encoding* e = encoding()) return e->kindsInside;
+    uint32_t kinds = 1u << static_cast<unsigned>(kind());
+    if (const Array* a = asArray()) {
+        for (const Value& e : *a) kinds |= e.kindsInside();
+    } else if (const Dictionary* d = asDictionary()) {
+        for (const auto& [k, e] : *d) kinds |= e.kindsInside();
+    }
+    return kinds;
+}
+
 // ---- Value
 
 Value::Value(Array a) : v_(std::make_shared<const Array>(std::move(a))) {}
@@ -153,13 +195,15 @@ bool Value::isNumber() const {
 }
 
 const Dictionary* Value::asDictionary() const& {
-    const auto* p = std::get_if<std::shared_ptr<const Dictionary>>(&v_);
-    return p ? p->get() : nullptr;
+    if (const auto* p = std::get_if<std::shared_ptr<const Dictionary>>(&v_)) return p->get();
+    if (const auto* e = std::get_if<std::shared_ptr<const EncodedContainer>>(&v_)) return (*e)->decoded().asDictionary();
+    return nullptr;
 }
 
 const Array* Value::asArray() const& {
-    const auto* p = std::get_if<std::shared_ptr<const Array>>(&v_);
-    return p ? p->get() : nullptr;
+    if (const auto* p = std::get_if<std::shared_ptr<const Array>>(&v_)) return p->get();
+    if (const auto* e = std::get_if<std::shared_ptr<const EncodedContainer>>(&v_)) return (*e)->decoded().asArray();
+    return nullptr;
 }
 
 const Bytes* Value::asData() const& {

@@ -75,6 +75,7 @@ private:
 };
 
 class Value;
+class EncodedContainer;
 template <class T>
 class Result;
 using Dictionary = std::map<std::string, Value, std::less<>>;
@@ -120,7 +121,10 @@ public:
     static Value data(Bytes bytes);
     static Value data(const void* bytes, size_t size);
 
-    Kind kind() const { return static_cast<Kind>(v_.index()); }
+    Kind kind() const {
+        size_t i = v_.index();
+        return i < kEncodedIndex ? static_cast<Kind>(i) : encodedKind();
+    }
     static const char* kindName(Kind kind);
 
     bool isNull() const { return kind() == Kind::Null; }
@@ -189,11 +193,34 @@ public:
 
     static const Value& null();
 
+    // ---- containers known by their wire encoding (docs/rpx-wire.md)
+    // A dictionary or array may be held as its encoding alone: it is decoded by `decode` on the
+    // first look inside it (from any thread, once), and an encoder copies its bytes as they are. A
+    // receiver of a large message decodes the parts it reads; a sender keeps parts it sends often
+    // encoded once.
+    struct Encoding {
+        Kind kind = Kind::Null;           // Array or Dictionary
+        std::shared_ptr<const std::string> buffer;  // owns the bytes
+        std::string_view bytes;           // the value's whole encoding, inside `buffer`
+        size_t nesting = 0;               // levels of containers, the value itself included
+        uint32_t kindsInside = 0;         // bit (1 << Kind) for every kind inside, the value's own too
+        Value (*decode)(std::string_view bytes) = nullptr;  // never fails on these bytes
+    };
+    static Value encoded(Encoding encoding);
+    // The encoding of a value made by `encoded`; null for any other value.
+    const Encoding* encoding() const;
+    // Bit (1 << Kind) for every kind in this value and inside it, at any depth. Does not decode an
+    // encoded container.
+    uint32_t kindsInside() const;
+
 private:
     std::variant<std::monostate, bool, int64_t, uint64_t, double, std::string,
                  std::shared_ptr<const Bytes>, Date, corvane::UUID, std::shared_ptr<const Array>,
-                 std::shared_ptr<const Dictionary>, std::shared_ptr<FileDescriptor>>
+                 std::shared_ptr<const Dictionary>, std::shared_ptr<FileDescriptor>,
+                 std::shared_ptr<const EncodedContainer>>
         v_;
+    static constexpr size_t kEncodedIndex = 12;
+    Kind encodedKind() const;
 };
 
 // Shorthand for building small dictionaries in code: dict({{"a", 1}, {"b", "x"}}).

@@ -195,6 +195,14 @@ void write(std::string& out, const Value& v, Notation notation) {
 bool isValidUtf8(std::string_view s) {
     size_t i = 0;
     while (i < s.size()) {
+        // Most text is ASCII: eight bytes at a time while no byte has its high bit set.
+        while (i + 8 <= s.size()) {
+            uint64_t word;
+            std::memcpy(&word, s.data() + i, 8);
+            if (word & 0x8080808080808080ull) break;
+            i += 8;
+        }
+        if (i >= s.size()) break;
         auto c = static_cast<unsigned char>(s[i]);
         size_t len;
         uint32_t cp;

@@ -71,19 +71,18 @@ std::vector<PlugInRecordPtr> Store::query(
         where += (where.empty() ? "WHERE " : " AND ") + std::string("((") + col + "_kind = 1 AND " + col +
                  " IN (" + in + ")) OR " + col + "_kind = 2)";
     }
-    MutexLock lock(mutex_);
-    checkFreshness();
-    Statement q(db_, ("SELECT uuid, identifier, entitlements, record, ifnull(app_path, '') FROM plugins " +
-                              where + " ORDER BY path").c_str());
-    for (size_t i = 0; i < args.size(); ++i) q.bind(static_cast<int>(i + 1), args[i]);
-    std::vector<PlugInRecordPtr> out;
-    while (q && q.step() == SQLITE_ROW) {
-        if (filter) {
-            auto ents = plist::parse(q.blob(2));
-            if (!filter(q.text(1), ents ? *ents : Value(Dictionary{}))) continue;
-        }
-        if (auto r = recordFromRow(q.text(0), q.blob(3), q.text(4))) out.push_back(std::move(r));
+    Rows rows;
+    {
+        MutexLock lock(mutex_);
+        checkFreshness();
+        rows = rowsOf("SELECT uuid, identifier, entitlements, record, ifnull(app_path, '') FROM plugins " + where +
+                          " ORDER BY path",
+                      args);
     }
+    // The filter runs outside the lock: it may look elsewhere (the daemon's annotations) for long.
+    std::vector<PlugInRecordPtr> out;
+    for (const Row& row : *rows)
+        if (!filter || filter(row.identifier, row.entitlements)) out.push_back(row.record);
     return out;
 }
 

@@ -62,6 +62,10 @@ Store::~Store() {
         }
     }
     if (stopFd_ >= 0) ::close(stopFd_);
+    {
+        MutexLock lock(mutex_);
+        dataVersion_.reset();
+    }
     sqlite3_close_v2(db_);
 }
 
@@ -111,13 +115,38 @@ Status Store::migrate() {
 }
 
 void Store::checkFreshness() {
-    Statement q(db_, "PRAGMA data_version");
-    int64_t v = q && q.step() == SQLITE_ROW ? q.integer(0) : -2;
-    if (v != dataVersion_) {
-        byUUID_.clear();
-        apps_.clear();
-        dataVersion_ = v;
+    if (!dataVersion_) dataVersion_ = std::make_unique<Statement>(db_, "PRAGMA data_version");
+    int64_t v = *dataVersion_ && dataVersion_->step() == SQLITE_ROW ? dataVersion_->integer(0) : -2;
+    dataVersion_->reset();
+    if (v != seenDataVersion_) {
+        forgetRecords();
+        seenDataVersion_ = v;
     }
+}
+
+void Store::forgetRecords() {
+    byUUID_.clear();
+    apps_.clear();
+    rows_.clear();
+}
+
+Store::Rows Store::rowsOf(const std::string& sql, const std::vector<std::string>& args) {
+    std::string key = sql;
+    for (const auto& a : args) key += '\0' + a;
+    if (auto it = rows_.find(key); it != rows_.end()) return it->second;
+    Statement q(db_, sql.c_str());
+    for (size_t i = 0; i < args.size(); ++i) q.bind(static_cast<int>(i + 1), args[i]);
+    auto rows = std::make_shared<std::vector<Row>>();
+    while (q && q.step() == SQLITE_ROW) {
+        auto record = recordFromRow(q.text(0), q.blob(3), q.text(4));
+        if (!record) continue;
+        auto ents = plist::parse(q.blob(2));
+        rows->push_back(Row{q.text(1), ents ? *ents : Value(Dictionary{}), std::move(record)});
+    }
+    // Hosts ask a handful of different questions; a flood of distinct ones must not grow memory.
+    if (rows_.size() >= 256) rows_.clear();
+    rows_.emplace(std::move(key), rows);
+    return rows;
 }
 
 ApplicationRecordPtr Store::appFromRow(const std::string& appPath) {
@@ -159,11 +188,10 @@ PlugInRecordPtr Store::recordFromRow(const std::string& uuidText, std::string_vi
 std::vector<PlugInRecordPtr> Store::selectPlugIns(const std::string& where, const std::vector<std::string>& args) {
     MutexLock lock(mutex_);
     checkFreshness();
-    Statement q(db_, ("SELECT uuid, record, ifnull(app_path, '') FROM plugins " + where).c_str());
-    for (size_t i = 0; i < args.size(); ++i) q.bind(static_cast<int>(i + 1), args[i]);
+    Rows rows = rowsOf("SELECT uuid, identifier, entitlements, record, ifnull(app_path, '') FROM plugins " + where, args);
     std::vector<PlugInRecordPtr> out;
-    while (q && q.step() == SQLITE_ROW)
-        if (auto r = recordFromRow(q.text(0), q.blob(1), q.text(2))) out.push_back(std::move(r));
+    out.reserve(rows->size());
+    for (const Row& row : *rows) out.push_back(row.record);
     return out;
 }
 
@@ -210,8 +238,7 @@ std::vector<ApplicationRecordPtr> Store::installedApplications() {
 
 void Store::dropCaches() {
     MutexLock lock(mutex_);
-    byUUID_.clear();
-    apps_.clear();
+    forgetRecords();
 }
 
 // ---- registration
@@ -322,8 +349,7 @@ Status Store::write(const WriteBody& body) {
         (void)exec("ROLLBACK");
         return committed;
     }
-    byUUID_.clear();
-    apps_.clear();
+    forgetRecords();
     rememberPaths();
     wake();
     return {};
@@ -395,6 +421,7 @@ Status Store::registerApplication(const std::string& path, const Value& info, bo
             up.bind(4, appFingerprint);
             if (up.step() != SQLITE_DONE) return sqlError("recording an application");
             apps_.erase(path);
+            rows_.clear();  // their records name the application's old record
             changedOther_ = true;
         }
         auto before = existing("app_path = ?", path);

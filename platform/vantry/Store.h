@@ -44,6 +44,8 @@ struct Statement {
     void bindNull(int i) { sqlite3_bind_null(s, i); }
     void bindBlob(int i, const void* p, size_t n) { sqlite3_bind_blob(s, i, p, static_cast<int>(n), SQLITE_TRANSIENT); }
     int step() { return sqlite3_step(s); }
+    // Makes the statement ready to step again from the start.
+    void reset() { sqlite3_reset(s); }
     std::string text(int i) const {
         const auto* t = sqlite3_column_text(s, i);
         return t ? std::string(reinterpret_cast<const char*>(t), static_cast<size_t>(sqlite3_column_bytes(s, i))) : std::string();
@@ -163,6 +165,18 @@ private:
     Status exec(const char* sql);
     Status migrate();
     void checkFreshness() REQUIRES(mutex_);
+    // Drops every record and query answer built from the database.
+    void forgetRecords() REQUIRES(mutex_);
+    // One row of a query's answer, as the query's filter sees it.
+    struct Row {
+        std::string identifier;
+        Value entitlements;
+        PlugInRecordPtr record;
+    };
+    using Rows = std::shared_ptr<const std::vector<Row>>;
+    // The rows of a SELECT of uuid, identifier, entitlements, record and app path (in that order),
+    // from memory while the database has not changed.
+    Rows rowsOf(const std::string& sql, const std::vector<std::string>& args) REQUIRES(mutex_);
     ApplicationRecordPtr appFromRow(const std::string& appPath) REQUIRES(mutex_);
     PlugInRecordPtr recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath)
         REQUIRES(mutex_);
@@ -187,9 +201,12 @@ private:
     const std::string path_;
     sqlite3* db_ = nullptr;
     Mutex mutex_;
-    int64_t dataVersion_ GUARDED_BY(mutex_) = -1;
+    int64_t seenDataVersion_ GUARDED_BY(mutex_) = -1;
     std::unordered_map<UUID, PlugInRecordPtr, UUIDHash> byUUID_ GUARDED_BY(mutex_);
     std::map<std::string, ApplicationRecordPtr> apps_ GUARDED_BY(mutex_);
+    // Answers of queries by their SQL and arguments; a few hundred at most.
+    std::unordered_map<std::string, Rows> rows_ GUARDED_BY(mutex_);
+    std::unique_ptr<Statement> dataVersion_ GUARDED_BY(mutex_);
     // A write that changed rows without plug-in events (an application alone).
     bool changedOther_ GUARDED_BY(mutex_) = false;
     int64_t lastSeq_ GUARDED_BY(mutex_) = 0;
