@@ -139,6 +139,13 @@ bool AXDServer::holdOnPlugIn(const AXDPlugIn& plugIn) {
     });
 }
 
+std::vector<std::shared_ptr<const AXDPlugInHold>> AXDServer::currentHolds() {
+    return syncQueue_->syncResult([&] {
+        syncQueue_->assertCurrent();
+        return std::vector<std::shared_ptr<const AXDPlugInHold>>(holds_.begin(), holds_.end());
+    });
+}
+
 size_t AXDServer::holdCount() {
     return syncQueue_->syncResult([&] {
         syncQueue_->assertCurrent();

@@ -58,6 +58,9 @@ public:
     void unholdToken(const UUID& token);
     void unholdClient(const AXDRpxClient* client);
     bool holdOnPlugIn(const AXDPlugIn& plugIn);
+    // The holds as they are now, for a request that tests many plug-ins against them at once.
+    // A hold's set of blocked plug-ins never changes.
+    std::vector<std::shared_ptr<const AXDPlugInHold>> currentHolds();
     size_t holdCount();
 
     void removedPlugIns(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;

@@ -1,5 +1,7 @@
 #include "axd/AXDatabase.h"
 
+#include <unordered_set>
+
 #include <cctype>
 #include <cstdlib>
 
@@ -31,6 +33,20 @@ AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
         databaseQueue_->assertCurrent();
         auto it = cache_.find(record->uuid());
         result = it != cache_.end() ? it->second : createPlugInForProxy(record);
+    });
+    return result;
+}
+
+std::vector<AXDPlugInPtr> AXDatabase::plugInsForProxies(const std::vector<PlugInRecordPtr>& records) {
+    databaseQueue_->assertNotCurrent();
+    std::vector<AXDPlugInPtr> result;
+    result.reserve(records.size());
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
+        for (const auto& record : records) {
+            auto it = cache_.find(record->uuid());
+            result.push_back(it != cache_.end() ? it->second : createPlugInForProxy(record));
+        }
     });
     return result;
 }
@@ -175,8 +191,10 @@ std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
                        recordsText(records));
     }
     size_t before = cacheCount();
-    std::vector<AXDPlugInPtr> result;
-    std::set<UUID> seen;
+    std::vector<corvane::vantry::PlugInRecordPtr> usable;
+    usable.reserve(records.size());
+    std::unordered_set<UUID, corvane::UUIDHash> seen;
+    seen.reserve(records.size());
     for (const auto& r : records) {
         if (r->bundlePath().empty()) {
             log::info(logOps(), "skipping vt proxy %@ with nil bundleURL", r->description());
@@ -186,9 +204,11 @@ std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
             log::info(logOps(), "skipping vt proxy %@ because its app is a placeholder", r->description());
             continue;
         }
-        if (!seen.insert(r->uuid()).second) continue;
-        if (auto p = plugInForProxy(r)) result.push_back(std::move(p));
+        if (seen.insert(r->uuid()).second) usable.push_back(r);
     }
+    std::vector<AXDPlugInPtr> result;
+    for (auto& p : plugInsForProxies(usable))
+        if (p) result.push_back(std::move(p));
     log::debug(logOps(), "VT reported %u plug-ins (cache %u/%u)", static_cast<unsigned>(result.size()),
                static_cast<unsigned>(before), static_cast<unsigned>(cacheCount()));
     return result;
@@ -196,6 +216,17 @@ std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
 
 uint32_t AXDatabase::cacheLimitFromText(const char* text) {
     return static_cast<uint32_t>(std::strtol(text, nullptr, 10));
+}
+
+std::vector<Value> AXDatabase::annotationsForPlugIns(const std::vector<const AXDPlugIn*>& plugIns) {
+    databaseQueue_->assertNotCurrent();
+    std::vector<Value> result;
+    result.reserve(plugIns.size());
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
+        for (const AXDPlugIn* p : plugIns) result.push_back(annotations_->annotationForPlugIn(*p));
+    });
+    return result;
 }
 
 Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {

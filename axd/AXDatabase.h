@@ -47,6 +47,8 @@ public:
     AXDatabase& operator=(const AXDatabase&) = delete;
 
     AXDPlugInPtr plugInForProxy(const corvane::vantry::PlugInRecordPtr& record);
+    // The same for many records in one visit to the database queue; null where none can be built.
+    std::vector<AXDPlugInPtr> plugInsForProxies(const std::vector<corvane::vantry::PlugInRecordPtr>& records);
     AXDPlugInPtr createPlugInForProxy(const corvane::vantry::PlugInRecordPtr& record) REQUIRES(*databaseQueue_);
     void purgeCachesToLimit(int32_t limit) REQUIRES(*databaseQueue_);
     AXDPlugInPtr findPlugIn(const UUID& uuid);
@@ -65,6 +67,8 @@ public:
     Status removePlugIn(const std::string& path);
 
     Value annotationForPlugIn(const AXDPlugIn& plugIn);
+    // The same for many plug-ins in one visit to the database queue, in their order.
+    std::vector<Value> annotationsForPlugIns(const std::vector<const AXDPlugIn*>& plugIns);
     // Changes the annotation in memory; saveAnnotations() writes the changes of a request at once.
     void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
     // Writes the annotation file when anything changed since the last write.

@@ -35,6 +35,7 @@ using ResultList = std::list<Chosen>;
 // one identifier without walking the whole list.
 class Results {
 public:
+    explicit Results(size_t expected) { byIdentifier_.reserve(expected); }
     ResultList& list() { return list_; }
     std::vector<ResultList::iterator>& of(const std::string& identifier) { return byIdentifier_[identifier]; }
     void append(const std::string& identifier, Chosen chosen) {
@@ -66,6 +67,7 @@ bool collapse(const AXDPlugIn& p, Results& results, uint64_t flags, std::map<con
     using namespace discovery;
     std::string identifier = p.identifier().value_or("");
     auto& same = results.of(identifier);
+    if (same.empty()) return true;
     std::string pVersion = versionText(p);
     for (size_t i = 0; i < same.size(); ++i) {
         const AXDPlugIn& m = *same[i]->plugIn;
@@ -125,8 +127,9 @@ Value encodeMatches(const ResultList& list) {
 
 }  // namespace
 
-std::optional<std::string> Transaction::matchRefusal(const AXDPlugIn& p, const Value& rules, uint64_t flags,
-                                                     const std::vector<Value>& exclusions) {
+std::optional<std::string> Transaction::matchRefusal(
+    const AXDPlugIn& p, const Value& rules, uint64_t flags, const std::vector<Value>& exclusions,
+    const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds) {
     using namespace discovery;
     if (!(flags & kAll)) {
         if (!p.onSystemVolume()) {
@@ -138,7 +141,8 @@ std::optional<std::string> Transaction::matchRefusal(const AXDPlugIn& p, const V
             auto plugIns = bundle ? bundle->plugInsPath() : std::nullopt;
             if (!plugIns || p.path().rfind(*plugIns, 0) != 0) return std::string("dedicated to another application");
         }
-        if (server().holdOnPlugIn(p)) return std::string("held");
+        if (std::any_of(holds.begin(), holds.end(), [&](const auto& h) { return h->blocks(p); }))
+            return std::string("held");
     }
     if (const Dictionary* tests = rules.asDictionary()) {
         for (const auto& [key, pattern] : *tests)
@@ -185,10 +189,12 @@ void Transaction::matchPlugIns() {
     AXD_TRACE(discover__raw, static_cast<unsigned>(candidates.size()));
 
     std::map<const AXDPlugIn*, std::string> outcome;  // explain only
-    Results results;
+    // The request sees the holds as they were when it began, as it sees one registry.
+    auto holds = server().currentHolds();
+    Results results(candidates.size());
     std::unordered_map<std::string, ResultList::iterator> overrides;
     for (const auto& p : candidates) {
-        if (auto refusal = matchRefusal(*p, rules, flags, exclusions)) {
+        if (auto refusal = matchRefusal(*p, rules, flags, exclusions, holds)) {
             if (explain) outcome[p.get()] = *refusal;
             continue;
         }
@@ -201,7 +207,7 @@ void Transaction::matchPlugIns() {
         }
         if (!collapse(*p, results, flags, outcome, explain)) continue;
         std::string identifier = p->identifier().value_or("");
-        results.append(identifier, Chosen{p.get(), *encoded, annotationsForForm(*p), {}, {}});
+        results.append(identifier, Chosen{p.get(), *encoded, Value(), {}, {}});
         if (explain) outcome[p.get()] = "returned";
         Value replaces = p->valueForEntitlement(keys::kReplaceEntitlement);
         if (const std::string* one = replaces.asString()) {
@@ -221,6 +227,16 @@ void Transaction::matchPlugIns() {
         log::info(logOps(), "plug-in %{public}@ overrides %{public}@", overriderUuid, overriddenUuid);
     }
     log::info(logOps(), "match returned %u plug-ins", static_cast<unsigned>(results.list().size()));
+    // The annotations of the forms that stay, all in one visit to the database.
+    std::vector<const AXDPlugIn*> chosenPlugIns;
+    chosenPlugIns.reserve(results.list().size());
+    for (const auto& chosen : results.list()) chosenPlugIns.push_back(chosen.plugIn);
+    std::vector<Value> annotations = server().annotationsForPlugIns(chosenPlugIns);
+    size_t next = 0;
+    for (auto& chosen : results.list()) {
+        Value& annotation = annotations[next++];
+        chosen.annotations = annotation.isNull() ? Value(Dictionary{}) : std::move(annotation);
+    }
     // What the reply conversion gives for this request's version: nothing but at the current one.
     if (version() == kCurrentProtocolVersion) reply()[message::kMatches] = encodeMatches(results.list());
     if (explain) {

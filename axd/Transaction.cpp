@@ -156,11 +156,6 @@ bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>
     return true;
 }
 
-Value Transaction::annotationsForForm(const AXDPlugIn& plugIn) {
-    Value annotation = server().annotationForPlugIn(plugIn);
-    return annotation.isNull() ? Value(Dictionary{}) : annotation;
-}
-
 // ---- registration
 
 void Transaction::addPlugIns() {

@@ -15,6 +15,7 @@
 namespace annexa {
 
 class AXDRpxClient;
+class AXDPlugInHold;
 class AXDServer;
 
 // Lives on: the service queue, for the length of its handler.
@@ -44,8 +45,6 @@ public:
     void processPaths(const std::function<Walk(const std::string& path, bool resolved)>& handler);
     // Walks "uuids", looking each plug-in up. False when the walk stopped (the reply was sent).
     bool processUuidList(const std::function<Walk(const AXDPlugInPtr& plugIn)>& handler);
-    // A form's "annotations": the user's annotations of the plug-in, or an empty dictionary.
-    Value annotationsForForm(const AXDPlugIn& plugIn);
 
     // The request handlers.
     void addPlugIns();
@@ -68,10 +67,11 @@ public:
     corvane::rpx::ConnectionPtr connection() const;
 
 private:
-    // Why "match" leaves the plug-in out before export (visibility, rules, exclusions,
-    // authorization), or nothing.
+    // Why "match" leaves the plug-in out before export (visibility, the holds taken at the
+    // request's start, rules, exclusions, authorization), or nothing.
     std::optional<std::string> matchRefusal(const AXDPlugIn& plugIn, const Value& rules, uint64_t flags,
-                                            const std::vector<Value>& exclusions);
+                                            const std::vector<Value>& exclusions,
+                                            const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds);
 
     // The request's "annotations" dictionary as a Value; nullopt after answering that it is
     // missing or holds what the annotation file cannot keep.
