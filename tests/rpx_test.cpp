@@ -203,6 +203,89 @@ TEST(RpxWire, MalformedFramesAreErrorsAndTruncatedOnesWait) {
     }
 }
 
+// A large frame is decoded lazily: its large array elements stay encoded until looked at. What a
+// reader sees must not change, and a fault anywhere inside such an element still refuses the frame.
+TEST(RpxWire, LargeFramesDecodeTheirElementsOnFirstLookWithTheSameResult) {
+    Array forms;
+    for (int i = 0; i < 200; ++i) {
+        forms.push_back(dict({{"identifier", "com.example.plugin" + std::to_string(i)},
+                              {"path", std::string(600, 'p')},
+                              {"nested", dict({{"list", Value(Array{Value(1), Value("two"), Value(3.5)})}})}}));
+    }
+    forms.push_back(dict({{"small", true}}));
+    Value body = dict({{"matches", Value(forms)}});
+    std::string bytes = frameBytes(wire::FrameKind::Reply, 7, body);
+    ASSERT_GT(bytes.size(), 64u * 1024);
+
+    wire::FrameReader reader(4 << 20, rpx::kMaxDepth);
+    reader.append(bytes.data(), bytes.size());
+    wire::Frame f;
+    std::string error;
+    ASSERT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+    const Array* got = f.body["matches"].asArray();
+    ASSERT_TRUE(got);
+    EXPECT_TRUE((*got)[0].encoding()) << "a large element stays encoded";
+    EXPECT_FALSE(got->back().encoding()) << "a small one is decoded at once";
+    EXPECT_EQ((*got)[0].kind(), Value::Kind::Dictionary);
+    EXPECT_EQ((*got)[0].kindsInside() & (1u << static_cast<unsigned>(Value::Kind::Null)), 0u);
+    EXPECT_EQ(f.body, body);
+    // Sent on, the encoded elements are copied as they came: the same bytes.
+    EXPECT_EQ(frameBytes(wire::FrameKind::Reply, 7, f.body), bytes);
+
+    // The same frame with one byte of the last large element's nested list broken, in turn: an
+    // invalid UTF-8 byte in a string, an unknown tag, and a count that runs past the end.
+    size_t lastLarge = bytes.rfind("two");
+    ASSERT_NE(lastLarge, std::string::npos);
+    struct Case {
+        const char* name;
+        size_t at;
+        char byte;
+    };
+    const Case cases[] = {
+        {"invalid UTF-8 in a string", lastLarge, '\xc3'},
+        {"unknown tag", lastLarge - 5, '\x63'},
+        {"string length that lies", lastLarge - 4, '\x7f'},
+    };
+    for (const auto& c : cases) {
+        std::string broken = bytes;
+        broken[c.at] = c.byte;
+        wire::FrameReader r(4 << 20, rpx::kMaxDepth);
+        r.append(broken.data(), broken.size());
+        wire::Frame bad;
+        EXPECT_EQ(r.next(bad, error), wire::FrameReader::Status::Error) << c.name;
+    }
+}
+
+// Encodings put together from parts (as the daemon sends its plug-in forms) decode to the value
+// the parts make, whatever the order of a dictionary's entries.
+TEST(RpxWire, EncodingsPutTogetherFromPartsDecodeToTheirValue) {
+    std::string entries;
+    ASSERT_TRUE(wire::appendEntry(entries, "b", dict({{"x", Value(Array{Value(1)})}})));
+    ASSERT_TRUE(wire::appendEntry(entries, "a", "text"));
+    std::string whole;
+    wire::appendArrayHeader(whole, 1);
+    wire::appendDictionaryHeader(whole, 3);
+    ASSERT_TRUE(wire::appendEntry(whole, "c", Value(false)));
+    whole += entries;
+    EXPECT_FALSE(wire::appendEntry(whole, "fd", Value(std::make_shared<FileDescriptor>(dup(0)))));
+    Value expected = Value(Array{dict({{"a", "text"}, {"b", dict({{"x", Value(Array{Value(1)})}})}, {"c", false}})});
+    EXPECT_EQ(wire::nestingOf(expected), 4u);
+    Value made = wire::encodedContainer(std::make_shared<std::string>(whole), wire::nestingOf(expected),
+                                        expected.kindsInside());
+    EXPECT_EQ(made, expected);
+    Value body = dict({{"matches", made}});
+    std::string bytes = frameBytes(wire::FrameKind::Reply, 1, body);
+    wire::FrameReader reader(1 << 20, rpx::kMaxDepth);
+    reader.append(bytes.data(), bytes.size());
+    wire::Frame f;
+    std::string error;
+    ASSERT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+    EXPECT_EQ(f.body, dict({{"matches", expected}}));
+    // Too deep for the encoder's limit, an encoded part is refused like any other value.
+    std::vector<int> fds;
+    EXPECT_FALSE(wire::encodeFrame(wire::Frame{wire::FrameKind::Reply, 1, body}, fds, 3));
+}
+
 TEST(Rpx, TwoProcessesExchangeEveryKindIncludingDescriptors) {
     axtest::PlatformRoot root;
     axtest::Process server({axtest::binary("rpx_peer"), "server", "com.test.echo"});
