@@ -7,7 +7,7 @@
 #include <map>
 #include <unordered_map>
 
-#include "Annexa/AXDaemonClient.h"
+#include "Annexa/AXProtocol.h"
 #include "Annexa/AXMessage.h"
 #include "axd/AXDRpxClient.h"
 #include "axd/AXDServer.h"

@@ -38,7 +38,9 @@ constexpr int kPerApp = 100;
 int runMatch(int argc, char** argv) {
     int plugins = 10000;
     int requests = 500;
+    int allRepeats = 5;  // more keeps axd busy with "all" long enough to profile it
     for (int i = 1; i + 1 < argc; i += 2) {
+        if (std::strcmp(argv[i], "--all-repeats") == 0) allRepeats = std::max(1, std::atoi(argv[i + 1]));
         if (std::strcmp(argv[i], "--plugins") == 0) plugins = std::max(kPerApp, std::atoi(argv[i + 1]));
         if (std::strcmp(argv[i], "--requests") == 0) requests = std::atoi(argv[i + 1]);
     }
@@ -154,7 +156,7 @@ int runMatch(int argc, char** argv) {
     // Every plug-in, through the daemon, warm; then as a host would find them itself.
     std::vector<double> allSamples;
     size_t allCount = 0;
-    for (int i = 0; i < (getenv("AXBENCH_ALL_REPEAT") ? 200 : 5); ++i) {
+    for (int i = 0; i < allRepeats; ++i) {
         auto start = std::chrono::steady_clock::now();
         auto all = match(Value());
         allSamples.push_back(axbench::microsSince(start) / 1000);
