@@ -27,14 +27,7 @@ AXDatabase::AXDatabase(const char* database, std::shared_ptr<corvane::vantry::Re
 AXDatabase::~AXDatabase() = default;
 
 AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
-    databaseQueue_->assertNotCurrent();
-    AXDPlugInPtr result;
-    databaseQueue_->sync([&] {
-        databaseQueue_->assertCurrent();
-        auto it = cache_.find(record->uuid());
-        result = it != cache_.end() ? it->second : createPlugInForProxy(record);
-    });
-    return result;
+    return plugInsForProxies({record}).front();
 }
 
 std::vector<AXDPlugInPtr> AXDatabase::plugInsForProxies(const std::vector<PlugInRecordPtr>& records) {

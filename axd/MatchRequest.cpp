@@ -101,8 +101,6 @@ bool collapse(const AXDPlugIn& p, Results& results, uint64_t flags, std::map<con
 // message cannot carry, as the reply conversion would give.
 Value encodeMatches(const ResultList& list) {
     namespace wire = corvane::rpx::wire;
-    constexpr uint32_t kNotCarried = 1u << static_cast<unsigned>(Value::Kind::Null) |
-                                     1u << static_cast<unsigned>(Value::Kind::Fd);
     auto bytes = std::make_shared<std::string>();
     size_t size = 16;
     for (const auto& chosen : list) size += chosen.form->entries.size() + 64;
@@ -121,8 +119,8 @@ Value encodeMatches(const ResultList& list) {
         nesting = std::max({nesting, chosen.form->nesting + 1, wire::nestingOf(chosen.annotations) + 2});
         kinds |= chosen.form->kindsInside | chosen.annotations.kindsInside();
     }
-    if (kinds & kNotCarried) return Value();
-    return wire::encodedContainer(std::move(bytes), nesting, kinds);
+    // The reply conversion reads what the encoded array holds without decoding it.
+    return convertValueToMessage(wire::encodedContainer(std::move(bytes), nesting, kinds));
 }
 
 }  // namespace
