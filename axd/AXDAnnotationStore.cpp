@@ -68,17 +68,22 @@ void AXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, con
 }
 
 void AXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, const std::string& key) {
-    changed_ = true;
+    auto it = annotations_.find(key);
     if (annotation.isNull()) {
-        annotations_.erase(key);
-    } else {
-        const Dictionary* current = annotations_.count(key) ? annotations_[key].asDictionary() : nullptr;
-        Dictionary merged = current ? *current : Dictionary{};
-        if (const Dictionary* changes = annotation.asDictionary()) {
-            for (const auto& [k, v] : *changes) merged.insert_or_assign(k, v);
-        }
-        annotations_.insert_or_assign(key, Value(std::move(merged)));
+        if (it == annotations_.end()) return;
+        annotations_.erase(it);
+        changed_ = true;
+        return;
     }
+    const Dictionary* current = it != annotations_.end() ? it->second.asDictionary() : nullptr;
+    Dictionary merged = current ? *current : Dictionary{};
+    if (const Dictionary* changes = annotation.asDictionary()) {
+        for (const auto& [k, v] : *changes) merged.insert_or_assign(k, v);
+    }
+    // Setting what is already stored changes nothing, and costs no write of the file.
+    if (current && merged == *current) return;
+    annotations_.insert_or_assign(key, Value(std::move(merged)));
+    changed_ = true;
 }
 
 void AXDAnnotationStore::saveIfChanged() {

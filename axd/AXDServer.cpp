@@ -104,7 +104,7 @@ void AXDServer::unholdToken(const UUID& token) {
         syncQueue_->assertCurrent();
         for (auto it = holds_.begin(); it != holds_.end(); ++it) {
             if ((*it)->uuid() != token) continue;
-            log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token.string());
+            log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token);
             released = *it;
             holds_.erase(it);
             (void)corvane::notify::post(kAnnotationChangeNotification);

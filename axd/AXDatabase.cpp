@@ -63,20 +63,23 @@ void AXDatabase::purgeCachesToLimit(int32_t limit) {
     workspace_->dropCaches();
 }
 
-AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) {
+AXDPlugInPtr AXDatabase::findPlugIn(const UUID& uuid) { return plugInsForUUIDs(std::vector<UUID>{uuid}).front(); }
+
+std::vector<AXDPlugInPtr> AXDatabase::plugInsForUUIDs(const std::vector<UUID>& uuids) {
     databaseQueue_->assertNotCurrent();
-    AXDPlugInPtr result;
+    std::vector<AXDPlugInPtr> result(uuids.size());
     databaseQueue_->sync([&] {
         databaseQueue_->assertCurrent();
-        auto it = cache_.find(uuid);
-        if (it != cache_.end()) {
-            result = it->second;
-            return;
-        }
-        if (auto record = workspace_->plugInForUUID(uuid)) {
-            result = createPlugInForProxy(record);
-        } else {
-            log::info(logOps(), "Vantry cannot find plug-in with UUID:%{public}@", uuid.string());
+        for (size_t i = 0; i < uuids.size(); ++i) {
+            auto it = cache_.find(uuids[i]);
+            if (it != cache_.end()) {
+                result[i] = it->second;
+            } else if (auto record = workspace_->plugInForUUID(uuids[i])) {
+                result[i] = createPlugInForProxy(record);
+            } else {
+                log::info(logOps(), "Vantry cannot find plug-in with UUID:%{public}@", uuids[i]);
+            }
+            if (!result[i]) return;
         }
     });
     return result;

@@ -52,6 +52,9 @@ public:
     AXDPlugInPtr createPlugInForProxy(const corvane::vantry::PlugInRecordPtr& record) REQUIRES(*databaseQueue_);
     void purgeCachesToLimit(int32_t limit) REQUIRES(*databaseQueue_);
     AXDPlugInPtr findPlugIn(const UUID& uuid);
+    // The same for many UUIDs in one visit to the database queue, in order; the lookups stop at the
+    // first UUID that names no plug-in (null there and after it), as a walk over them stops there.
+    std::vector<AXDPlugInPtr> plugInsForUUIDs(const std::vector<UUID>& uuids);
     AXDPlugInPtr findPlugInAtPath(const std::string& path);
     // `findPlugIns:`: the candidates for a host's pattern dictionary (null or empty: every
     // installed plug-in), in the registry's order, each once; the registry drops plug-ins whose

@@ -128,7 +128,7 @@ void Transaction::lockDownPlugIns() {
     UUID token = hold->uuid();
     server().addHold(std::move(hold));
     reply_[message::kUuids] = Value(token);
-    log::debug(logOps(), "hold request granted uuid:%{public}@", token.string());
+    log::debug(logOps(), "hold request granted uuid:%{public}@", token);
     done();
 }
 

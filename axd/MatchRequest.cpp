@@ -148,12 +148,12 @@ std::optional<std::string> Transaction::matchRefusal(
     }
     for (const Value& exclusion : exclusions) {
         if (!p.match(exclusion)) continue;
-        log::debug(logOps(), "client %d plugin %{public}@ globally excluded", client_->pid(), p.uuid()->string());
+        log::debug(logOps(), "client %d plugin %{public}@ globally excluded", client_->pid(), p.uuid());
         return "excluded by the user: " + exclusion.description();
     }
     if (!(flags & kAll)) {
         if (auto reason = p.allowForClient(*client_)) {
-            log::debug(logOps(), "client %d cannot use plugin %{public}@: %{public}@", client_->pid(), p.uuid()->string(),
+            log::debug(logOps(), "client %d cannot use plugin %{public}@: %{public}@", client_->pid(), p.uuid(),
                        *reason);
             return "not allowed: " + *reason;
         }

@@ -3,6 +3,7 @@
 #include <climits>
 #include <cstdlib>
 #include <cstring>
+#include <unordered_set>
 
 #include "Annexa/AXMessage.h"
 #include "axd/AXDRpxClient.h"
@@ -140,18 +141,27 @@ bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>
         failMessage(AXErrorCode::InvalidRequest, "invalid request format (uuid)");
         return false;
     }
-    for (const Value& element : *uuids->asArray()) {
+    // The plug-ins are looked up in one visit to the database, up to the first element that is no
+    // UUID; the walk then answers for the elements in order, as if each were looked up in turn.
+    const Array& elements = *uuids->asArray();
+    std::vector<UUID> parsed;
+    parsed.reserve(elements.size());
+    for (const Value& element : elements) {
         const UUID* uuid = element.asUUID();
-        if (!uuid) {
-            failMessage(AXErrorCode::InvalidRequest, "invalid request (bad uuid array)");
-            return false;
-        }
-        AXDPlugInPtr plugIn = server().findPlugIn(*uuid);
+        if (!uuid) break;
+        parsed.push_back(*uuid);
+    }
+    std::vector<AXDPlugInPtr> plugIns = server().plugInsForUUIDs(parsed);
+    for (const AXDPlugInPtr& plugIn : plugIns) {
         if (!plugIn) {
             failMessage(AXErrorCode::InvalidRequest, "no such plugin (uuid not found)");
             return false;
         }
         if (handler(plugIn) == Walk::Stop) return false;
+    }
+    if (parsed.size() < elements.size()) {
+        failMessage(AXErrorCode::InvalidRequest, "invalid request (bad uuid array)");
+        return false;
     }
     return true;
 }
@@ -237,12 +247,15 @@ void Transaction::annotatePlugIns() {
         return;
     }
     Value c(changes);
+    // A plug-in named again in the same request is already changed.
+    std::unordered_set<const AXDPlugIn*> changed;
     bool walked = processUuidList([&](const AXDPlugInPtr& p) {
+        if (!changed.insert(p.get()).second) return Walk::Continue;
         log::debug(logOps(), "client %d plug-in %@(%{public}@) annotation change: %@", client_->pid(), p->identifier(),
-                   p->uuid()->string(), c);
+                   p->uuid(), c);
         if (changes.count(keys::kElection)) {
             log::info(logOps(), "client %d plug-in %@(%{public}@) election := %@", client_->pid(), p->identifier(),
-                      p->uuid()->string(), changes.at(keys::kElection));
+                      p->uuid(), changes.at(keys::kElection));
         }
         server().setAnnotationForPlugIn(c, *p);
         return Walk::Continue;
@@ -276,7 +289,7 @@ void Transaction::bulkAnnotatePlugIns() {
                 return;
             }
             log::debug(logOps(), "client %d plug-in %@(%{public}@) extension := %@", client_->pid(), p->identifier(),
-                       p->uuid()->string(), value);
+                       p->uuid(), value);
             server().setAnnotationForPlugIn(corvane::dict({{keys::kAnnotationExtension, value}}), *p);
         }
     }

@@ -215,6 +215,32 @@ TEST(AXDAnnotationStore, ChangesAreSavedOnceWhenAsked) {
     ::stat(path.c_str(), &after);
     EXPECT_EQ(before.st_ino, after.st_ino);
     EXPECT_EQ((*corvane::plist::readFile(path))["data"].asDictionary()->size(), 50u);
+
+    // Setting what is already stored is no change, and costs no write; anything else is one.
+    struct Case {
+        const char* name;
+        Value annotation;
+        const char* key;
+        bool changes;
+    };
+    const Case cases[] = {
+        {"the same election again", corvane::dict({{"election", 3}}), "k3", false},
+        {"an empty change", corvane::dict({}), "k3", false},
+        {"removing an entry that is not there", Value(), "nobody", false},
+        {"another election", corvane::dict({{"election", 4}}), "k3", true},
+        {"a new key beside the election", corvane::dict({{"extension", corvane::dict({})}}), "k3", true},
+        {"a new entry", corvane::dict({}), "k50", true},
+        {"removing an entry", Value(), "k0", true},
+    };
+    for (const auto& c : cases) {
+        struct stat was {};
+        ::stat(path.c_str(), &was);
+        store.changeAnnotationForIdentifier(c.annotation, c.key);
+        store.saveIfChanged();
+        struct stat now {};
+        ::stat(path.c_str(), &now);
+        EXPECT_EQ(was.st_ino != now.st_ino, c.changes) << c.name;
+    }
 }
 
 TEST(AXDAnnotationStoreDeathTest, NoContainerOrDirectoryEndsTheDaemon) {

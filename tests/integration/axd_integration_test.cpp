@@ -272,6 +272,11 @@ TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
                                                  {"uuids", Value(Array{Value(one->uuid()), Value(UUID::random())})}}));
     EXPECT_EQ(partial, error(4, "no such plugin (uuid not found)"));
     EXPECT_EQ(notify::count(kChange), 1u);
+    // A plug-in named twice, then an element that is no UUID: changed, saved, and refused.
+    Value repeated = d.send(request("annotate", {{"annotations", dict({{"election", 3}})},
+                                                  {"uuids", Value(Array{Value(two->uuid()), Value(two->uuid()), Value("two")})}}));
+    EXPECT_EQ(repeated, error(4, "invalid request (bad uuid array)"));
+    EXPECT_EQ((*plist::readFile(file))["data"]["com.example.Two"], dict({{"election", 3}}));
     // bulk-annotate replaces the extension whole and keeps the election.
     ASSERT_TRUE(plist::writeXMLFile(d.root / "bulk.plist", dict({{one->uuid().string(), dict({})}})).ok());
     ASSERT_EQ(d.axctl({"bulk-annotate", d.root / "bulk.plist"}).status, 0);
