@@ -11,21 +11,29 @@ namespace annexa {
 namespace log = corvane::log;
 
 AXDRpxClient::AXDRpxClient(const corvane::rpx::ConnectionPtr& connection, AXDServer* server)
-    : connection_(connection), server_(server), pid_(connection->pid()) {}
+    : connection_(connection),
+      server_(server),
+      pid_(connection->pid()),
+      path_(connection->peer().executablePath),
+      auditToken_(connection->peer().auditToken) {}
 
 std::shared_ptr<AXDRpxClient> AXDRpxClient::initWithConnectionServer(const corvane::rpx::ConnectionPtr& connection,
                                                                      AXDServer* server) {
     auto client = std::shared_ptr<AXDRpxClient>(new AXDRpxClient(connection, server));
-    const auto& peer = connection->peer();
-    if (!peer.executablePath.empty()) client->bundle_ = AXBundle::initWithExecutableURL(peer.executablePath);
-    client->path_ = peer.executablePath;
     log::debug(logOps(), "new client %d %s", client->pid_, client->path_);
     AXD_TRACE(client__new, client->pid_);
-    client->task_ = corvane::codesign::Handle::fromAuditToken(peer.auditToken);
     connection->setContext(client, [](std::shared_ptr<void> context) { context.reset(); });
     connection->setEventHandler([client](const corvane::rpx::Event& event) { client->handleEvent(event); });
     connection->resume();
     return client;
+}
+
+const AXDRpxClient::Identity& AXDRpxClient::identity() const {
+    std::call_once(identityOnce_, [this] {
+        if (!path_.empty()) identity_.bundle = AXBundle::initWithExecutableURL(path_);
+        identity_.task = corvane::codesign::Handle::fromAuditToken(auditToken_);
+    });
+    return identity_;
 }
 
 void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
@@ -44,6 +52,7 @@ void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
         std::string text = event.message.description();
         AXD_TRACE(request__input, pid(), text.c_str());
     }
+    (void)identity();
     auto transaction = std::make_shared<Transaction>(event, shared_from_this());
     server_->submitWork([transaction] {
         AXDRpxClient& client = *transaction->client();
@@ -56,11 +65,12 @@ void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
 int AXDRpxClient::pid() const { return connection_.expired() ? 0 : pid_; }
 
 Value AXDRpxClient::entitlementValueForKey(const std::string& key) const {
-    if (!task_) {
+    const auto& task = identity().task;
+    if (!task) {
         log::error(logOps(), "error retrieving entitlements for client %d", pid());
         return Value();
     }
-    return task_->valueForEntitlement(key);
+    return task->valueForEntitlement(key);
 }
 
 void AXDRpxClient::logUnexpected(const corvane::rpx::Event& event) {

@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <memory>
+#include <mutex>
 #include <string>
 
 #include "Annexa/AXBundle.h"
@@ -27,7 +28,7 @@ public:
     // The peer's process id; 0 once the connection is gone.
     int pid() const;
     const std::string& path() const { return path_; }
-    const std::shared_ptr<AXBundle>& bundle() const { return bundle_; }
+    const std::shared_ptr<AXBundle>& bundle() const { return identity().bundle; }
     AXDServer* server() const { return server_; }
     corvane::rpx::ConnectionPtr connection() const { return connection_.lock(); }
     bool acceptWork() const { return acceptWork_.load(); }
@@ -45,6 +46,14 @@ public:
 private:
     AXDRpxClient(const corvane::rpx::ConnectionPtr& connection, AXDServer* server);
     void handleEvent(const corvane::rpx::Event& event);
+    // The bundle and code-signing identity of the executable that connected, found when the first
+    // request arrives: a connection that never sends one (a flood of them) costs no file reads.
+    // The handle still refuses a process that is no longer the one that connected.
+    struct Identity {
+        std::shared_ptr<AXBundle> bundle;
+        std::shared_ptr<corvane::codesign::Handle> task;
+    };
+    const Identity& identity() const;
     // Logs a message that is no request: a few a second per client, each cut short, so that a
     // client sending garbage cannot fill the log (or keep the I/O thread busy writing it).
     void logUnexpected(const corvane::rpx::Event& event);
@@ -54,8 +63,9 @@ private:
     AXDServer* const server_;
     const int pid_;
     std::string path_;
-    std::shared_ptr<AXBundle> bundle_;
-    std::shared_ptr<corvane::codesign::Handle> task_;
+    corvane::rpx::AuditToken auditToken_;
+    mutable std::once_flag identityOnce_;
+    mutable Identity identity_;  // written once, under identityOnce_
     uint32_t requestCount_ = 0;  // on the service queue
     // On the connection's delivery, one event at a time.
     int64_t unexpectedSecond_ = 0;
