@@ -727,6 +727,48 @@ TEST(Rpx, AbusivePeersAreCutOffAndWhatTheyHeldIsFreed) {
     }));
 }
 
+// A process that keeps breaking the protocol is refused new connections for a while: they are
+// closed unread, while its connections already set up are served, and the bar ends by itself.
+TEST(Rpx, AProcessThatKeepsBreakingTheProtocolIsBarredForAWhile) {
+    axtest::PlatformRoot root;
+    log::CaptureSink capture;
+    EchoServer server("com.test.barred");
+    auto q = dispatch::Queue::create("test");
+    auto good = rpx::Connection::connect("com.test.barred", q);
+    good->setEventHandler([](const rpx::Event&) {});
+    good->resume();
+    ASSERT_TRUE(good->sendWithReplySync(dict({{"before", true}})).ok());
+
+    std::string barred = "refusing new connections of pid " + std::to_string(getpid());
+    std::string garbage(64, '\x7f');
+    for (int i = 0; i < 9 && !capture.contains(barred); ++i) {
+        int fd = rawConnect("com.test.barred");
+        ASSERT_GE(fd, 0);
+        (void)!write(fd, garbage.data(), garbage.size());
+        EXPECT_TRUE(closedByPeer(fd));
+        ::close(fd);
+    }
+    ASSERT_TRUE(capture.contains(barred));
+    int served = server.requests.load();
+    int fd = rawConnect("com.test.barred");
+    std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
+    (void)!write(fd, request.data(), request.size());
+    EXPECT_TRUE(closedByPeer(fd));
+    ::close(fd);
+    EXPECT_EQ(server.requests.load(), served);
+
+    auto r = good->sendWithReplySync(dict({{"during", true}}));
+    EXPECT_TRUE(r.ok());
+    EXPECT_TRUE(axtest::eventually(
+        [&] {
+            auto later = rpx::Connection::connect("com.test.barred", q);
+            later->setEventHandler([](const rpx::Event&) {});
+            later->resume();
+            return later->sendWithReplySync(dict({{"after", true}})).ok();
+        },
+        3s));
+}
+
 // Messages that expect no reply count as work until their handler's copies of them are gone: a
 // flood of them stops being read while the work waits.
 TEST(Rpx, MessagesWithoutRepliesAreBackPressuredToo) {

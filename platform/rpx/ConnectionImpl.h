@@ -86,6 +86,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     std::chrono::steady_clock::time_point partialSince GUARDED_BY(mutex);
     bool partial GUARDED_BY(mutex) = false;
     pid_t peerPid = 0;  // set before start, then fixed
+    bool accepted = false;  // taken from a listener's backlog; set before start, then fixed
     // An accepted connection keeps itself alive until its invalid event has been delivered.
     std::shared_ptr<Connection> self GUARDED_BY(mutex);
 
@@ -127,7 +128,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             if (status == wire::FrameReader::Status::NeedMore) return;
             if (status == wire::FrameReader::Status::Error) {
                 log::error(rpxLog(), "rpx: closing connection to pid %d: %{public}s", peerPid, error);
-                closeLocked();
+                closeForViolation();
                 return;
             }
             handleFrame(std::move(frame));
@@ -272,6 +273,13 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         return true;
     }
 
+    // The peer broke the protocol: the connection ends, and the peer process of an accepted one
+    // is counted against its allowance of violations.
+    void closeForViolation() REQUIRES(mutex) {
+        if (accepted && !invalid) internal::recordViolation(peerPid);
+        closeLocked();
+    }
+
     // The connection ends: no more I/O, pending replies fail, the invalid event is delivered.
     void closeLocked() REQUIRES(mutex) {
         if (invalid) return;
@@ -305,7 +313,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             if (invalid || !partial || now - partialSince < std::chrono::seconds(limits().partialFrameSeconds)) return;
             log::error(rpxLog(), "rpx: closing connection to pid %d: a frame begun %u s ago was not finished", peerPid,
                        limits().partialFrameSeconds);
-            closeLocked();
+            closeForViolation();
         }
         runReady();
     }
@@ -337,7 +345,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         if (msg.msg_flags & MSG_CTRUNC) {
             log::error(rpxLog(), "rpx: closing connection to pid %d: too many descriptors", peerPid);
-            closeLocked();
+            closeForViolation();
             return ReadStatus::Closed;
         }
         if (n == 0) {
@@ -351,7 +359,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         // being read cannot claim were sent with none, and would stay open for nothing.
         if (reader.holdsUnclaimedDescriptors()) {
             log::error(rpxLog(), "rpx: closing connection to pid %d: descriptors that no frame names", peerPid);
-            closeLocked();
+            closeForViolation();
             return ReadStatus::Closed;
         }
         bool nowPartial = reader.buffered() > 0;
@@ -448,7 +456,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             if (!unanswered.insert(frame.id).second) {
                 log::error(rpxLog(), "rpx: closing connection to pid %d: request id %llu is already waiting for its reply",
                            peerPid, static_cast<unsigned long long>(frame.id));
-                closeLocked();
+                closeForViolation();
                 return;
             }
             ++unfinished;

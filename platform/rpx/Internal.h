@@ -101,6 +101,13 @@ void startSweeper();
 // Runs `task` on the I/O thread at the sweeper's next round (within a second).
 void afterSweep(std::function<void()> task);
 
+// Counts a protocol violation by the peer process of an accepted connection: past
+// `violations-per-second` of them in a second, its new connections are refused for a while
+// (a quarter of a second, twice as long each time it goes on, up to eight seconds).
+void recordViolation(pid_t pid);
+// Whether new connections of the process are refused now.
+bool connectionsBarred(pid_t pid);
+
 // The identity of the process at the other end of a connected socket.
 PeerIdentity identityOfSocket(int sock);
 

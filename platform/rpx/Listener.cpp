@@ -1,5 +1,6 @@
 // Listener: a named endpoint that accepts connections.
 #include <sys/socket.h>
+#include <sys/timerfd.h>
 #include <sys/un.h>
 #include <systemd/sd-daemon.h>
 
@@ -16,6 +17,8 @@ namespace corvane::rpx {
 namespace {
 constexpr int kAcceptsPerWakeup = 16;
 constexpr size_t kRememberedProcesses = 1024;
+// How long accepting pauses after a wake-up that closed connections of a barred process.
+constexpr long kBarredPauseNanoseconds = 10'000'000;
 }  // namespace
 
 struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
@@ -35,9 +38,37 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     // The accepted connections of each process, to bound them.
     std::map<pid_t, std::vector<std::weak_ptr<Connection::Impl>>> byProcess GUARDED_BY(mutex);
     std::chrono::steady_clock::time_point lastRefusalLog GUARDED_BY(mutex);
+    // Ends a pause of accepting (a one-shot timer, made on first use).
+    int pauseTimer GUARDED_BY(mutex) = -1;
 
     ~Impl() NO_THREAD_SAFETY_ANALYSIS {
         if (spare >= 0) ::close(spare);
+        if (pauseTimer >= 0) {
+            IoLoop::shared().remove(pauseTimer);
+            ::close(pauseTimer);
+        }
+    }
+
+    // Stops watching the socket for a moment. Connections of a barred process were just closed
+    // unread: while accepting pauses, a flood of them fills the backlog and its connect() blocks,
+    // instead of keeping the I/O thread and a core busy with accepting and closing. Connections
+    // already accepted are served meanwhile; new ones wait at most a few pauses.
+    void pauseAccepting() REQUIRES(mutex) {
+        if (pauseTimer < 0) {
+            pauseTimer = timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
+            if (pauseTimer < 0) return;
+            std::weak_ptr<Impl> weak = shared_from_this();
+            int timer = pauseTimer;
+            IoLoop::shared().add(timer, EPOLLIN, [weak, timer](uint32_t) {
+                uint64_t expirations;
+                if (::read(timer, &expirations, sizeof expirations) != sizeof expirations) return;
+                if (auto impl = weak.lock()) impl->resumeAccepting();
+            });
+        }
+        struct itimerspec once {};
+        once.it_value.tv_nsec = kBarredPauseNanoseconds;
+        if (timerfd_settime(pauseTimer, 0, &once, nullptr) != 0) return;
+        IoLoop::shared().modify(fd, 0);
     }
 
     // Out of descriptors: takes one connection off the backlog with the spare descriptor and closes
@@ -91,6 +122,15 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
     }
 
     void onAcceptable() {
+        bool closedBarred = false;
+        acceptSome(closedBarred);
+        if (closedBarred) {
+            MutexLock lock(mutex);
+            if (fd >= 0) pauseAccepting();
+        }
+    }
+
+    void acceptSome(bool& closedBarred) {
         // A few connections per wake-up: the I/O thread serves every connection, and a flood of
         // new ones must not keep it from the others (epoll reports the rest again at once).
         for (int taken = 0; taken < kAcceptsPerWakeup; ++taken) {
@@ -119,6 +159,11 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
             struct ucred cred {};
             socklen_t credLength = sizeof cred;
             getsockopt(client, SOL_SOCKET, SO_PEERCRED, &cred, &credLength);
+            if (connectionsBarred(cred.pid)) {
+                ::close(client);
+                closedBarred = true;
+                continue;
+            }
             size_t frameLimit;
             bool inlined;
             {
@@ -128,6 +173,7 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
             }
             auto impl = std::make_shared<Connection::Impl>(client, delivery, frameLimit);
             impl->peerPid = cred.pid;
+            impl->accepted = true;
             impl->inlineDelivery = inlined;
             {
                 MutexLock lock(mutex);

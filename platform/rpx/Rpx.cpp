@@ -29,6 +29,7 @@ Limits readLimits() {
         if (name == "connections-per-process") l.connectionsPerProcess = n;
         if (name == "queued-reply-mib") l.queuedReplyMiB = n;
         if (name == "partial-frame-seconds") l.partialFrameSeconds = static_cast<unsigned>(n);
+        if (name == "violations-per-second") l.violationsPerSecond = static_cast<unsigned>(n);
     }
     return l;
 }

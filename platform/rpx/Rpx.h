@@ -85,6 +85,7 @@ struct Limits {
     size_t connectionsPerProcess = 64;    // "connections-per-process": a listener refuses more
     size_t queuedReplyMiB = 64;           // "queued-reply-mib": replies queued for all peers together
     unsigned partialFrameSeconds = 10;    // "partial-frame-seconds": a frame begun and not finished
+    unsigned violationsPerSecond = 8;     // "violations-per-second": more bar a process's new connections
 };
 const Limits& limits();
 
