@@ -249,8 +249,10 @@ void Transaction::annotatePlugIns() {
     Value c(changes);
     // A plug-in named again in the same request is already changed.
     std::unordered_set<const AXDPlugIn*> changed;
+    const AXDPlugIn* last = nullptr;
     bool walked = processUuidList([&](const AXDPlugInPtr& p) {
-        if (!changed.insert(p.get()).second) return Walk::Continue;
+        if (p.get() == last || !changed.insert(p.get()).second) return Walk::Continue;
+        last = p.get();
         log::debug(logOps(), "client %d plug-in %@(%{public}@) annotation change: %@", client_->pid(), p->identifier(),
                    p->uuid(), c);
         if (changes.count(keys::kElection)) {
