@@ -26,6 +26,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         std::string bytes;
         size_t offset = 0;
         std::vector<std::shared_ptr<FileDescriptor>> fds;  // sent with the first byte
+        bool reply = false;
     };
     // A completion without a queue is internal (a synchronous wait) and runs right where the
     // reply is read, saving a thread hop.
@@ -76,6 +77,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     int pollFd GUARDED_BY(mutex) = -1;
     std::deque<Outgoing> out GUARDED_BY(mutex);
     size_t outBytes GUARDED_BY(mutex) = 0;
+    size_t outReplies GUARDED_BY(mutex) = 0;  // replies among `out`
     std::map<uint64_t, Pending> pending GUARDED_BY(mutex);
     uint64_t nextId GUARDED_BY(mutex) = 1;
     // Events delivered but not handled, plus requests not yet answered.
@@ -105,8 +107,9 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
 
     // Back-pressure: stop reading from a peer that does not keep up, resume when it has.
     void checkPressure() REQUIRES(mutex) {
-        bool over = outBytes > kHighWaterBytes || unfinished > kMaxUnfinished;
-        bool under = outBytes <= kHighWaterBytes / 2 && unfinished <= kMaxUnfinished / 2;
+        bool over = outBytes > kHighWaterBytes || outReplies > kMaxQueuedReplies || unfinished > kMaxUnfinished;
+        bool under = outBytes <= kHighWaterBytes / 2 && outReplies <= kMaxQueuedReplies / 2 &&
+                     unfinished <= kMaxUnfinished / 2;
         if (!readPaused && over) {
             readPaused = true;
             updateInterest();
@@ -227,6 +230,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             outBytes -= static_cast<size_t>(n);
             gQueuedReplyBytes -= static_cast<size_t>(n);
             if (o.offset == o.bytes.size()) {
+                if (o.reply) --outReplies;
                 out.pop_front();
             } else {
                 o.fds.clear();  // they went with the first bytes
@@ -249,6 +253,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         }
         Outgoing o;
         o.bytes = std::move(*bytes);
+        o.reply = kind == wire::FrameKind::Reply;
         for (int f : raw) {
             int copy = fcntl(f, F_DUPFD_CLOEXEC, 0);
             if (copy < 0) {
@@ -261,6 +266,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         if (invalid) return false;
         outBytes += o.bytes.size();
         size_t queued = gQueuedReplyBytes += o.bytes.size();
+        if (o.reply) ++outReplies;
         out.push_back(std::move(o));
         flush();
         // Past the bound for all peers together, a peer that holds more than its share goes.
@@ -291,6 +297,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             fd = -1;
         }
         out.clear();
+        outReplies = 0;
         gQueuedReplyBytes -= outBytes;
         outBytes = 0;
         reader.clear();  // buffered bytes and descriptors go now, not with the last reference

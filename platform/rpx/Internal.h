@@ -17,9 +17,13 @@
 
 namespace corvane::rpx::internal {
 
-// Reading stops while more than this much is queued for a peer, or while it has this many
-// requests unanswered or events undelivered, and starts again below half of it.
+// Reading stops while more than this much is queued for a peer (in bytes, or in replies that its
+// socket could not take: small replies to a peer that never reads would otherwise be made by the
+// hundred thousand before their bytes count), or while it has this many requests unanswered or
+// events undelivered, and starts again below half of it. A connection's own requests and messages
+// waiting to go never stop it reading: the replies it waits for come that way.
 inline constexpr size_t kHighWaterBytes = 8u << 20;
+inline constexpr size_t kMaxQueuedReplies = 64;
 inline constexpr size_t kMaxUnfinished = 32;
 
 const log::Handle& rpxLog();
