@@ -69,37 +69,42 @@ void AXDPlugIn::setVtproxy(corvane::vantry::PlugInRecordPtr record) {
     encodedForm_.reset();
 }
 
-// The caches fill on the first read that gets an answer; a missing answer is asked again next time.
+// A name set on the plug-in wins; otherwise the registry record's answers.
 std::optional<std::string> AXDPlugIn::localizedName() const {
     corvane::MutexLock lock(mutex_);
-    if (!localizedName_ && vtproxy_) localizedName_ = vtproxy_->localizedName();
-    return localizedName_;
+    if (setNames_ && setNames_->name) return setNames_->name;
+    return vtproxy_ ? vtproxy_->localizedName() : std::nullopt;
 }
 void AXDPlugIn::setLocalizedName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
-    localizedName_ = v;
+    namesLocked().name = v;
     encodedForm_.reset();
 }
 std::optional<std::string> AXDPlugIn::localizedShortName() const {
     corvane::MutexLock lock(mutex_);
-    if (!localizedShortName_ && vtproxy_) localizedShortName_ = vtproxy_->localizedShortName();
-    return localizedShortName_;
+    if (setNames_ && setNames_->shortName) return setNames_->shortName;
+    return vtproxy_ ? vtproxy_->localizedShortName() : std::nullopt;
 }
 void AXDPlugIn::setLocalizedShortName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
-    localizedShortName_ = v;
+    namesLocked().shortName = v;
     encodedForm_.reset();
 }
 std::optional<std::string> AXDPlugIn::localizedContainingName() const {
     corvane::MutexLock lock(mutex_);
-    if (!localizedContainingName_ && vtproxy_ && vtproxy_->containingApplication())
-        localizedContainingName_ = vtproxy_->containingApplication()->localizedName();
-    return localizedContainingName_;
+    if (setNames_ && setNames_->containingName) return setNames_->containingName;
+    if (!vtproxy_ || !vtproxy_->containingApplication()) return std::nullopt;
+    return vtproxy_->containingApplication()->localizedName();
 }
 void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
-    localizedContainingName_ = v;
+    namesLocked().containingName = v;
     encodedForm_.reset();
+}
+
+AXDPlugIn::SetNames& AXDPlugIn::namesLocked() {
+    if (!setNames_) setNames_ = std::make_unique<SetNames>();
+    return *setNames_;
 }
 
 Status AXDPlugIn::diagnose() const {
@@ -181,7 +186,7 @@ corvane::Result<AXDPlugIn::EncodedFormPtr> AXDPlugIn::encodedForm() const {
         return EncodedFormPtr(std::move(encoded));
     }();
     corvane::MutexLock lock(mutex_);
-    encodedForm_ = made;
+    encodedForm_ = std::make_shared<const corvane::Result<EncodedFormPtr>>(made);
     return made;
 }
 

@@ -106,10 +106,15 @@ public:
 private:
     mutable corvane::Mutex mutex_;
     corvane::vantry::PlugInRecordPtr vtproxy_ GUARDED_BY(mutex_);
-    mutable std::optional<std::string> localizedName_ GUARDED_BY(mutex_);
-    mutable std::optional<std::string> localizedShortName_ GUARDED_BY(mutex_);
-    mutable std::optional<std::string> localizedContainingName_ GUARDED_BY(mutex_);
-    mutable std::optional<corvane::Result<EncodedFormPtr>> encodedForm_ GUARDED_BY(mutex_);
+    // Names set on the plug-in itself, made on the first set: most plug-ins have none, and the
+    // daemon keeps thousands.
+    struct SetNames {
+        std::optional<std::string> name, shortName, containingName;
+    };
+    SetNames& namesLocked() REQUIRES(mutex_);
+    std::unique_ptr<SetNames> setNames_ GUARDED_BY(mutex_);
+    // Held through a pointer: an Error inline would make each of thousands of plug-ins 80 bytes larger.
+    mutable std::shared_ptr<const corvane::Result<EncodedFormPtr>> encodedForm_ GUARDED_BY(mutex_);
 };
 
 using AXDPlugInPtr = std::shared_ptr<AXDPlugIn>;

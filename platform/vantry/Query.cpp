@@ -75,14 +75,14 @@ std::vector<PlugInRecordPtr> Store::query(
     {
         MutexLock lock(mutex_);
         checkFreshness();
-        rows = rowsOf("SELECT uuid, identifier, entitlements, record, ifnull(app_path, '') FROM plugins " + where +
+        rows = rowsOf("SELECT uuid, record, ifnull(app_path, '') FROM plugins " + where +
                           " ORDER BY path",
                       args);
     }
     // The filter runs outside the lock: it may look elsewhere (the daemon's annotations) for long.
     std::vector<PlugInRecordPtr> out;
-    for (const Row& row : *rows)
-        if (!filter || filter(row.identifier, row.entitlements)) out.push_back(row.record);
+    for (const PlugInRecordPtr& record : *rows)
+        if (!filter || filter(record->identifier(), record->entitlements())) out.push_back(record);
     return out;
 }
 

@@ -47,6 +47,9 @@ Result<std::shared_ptr<Store>> Store::open(const std::string& path) {
     sqlite3_busy_timeout(store->db_, 5000);
     if (Status err = store->exec("PRAGMA journal_mode=WAL"); !err.ok()) return err.error();
     if (Status err = store->exec("PRAGMA foreign_keys=ON"); !err.ok()) return err.error();
+    // Answers are kept in memory until the data changes (rowsOf), so pages are read again only
+    // after a change: a small page cache (the default is 2 MiB) costs little.
+    if (Status err = store->exec("PRAGMA cache_size=-256"); !err.ok()) return err.error();
     if (Status err = store->migrate(); !err.ok()) return err.error();
     return store;
 }
@@ -136,12 +139,9 @@ Store::Rows Store::rowsOf(const std::string& sql, const std::vector<std::string>
     if (auto it = rows_.find(key); it != rows_.end()) return it->second;
     Statement q(db_, sql.c_str());
     for (size_t i = 0; i < args.size(); ++i) q.bind(static_cast<int>(i + 1), args[i]);
-    auto rows = std::make_shared<std::vector<Row>>();
+    auto rows = std::make_shared<std::vector<PlugInRecordPtr>>();
     while (q && q.step() == SQLITE_ROW) {
-        auto record = recordFromRow(q.text(0), q.blob(3), q.text(4));
-        if (!record) continue;
-        auto ents = plist::parse(q.blob(2));
-        rows->push_back(Row{q.text(1), ents ? *ents : Value(Dictionary{}), std::move(record)});
+        if (auto record = recordFromRow(q.text(0), q.blob(1), q.text(2))) rows->push_back(std::move(record));
     }
     // Hosts ask a handful of different questions; a flood of distinct ones must not grow memory.
     if (rows_.size() >= 256) rows_.clear();
@@ -188,11 +188,7 @@ PlugInRecordPtr Store::recordFromRow(const std::string& uuidText, std::string_vi
 std::vector<PlugInRecordPtr> Store::selectPlugIns(const std::string& where, const std::vector<std::string>& args) {
     MutexLock lock(mutex_);
     checkFreshness();
-    Rows rows = rowsOf("SELECT uuid, identifier, entitlements, record, ifnull(app_path, '') FROM plugins " + where, args);
-    std::vector<PlugInRecordPtr> out;
-    out.reserve(rows->size());
-    for (const Row& row : *rows) out.push_back(row.record);
-    return out;
+    return *rowsOf("SELECT uuid, record, ifnull(app_path, '') FROM plugins " + where, args);
 }
 
 std::vector<PlugInRecordPtr> Store::plugInsOf(const std::string& appPath) {

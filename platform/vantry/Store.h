@@ -168,14 +168,10 @@ private:
     // Drops every record and query answer built from the database.
     void forgetRecords() REQUIRES(mutex_);
     // One row of a query's answer, as the query's filter sees it.
-    struct Row {
-        std::string identifier;
-        Value entitlements;
-        PlugInRecordPtr record;
-    };
-    using Rows = std::shared_ptr<const std::vector<Row>>;
-    // The rows of a SELECT of uuid, identifier, entitlements, record and app path (in that order),
-    // from memory while the database has not changed.
+    using Rows = std::shared_ptr<const std::vector<PlugInRecordPtr>>;
+    // The records of a SELECT of uuid, record and app path (in that order), from memory while the
+    // database has not changed. A record carries the identifier and entitlements that the table
+    // keeps beside it for its indexes.
     Rows rowsOf(const std::string& sql, const std::vector<std::string>& args) REQUIRES(mutex_);
     ApplicationRecordPtr appFromRow(const std::string& appPath) REQUIRES(mutex_);
     PlugInRecordPtr recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath)

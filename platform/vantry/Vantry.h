@@ -147,7 +147,7 @@ public:
     std::vector<ApplicationRecordPtr> installedApplications();
     // The plug-ins that may fit `pattern` and that `filter` accepts. The registry drops a plug-in
     // only when the pattern's exact test would certainly fail; the filter is called with the
-    // plug-in's identifier and entitlements before its record is built.
+    // plug-in's identifier and entitlements, and decides whether the plug-in is in the answer.
     std::vector<PlugInRecordPtr> query(
         const Value& pattern, const std::function<bool(const std::string&, const Value&)>& filter);
 
