@@ -48,6 +48,27 @@ bool closedByPeer(int fd, std::chrono::milliseconds within = 5s) {
         within);
 }
 
+// Writes as much of `bytes` as the peer takes in `attempts` tries 2 ms apart, never reading a
+// reply; how much went.
+size_t writeWithoutReading(int fd, const std::string& bytes, int attempts) {
+    fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
+    size_t written = 0;
+    for (int i = 0; i < attempts && written < bytes.size(); ++i) {
+        ssize_t n = write(fd, bytes.data() + written, bytes.size() - written);
+        if (n > 0) written += static_cast<size_t>(n);
+        std::this_thread::sleep_for(2ms);
+    }
+    return written;
+}
+
+// A client connection whose events nobody needs, resumed.
+rpx::ConnectionPtr connectQuietly(const std::string& name, const dispatch::QueuePtr& queue) {
+    auto c = rpx::Connection::connect(name, queue);
+    c->setEventHandler([](const rpx::Event&) {});
+    c->resume();
+    return c;
+}
+
 std::string frameBytes(wire::FrameKind kind, uint64_t id, const Value& body) {
     std::vector<int> fds;
     return *wire::encodeFrame(wire::Frame{kind, id, body}, fds, rpx::kMaxDepth);
@@ -302,9 +323,7 @@ TEST(Rpx, RepliesAreBoundToTheirRequestsAndArriveOnTheChosenQueue) {
     EchoServer server("com.test.bound");
     auto events = dispatch::Queue::create("test.events");
     auto replies = dispatch::Queue::create("test.replies");
-    auto c = rpx::Connection::connect("com.test.bound", events);
-    c->setEventHandler([](const rpx::Event&) {});
-    c->resume();
+    auto c = connectQuietly("com.test.bound", events);
     EXPECT_GT(c->pid(), 0);
     EXPECT_EQ(c->peer().pid, getpid());  // the server is this process
     constexpr int kCount = 200;
@@ -404,9 +423,7 @@ TEST(Rpx, BadPeersEndOnlyTheirOwnConnection) {
     log::CaptureSink capture;
     EchoServer server("com.test.bad");
     auto q = dispatch::Queue::create("test");
-    auto good = rpx::Connection::connect("com.test.bad", q);
-    good->setEventHandler([](const rpx::Event&) {});
-    good->resume();
+    auto good = connectQuietly("com.test.bad", q);
 
     std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
     struct Case {
@@ -470,22 +487,14 @@ TEST(Rpx, APeerThatNeverReadsIsNotServedFurther) {
         for (int i = 0; i < c.requests; ++i) {
             burst += frameBytes(wire::FrameKind::Request, static_cast<uint64_t>(i + 1), dict({{"x", 1}}));
         }
-        // Write without reading a single reply; the socket fills up and writes would block.
-        fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
-        size_t written = 0;
-        for (int i = 0; i < 200 && written < burst.size(); ++i) {
-            ssize_t n = write(fd, burst.data() + written, burst.size() - written);
-            if (n > 0) written += static_cast<size_t>(n);
-            std::this_thread::sleep_for(2ms);
-        }
+        // The socket fills up and writes would block.
+        (void)writeWithoutReading(fd, burst, 200);
         std::this_thread::sleep_for(200ms);
         int served = server.requests.load() - servedBefore;
         EXPECT_LT(served, c.mostServed) << c.name;
         // Another client is served meanwhile.
         auto q = dispatch::Queue::create("test");
-        auto other = rpx::Connection::connect("com.test.slow", q);
-        other->setEventHandler([](const rpx::Event&) {});
-        other->resume();
+        auto other = connectQuietly("com.test.slow", q);
         EXPECT_TRUE(other->sendWithReplySync(dict({{"y", 2}})).ok()) << c.name;
         close(fd);
     }
@@ -557,9 +566,7 @@ TEST(Rpx, InlineDeliveryKeepsEventsInOrderAndNeverOverlaps) {
     (*listener)->resume();
 
     auto q = dispatch::Queue::create("test.client");
-    auto c = rpx::Connection::connect("com.test.inline", q);
-    c->setEventHandler([](const rpx::Event&) {});
-    c->resume();
+    auto c = connectQuietly("com.test.inline", q);
     constexpr int kCount = 3000;
     std::atomic<int> answered{0};
     for (int i = 0; i < kCount; ++i) {
@@ -592,9 +599,7 @@ TEST(Rpx, SynchronousWaitsGetTheirOwnRepliesWhoeverReads) {
     axtest::PlatformRoot root;
     EchoServer server("com.test.sync");
     auto q = dispatch::Queue::create("test.client");
-    auto c = rpx::Connection::connect("com.test.sync", q);
-    c->setEventHandler([](const rpx::Event&) {});
-    c->resume();
+    auto c = connectQuietly("com.test.sync", q);
     std::atomic<int> wrong{0};
     std::vector<std::thread> threads;
     for (int t = 0; t < 4; ++t) {
@@ -627,9 +632,7 @@ TEST(Rpx, SynchronousWaitsGetTheirOwnRepliesWhoeverReads) {
             (void)!write(s, reply.data(), reply.size());
             close(s);
         });
-        auto once = rpx::Connection::connect(name, q);
-        once->setEventHandler([](const rpx::Event&) {});
-        once->resume();
+        auto once = connectQuietly(name, q);
         auto r = once->sendWithReplySync(dict({{"x", 1}}));
         EXPECT_TRUE(r.ok()) << "round " << round << ": " << r.description();
         peer.join();
@@ -644,9 +647,7 @@ TEST(Rpx, SynchronousWaitsGetTheirOwnRepliesWhoeverReads) {
     std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
     ASSERT_EQ(bind(silent, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
     ASSERT_EQ(listen(silent, 1), 0);
-    auto waiting = rpx::Connection::connect("com.test.silent", q);
-    waiting->setEventHandler([](const rpx::Event&) {});
-    waiting->resume();
+    auto waiting = connectQuietly("com.test.silent", q);
     std::thread canceller([&] {
         std::this_thread::sleep_for(50ms);
         waiting->cancel();
@@ -667,9 +668,7 @@ TEST(Rpx, AbusivePeersAreCutOffAndWhatTheyHeldIsFreed) {
     log::CaptureSink capture;
     EchoServer server("com.test.abuse");
     auto q = dispatch::Queue::create("test");
-    auto good = rpx::Connection::connect("com.test.abuse", q);
-    good->setEventHandler([](const rpx::Event&) {});
-    good->resume();
+    auto good = connectQuietly("com.test.abuse", q);
     auto stillServed = [&](const char* after) {
         auto r = good->sendWithReplySync(dict({{"after", after}}));
         EXPECT_TRUE(r.ok()) << after;
@@ -746,9 +745,7 @@ TEST(Rpx, AProcessThatKeepsBreakingTheProtocolIsBarredForAWhile) {
     log::CaptureSink capture;
     EchoServer server("com.test.barred");
     auto q = dispatch::Queue::create("test");
-    auto good = rpx::Connection::connect("com.test.barred", q);
-    good->setEventHandler([](const rpx::Event&) {});
-    good->resume();
+    auto good = connectQuietly("com.test.barred", q);
     ASSERT_TRUE(good->sendWithReplySync(dict({{"before", true}})).ok());
 
     std::string barred = "refusing new connections of pid " + std::to_string(getpid());
@@ -773,9 +770,7 @@ TEST(Rpx, AProcessThatKeepsBreakingTheProtocolIsBarredForAWhile) {
     EXPECT_TRUE(r.ok());
     EXPECT_TRUE(axtest::eventually(
         [&] {
-            auto later = rpx::Connection::connect("com.test.barred", q);
-            later->setEventHandler([](const rpx::Event&) {});
-            later->resume();
+            auto later = connectQuietly("com.test.barred", q);
             return later->sendWithReplySync(dict({{"after", true}})).ok();
         },
         3s));
@@ -805,13 +800,7 @@ TEST(Rpx, MessagesWithoutRepliesAreBackPressuredToo) {
     std::string message = frameBytes(wire::FrameKind::Message, 1, dict({{"x", 1}}));
     std::string burst;
     for (int i = 0; i < 5000; ++i) burst += message;
-    fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
-    size_t written = 0;
-    for (int i = 0; i < 100 && written < burst.size(); ++i) {
-        ssize_t n = write(fd, burst.data() + written, burst.size() - written);
-        if (n > 0) written += static_cast<size_t>(n);
-        std::this_thread::sleep_for(2ms);
-    }
+    size_t written = writeWithoutReading(fd, burst, 100);
     std::this_thread::sleep_for(200ms);
     size_t taken;
     {
@@ -854,9 +843,7 @@ TEST(Rpx, NonReadingPeersAreBoundedTogether) {
     }
     EXPECT_TRUE(axtest::eventually([&] { return capture.contains("bytes of replies it does not read"); }));
     auto q = dispatch::Queue::create("test");
-    auto good = rpx::Connection::connect("com.test.hoarders", q);
-    good->setEventHandler([](const rpx::Event&) {});
-    good->resume();
+    auto good = connectQuietly("com.test.hoarders", q);
     EXPECT_TRUE(good->sendWithReplySync(dict({{"y", 2}})).ok());
     for (int fd : hoarders) ::close(fd);
 }
