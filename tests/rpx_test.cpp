@@ -753,7 +753,7 @@ TEST(Rpx, AProcessThatKeepsBreakingTheProtocolIsBarredForAWhile) {
     for (int i = 0; i < 9 && !capture.contains(barred); ++i) {
         int fd = rawConnect("com.test.barred");
         ASSERT_GE(fd, 0);
-        (void)!write(fd, garbage.data(), garbage.size());
+        (void)!send(fd, garbage.data(), garbage.size(), MSG_NOSIGNAL);  // it may be closed already
         EXPECT_TRUE(closedByPeer(fd));
         ::close(fd);
     }
@@ -761,7 +761,7 @@ TEST(Rpx, AProcessThatKeepsBreakingTheProtocolIsBarredForAWhile) {
     int served = server.requests.load();
     int fd = rawConnect("com.test.barred");
     std::string request = frameBytes(wire::FrameKind::Request, 1, dict({{"x", 1}}));
-    (void)!write(fd, request.data(), request.size());
+    (void)!send(fd, request.data(), request.size(), MSG_NOSIGNAL);
     EXPECT_TRUE(closedByPeer(fd));
     ::close(fd);
     EXPECT_EQ(server.requests.load(), served);

@@ -60,9 +60,12 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
             std::weak_ptr<Impl> weak = shared_from_this();
             int timer = pauseTimer;
             IoLoop::shared().add(timer, EPOLLIN, [weak, timer](uint32_t) {
+                // The listener first: while it lives, so does its timer's descriptor.
+                auto impl = weak.lock();
+                if (!impl) return;
                 uint64_t expirations;
                 if (::read(timer, &expirations, sizeof expirations) != sizeof expirations) return;
-                if (auto impl = weak.lock()) impl->resumeAccepting();
+                impl->resumeAccepting();
             });
         }
         struct itimerspec once {};
