@@ -318,15 +318,30 @@ AX_FIELD(std::string, url, setUrl, url_)
 AX_FIELD(std::optional<std::string>, containingUrl, setContainingUrl, containingUrl_)
 AX_FIELD(Value, bundleInfoDictionary, setBundleInfoDictionary, bundleInfoDictionary_)
 AX_FIELD(Value, entitlements, setEntitlements, entitlements_)
-AX_FIELD(std::optional<std::string>, localizedName, setLocalizedName, localizedName_)
-AX_FIELD(std::optional<std::string>, localizedShortName, setLocalizedShortName, localizedShortName_)
-AX_FIELD(std::optional<std::string>, localizedContainingName, setLocalizedContainingName,
-         localizedContainingName_)
 AX_FIELD(Value, annotations, setAnnotations, annotations_)
 AX_FIELD(std::optional<UUID>, uuid, setUuid, uuid_)
-AX_FIELD(Value, cdhash, setCdhash, cdhash_)
-AX_FIELD(std::optional<std::string>, requirement, setRequirement, requirement_)
 
 #undef AX_FIELD
+
+// Unset, a rare field reads as its empty value.
+#define AX_RARE_FIELD(Type, getter, setter, member)         \
+    Type AXPlugInCore::getter() const {                      \
+        corvane::MutexLock lock(mutex_);                     \
+        return rare_ ? rare_->member : Type();               \
+    }                                                        \
+    void AXPlugInCore::setter(const Type& v) {               \
+        corvane::MutexLock lock(mutex_);                     \
+        if (!rare_) rare_ = std::make_unique<Rare>();        \
+        rare_->member = v;                                   \
+    }
+
+AX_RARE_FIELD(std::optional<std::string>, localizedName, setLocalizedName, localizedName)
+AX_RARE_FIELD(std::optional<std::string>, localizedShortName, setLocalizedShortName, localizedShortName)
+AX_RARE_FIELD(std::optional<std::string>, localizedContainingName, setLocalizedContainingName,
+              localizedContainingName)
+AX_RARE_FIELD(Value, cdhash, setCdhash, cdhash)
+AX_RARE_FIELD(std::optional<std::string>, requirement, setRequirement, requirement)
+
+#undef AX_RARE_FIELD
 
 }  // namespace annexa

@@ -231,14 +231,19 @@ private:
     Value bundleInfoDictionary_;
     Value entitlements_;
     std::atomic<uint32_t> hubProtocolVersion_{0};
-    std::optional<std::string> localizedName_;
-    std::optional<std::string> localizedShortName_;
-    std::optional<std::string> localizedContainingName_;
     Value annotations_;
     std::atomic<int32_t> lastModified_{0};
     std::optional<UUID> uuid_;
-    Value cdhash_;
-    std::optional<std::string> requirement_;
+    // Fields that many records never set (the daemon's plug-ins answer names from the registry),
+    // made on the first set: the daemon keeps thousands of records.
+    struct Rare {
+        std::optional<std::string> localizedName;
+        std::optional<std::string> localizedShortName;
+        std::optional<std::string> localizedContainingName;
+        Value cdhash;
+        std::optional<std::string> requirement;
+    };
+    std::unique_ptr<Rare> rare_;
 };
 
 // Hash and equality by UUID, for sets and maps of shared records.
