@@ -130,8 +130,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             auto status = reader.next(frame, error);
             if (status == wire::FrameReader::Status::NeedMore) return;
             if (status == wire::FrameReader::Status::Error) {
-                log::error(rpxLog(), "rpx: closing connection to pid %d: %{public}s", peerPid, error);
-                closeForViolation();
+                closeForViolation(error);
                 return;
             }
             handleFrame(std::move(frame));
@@ -279,9 +278,10 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         return true;
     }
 
-    // The peer broke the protocol: the connection ends, and the peer process of an accepted one
-    // is counted against its allowance of violations.
-    void closeForViolation() REQUIRES(mutex) {
+    // The peer broke the protocol (`why` says how): the connection ends with a log line, and the
+    // peer process of an accepted one is counted against its allowance of violations.
+    void closeForViolation(const std::string& why) REQUIRES(mutex) {
+        log::error(rpxLog(), "rpx: closing connection to pid %d: %{public}s", peerPid, why);
         if (accepted && !invalid) internal::recordViolation(peerPid);
         closeLocked();
     }
@@ -318,9 +318,8 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         {
             MutexLock lock(mutex);
             if (invalid || !partial || now - partialSince < std::chrono::seconds(limits().partialFrameSeconds)) return;
-            log::error(rpxLog(), "rpx: closing connection to pid %d: a frame begun %u s ago was not finished", peerPid,
-                       limits().partialFrameSeconds);
-            closeForViolation();
+            closeForViolation(
+                log::formatText("a frame begun %u s ago was not finished", limits().partialFrameSeconds));
         }
         runReady();
     }
@@ -351,8 +350,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             for (size_t i = 0; i < count; ++i) reader.appendFd(std::make_shared<FileDescriptor>(slots[i]));
         }
         if (msg.msg_flags & MSG_CTRUNC) {
-            log::error(rpxLog(), "rpx: closing connection to pid %d: too many descriptors", peerPid);
-            closeForViolation();
+            closeForViolation("too many descriptors");
             return ReadStatus::Closed;
         }
         if (n == 0) {
@@ -365,8 +363,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         // Descriptors travel with the first bytes of the frame that names them: any that the frame
         // being read cannot claim were sent with none, and would stay open for nothing.
         if (reader.holdsUnclaimedDescriptors()) {
-            log::error(rpxLog(), "rpx: closing connection to pid %d: descriptors that no frame names", peerPid);
-            closeForViolation();
+            closeForViolation("descriptors that no frame names");
             return ReadStatus::Closed;
         }
         bool nowPartial = reader.buffered() > 0;
@@ -461,9 +458,8 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             // Replies are bound to requests by id: a second request under the id of one not yet
             // answered could never get its own.
             if (!unanswered.insert(frame.id).second) {
-                log::error(rpxLog(), "rpx: closing connection to pid %d: request id %llu is already waiting for its reply",
-                           peerPid, static_cast<unsigned long long>(frame.id));
-                closeForViolation();
+                closeForViolation(log::formatText("request id %llu is already waiting for its reply",
+                                                  static_cast<unsigned long long>(frame.id)));
                 return;
             }
             ++unfinished;
