@@ -71,8 +71,8 @@ TEST(Plist, WriterNamesNoDocumentTypeAndReaderAcceptsAny) {
     // Files written by other tools may carry a document type line; it is skipped, whatever it names.
     const std::string body = "<plist version=\"1.0\"><dict><key>a</key><integer>1</integer></dict></plist>";
     for (const std::string& prolog : {std::string(), std::string("<?xml version=\"1.0\"?>\n"),
-                                      std::string("<?xml version=\"1.0\"?>\n<!DOCTYPE plist SYSTEM \"plist.dtd\">\n"),
-                                      std::string("<!DOCTYPE plist>")}) {
+                                      std::string("<?xml version=\"1.0\"?>\n<!DOCTYPE notes SYSTEM \"notes.dtd\">\n"),
+                                      std::string("<!DOCTYPE anything>")}) {
         auto r = plist::parse(prolog + body);
         ASSERT_TRUE(r) << prolog;
         EXPECT_EQ(*r, corvane::dict({{"a", 1}})) << prolog;
