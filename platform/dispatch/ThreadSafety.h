@@ -34,6 +34,8 @@
 
 namespace corvane {
 
+class ConditionVariable;
+
 // A std::mutex that clang's analysis can check, and that knows which thread holds it.
 class CAPABILITY("mutex") Mutex {
 public:
@@ -55,12 +57,12 @@ public:
     }
 
 private:
+    friend class ConditionVariable;
     std::mutex mutex_;
     std::atomic<std::thread::id> owner_{};
 };
 
-// Holds a Mutex from construction to the end of the scope. A condition variable waits on it as
-// `std::condition_variable_any::wait(lock, ...)`, which unlocks and relocks it in between.
+// Holds a Mutex from construction to the end of the scope; a ConditionVariable waits on it.
 class SCOPED_CAPABILITY MutexLock {
 public:
     explicit MutexLock(Mutex& mutex) ACQUIRE(mutex) : mutex_(mutex) { mutex_.lock(); }
@@ -68,14 +70,34 @@ public:
     MutexLock(const MutexLock&) = delete;
     MutexLock& operator=(const MutexLock&) = delete;
 
-    // For condition_variable_any only; the scope's capability is unchanged for the analysis.
-    void lock() NO_THREAD_SAFETY_ANALYSIS { mutex_.lock(); }
-    void unlock() NO_THREAD_SAFETY_ANALYSIS { mutex_.unlock(); }
-
 private:
+    friend class ConditionVariable;
     Mutex& mutex_;
 };
 
-using ConditionVariable = std::condition_variable_any;
+// A condition variable over a MutexLock: waiting unlocks the mutex and locks it again before it
+// returns. It is a std::condition_variable on the Mutex's own std::mutex, not a
+// condition_variable_any: that one notifies under an inner lock of its own, so a waiter woken on
+// the same core first blocks on that lock, and every hand-over costs two wake-ups.
+class ConditionVariable {
+public:
+    void notify_one() noexcept { cv_.notify_one(); }
+    void notify_all() noexcept { cv_.notify_all(); }
+    void wait(MutexLock& lock) NO_THREAD_SAFETY_ANALYSIS {
+        Mutex& mutex = lock.mutex_;
+        std::unique_lock<std::mutex> held(mutex.mutex_, std::adopt_lock);
+        mutex.owner_.store(std::thread::id(), std::memory_order_relaxed);
+        cv_.wait(held);
+        mutex.owner_.store(std::this_thread::get_id(), std::memory_order_relaxed);
+        held.release();  // the scope of `lock` still owns the mutex
+    }
+    template <class Predicate>
+    void wait(MutexLock& lock, Predicate ready) {
+        while (!ready()) wait(lock);
+    }
+
+private:
+    std::condition_variable cv_;
+};
 
 }  // namespace corvane
