@@ -27,6 +27,28 @@ Error badName(const std::string& name) {
     return Error{kPosixErrorDomain, EINVAL, "invalid notification name: " + name};
 }
 
+enum class Drained { Nothing, Named, WatchGone };
+
+// Reads every event waiting on a non-blocking inotify descriptor: whether one named `name` (any
+// name when empty) came, or the watch itself ended (the directory went, or events were lost).
+Drained drainEvents(int fd, const std::string& name) {
+    alignas(struct inotify_event) char buf[4096];
+    Drained result = Drained::Nothing;
+    ssize_t n;
+    while ((n = ::read(fd, buf, sizeof buf)) > 0) {
+        for (char* p = buf; p < buf + n;) {
+            auto* ev = reinterpret_cast<struct inotify_event*>(p);
+            if (ev->mask & (IN_Q_OVERFLOW | IN_IGNORED | IN_DELETE_SELF | IN_MOVE_SELF)) {
+                result = Drained::WatchGone;
+            } else if (ev->len && (name.empty() || name == ev->name) && result == Drained::Nothing) {
+                result = Drained::Named;
+            }
+            p += sizeof(struct inotify_event) + ev->len;
+        }
+    }
+    return result;
+}
+
 }  // namespace
 
 Status post(const std::string& name) {
@@ -108,7 +130,6 @@ Observer::~Observer() {
 }
 
 void Observer::watch() {
-    alignas(struct inotify_event) char buf[4096];
     for (;;) {
         struct pollfd fds[2] = {{inotifyFd_, POLLIN, 0}, {stopFd_, POLLIN, 0}};
         if (poll(fds, 2, -1) < 0) {
@@ -116,18 +137,48 @@ void Observer::watch() {
             return;
         }
         if (fds[1].revents) return;
-        bool seen = false;
-        for (;;) {
-            ssize_t n = ::read(inotifyFd_, buf, sizeof buf);
-            if (n <= 0) break;
-            for (char* p = buf; p < buf + n;) {
-                auto* ev = reinterpret_cast<struct inotify_event*>(p);
-                if (ev->len && name_ == ev->name) seen = true;
-                p += sizeof(struct inotify_event) + ev->len;
-            }
-        }
-        if (seen) queue_->async(handler_);
+        if (drainEvents(inotifyFd_, name_) == Drained::Named) queue_->async(handler_);
     }
+}
+
+ChangeWatch::ChangeWatch(std::string directory, std::string name)
+    : directory_(std::move(directory)), name_(std::move(name)) {}
+
+ChangeWatch::~ChangeWatch() {
+    if (fd_ >= 0) ::close(fd_);
+}
+
+bool ChangeWatch::changed() {
+    if (fd_ >= 0) {
+        // In an ancestor, any event may be a step toward the directory.
+        Drained drained = drainEvents(fd_, watchingAncestor_ ? std::string() : name_);
+        if (drained == Drained::Nothing) return false;
+        if (drained == Drained::Named && !watchingAncestor_) return true;
+    }
+    watch();
+    return true;
+}
+
+void ChangeWatch::watch() {
+    if (fd_ >= 0) ::close(fd_);
+    watchingAncestor_ = false;
+    fd_ = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
+    if (fd_ < 0) return;
+    constexpr uint32_t kGone = IN_DELETE_SELF | IN_MOVE_SELF;
+    constexpr uint32_t kEvents = IN_MODIFY | IN_CLOSE_WRITE | IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | kGone;
+    if (inotify_add_watch(fd_, directory_.c_str(), kEvents) >= 0) return;
+    // A directory that does not exist yet holds no files that could change: watch the nearest
+    // ancestor that exists until a step toward it appears.
+    for (std::string dir = directory_; errno == ENOENT && dir.size() > 1;) {
+        size_t slash = dir.rfind('/');
+        dir = slash == 0 || slash == std::string::npos ? "/" : dir.substr(0, slash);
+        if (inotify_add_watch(fd_, dir.c_str(), IN_CREATE | IN_MOVED_TO | kGone) >= 0) {
+            watchingAncestor_ = true;
+            return;
+        }
+    }
+    ::close(fd_);
+    fd_ = -1;
 }
 
 }  // namespace corvane::notify

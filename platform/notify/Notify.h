@@ -49,4 +49,33 @@ private:
     std::thread thread_;
 };
 
+// Tells a cache whether files of one directory changed since it last asked, without a thread of
+// its own: each question is one non-blocking read of an inotify descriptor, and a change that was
+// complete when the question was asked is always seen. A directory that does not exist yet is
+// waited for through its nearest existing ancestor; while nothing can be watched (inotify is out of
+// instances or watches) every answer is yes.
+//
+// Thread-safety: none; the owner asks from one thread at a time.
+class ChangeWatch {
+public:
+    // Only changes to the file `name` count; with an empty name, changes to any file do.
+    explicit ChangeWatch(std::string directory, std::string name = {});
+    ~ChangeWatch();
+    ChangeWatch(const ChangeWatch&) = delete;
+    ChangeWatch& operator=(const ChangeWatch&) = delete;
+
+    const std::string& directory() const { return directory_; }
+    // True on the first question, and whenever a counted file was written, created, removed or
+    // renamed since the last one.
+    bool changed();
+
+private:
+    void watch();
+
+    const std::string directory_;
+    const std::string name_;
+    int fd_ = -1;
+    bool watchingAncestor_ = false;
+};
+
 }  // namespace corvane::notify
