@@ -3,6 +3,7 @@
 
 #include <sqlite3.h>
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -17,6 +18,7 @@
 
 #include "platform/dispatch/ThreadSafety.h"
 #include "platform/log/Log.h"
+#include "platform/notify/Notify.h"
 #include "platform/vantry/Vantry.h"
 
 namespace corvane::vantry {
@@ -203,6 +205,10 @@ private:
     // Answers of queries by their SQL and arguments; a few hundred at most.
     std::unordered_map<std::string, Rows> rows_ GUARDED_BY(mutex_);
     std::unique_ptr<Statement> dataVersion_ GUARDED_BY(mutex_);
+    // Announcements of other writers' commits (the wake file), and when the data version was
+    // last asked.
+    std::unique_ptr<notify::ChangeWatch> commits_ GUARDED_BY(mutex_);
+    std::chrono::steady_clock::time_point versionAskedAt_ GUARDED_BY(mutex_);
     // A write that changed rows without plug-in events (an application alone).
     bool changedOther_ GUARDED_BY(mutex_) = false;
     int64_t lastSeq_ GUARDED_BY(mutex_) = 0;
