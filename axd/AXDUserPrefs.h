@@ -1,6 +1,7 @@
 // The daemon's preference domain "com.corvane.annexa.userprefs": the user's global exclusions,
-// pattern dictionaries naming plug-ins that discovery never returns. Read anew on every call, so an
-// edit by another process takes effect with the next request; the daemon never writes the domain.
+// pattern dictionaries naming plug-ins that discovery never returns. An edit by another process
+// takes effect with the next request (the preference store notices changed files); the daemon never
+// writes the domain.
 #pragma once
 
 #include <vector>

@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <filesystem>
+
 #include "platform/plist/Plist.h"
 #include "platform/prefs/Prefs.h"
 #include "tests/support/TestSupport.h"
@@ -24,6 +26,28 @@ TEST(Prefs, EveryReadSeesTheFileAsItIsNow) {
     axtest::writeFile(prefs::domainPath(domain), "garbage");
     EXPECT_TRUE(prefs::copyValue("exclusions", domain).isNull());
     EXPECT_EQ(prefs::domainPath(domain).rfind(root.path(), 0), 0u);
+}
+
+// Reads are served from memory until a file changes; no change may slip past: rewrites of the
+// same size in quick succession (replaced, which may reuse an inode, or written in place), and a
+// directory removed and made again.
+TEST(Prefs, NoChangeIsMissedBetweenReads) {
+    axtest::PlatformRoot root;
+    const std::string domain = "com.example.quick";
+    const std::string path = prefs::domainPath(domain);
+    for (int i = 0; i < 40; ++i) {
+        Value value("value" + std::to_string(i % 10));
+        if (i % 2) {
+            ASSERT_TRUE(corvane::plist::writeXMLFile(path, corvane::dict({{"k", value}})).ok());
+        } else {
+            axtest::writeFile(path, *corvane::plist::toXML(corvane::dict({{"k", value}})));
+        }
+        ASSERT_EQ(prefs::copyValue("k", domain), value) << "rewrite " << i;
+    }
+    std::filesystem::remove_all(path.substr(0, path.rfind('/')));
+    EXPECT_TRUE(prefs::copyValue("k", domain).isNull());
+    ASSERT_TRUE(prefs::setValue("k", "again", domain).ok());
+    EXPECT_EQ(prefs::copyValue("k", domain), Value("again"));
 }
 
 TEST(Prefs, SearchListAndUnusableDomains) {

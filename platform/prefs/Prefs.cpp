@@ -3,8 +3,12 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <map>
+#include <memory>
 
+#include "platform/dispatch/ThreadSafety.h"
 #include "platform/layout/Layout.h"
+#include "platform/notify/Notify.h"
 #include "platform/plist/Plist.h"
 
 namespace corvane::prefs {
@@ -16,16 +20,37 @@ bool usableDomain(const std::string& domain) {
            domain.find('\0') == std::string::npos;
 }
 
-std::string hostName() {
-    char name[256] = {};
-    if (gethostname(name, sizeof name - 1) != 0 || !name[0]) return "localhost";
+// Read once: the host's name is part of every domain's path, and a daemon asks for its domain on
+// every request.
+const std::string& hostName() {
+    static const std::string name = [] {
+        char text[256] = {};
+        if (gethostname(text, sizeof text - 1) != 0 || !text[0]) return std::string("localhost");
+        return std::string(text);
+    }();
     return name;
 }
 
+// The domains read from one directory, kept until a file in it changes: a daemon that consults
+// its preferences on every request reads a file only after someone wrote one.
+struct ReadDomains {
+    Mutex mutex;
+    std::unique_ptr<notify::ChangeWatch> watch GUARDED_BY(mutex);
+    std::map<std::string, Value, std::less<>> byPath GUARDED_BY(mutex);
+};
+
 Value readDomain(const std::string& domain) {
-    auto v = plist::readFile(domainPath(domain));
-    if (!v || !v->isDictionary()) return Value(Dictionary{});
-    return *v;
+    static ReadDomains& read = *new ReadDomains;  // lives for the process's life
+    std::string path = domainPath(domain);
+    std::string dir = path.substr(0, path.rfind('/'));
+    MutexLock lock(read.mutex);
+    if (!read.watch || read.watch->directory() != dir) read.watch = std::make_unique<notify::ChangeWatch>(dir);
+    if (read.watch->changed()) read.byPath.clear();
+    if (auto it = read.byPath.find(path); it != read.byPath.end()) return it->second;
+    auto v = plist::readFile(path);
+    Value value = v && v->isDictionary() ? std::move(*v) : Value(Dictionary{});
+    read.byPath.emplace(path, value);
+    return value;
 }
 
 }  // namespace

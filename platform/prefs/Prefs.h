@@ -1,6 +1,7 @@
 // The preference store: one property-list file per domain for the current user and this host,
-// <per-user configuration>/preferences/ByHost/<domain>.<host name>.plist, read anew on every call
-// so that a change made by another process is seen by the next read.
+// <per-user configuration>/preferences/ByHost/<domain>.<host name>.plist. A change made by another
+// process is seen by the next read: what was read is kept only until a file of the directory
+// changes (inotify), so reads in between cost no file access.
 //
 // Thread-safety: every function may be called from any thread; writes replace the file atomically.
 #pragma once
@@ -15,8 +16,8 @@ namespace corvane::prefs {
 // The file that holds a domain's values.
 std::string domainPath(const std::string& domain);
 
-// Re-reads the domain from storage. Reads never cache, so this only exists for callers that
-// state the intent; it checks that the domain name is usable.
+// Re-reads the domain from storage. Reads never return what a finished write changed, so this only
+// exists for callers that state the intent; it checks that the domain name is usable.
 Status synchronize(const std::string& domain);
 
 // The value of `key` in `domain`, or null when it is not set (or the file cannot be read).
