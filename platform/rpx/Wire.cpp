@@ -110,8 +110,10 @@ constexpr uint32_t bit(Value::Kind k) { return 1u << static_cast<unsigned>(k); }
 
 // Array elements of at least this many bytes in a large frame are decoded when first looked at.
 constexpr size_t kLazyElementBytes = 512;
-// Frames from this size on are decoded lazily (their payload is kept for the elements).
-constexpr size_t kLazyFrameBytes = 64 * 1024;
+// Frames from this size on are decoded lazily (their payload is kept for the elements). A frame of
+// a few large elements already gains: a host that asks for ten plug-ins and looks at one of them
+// decodes one.
+constexpr size_t kLazyFrameBytes = 4 * 1024;
 
 Value decodeValidated(std::string_view bytes);
 

@@ -38,7 +38,7 @@ std::optional<Value> decodeValue(std::string_view payload,
 
 // The same for a payload that the decoded value may keep: large array elements (dictionaries and
 // arrays of 512 bytes and more, without descriptors) are checked now and decoded when first looked
-// at. Frames of 64 KiB and more are decoded so.
+// at. Frames of 4 KiB and more are decoded so.
 std::optional<Value> decodeValue(std::shared_ptr<const std::string> payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
                                  size_t maxDepth);
