@@ -107,7 +107,12 @@ int runMatch(int argc, char** argv) {
     pid_t axd = -1;
     std::string axdPath = bin + "/axd";
     std::vector<char*> args{axdPath.data(), const_cast<char*>("-d"), annotationFile.data(), nullptr};
-    if (posix_spawn(&axd, axdPath.c_str(), nullptr, nullptr, args.data(), environ) != 0) return 1;
+    // axd runs on the other core, as the ping-pong's far end does (it would inherit this
+    // process's pinning otherwise).
+    axbench::pinTo(1);
+    int spawned = posix_spawn(&axd, axdPath.c_str(), nullptr, nullptr, args.data(), environ);
+    axbench::pinTo(0);
+    if (spawned != 0) return 1;
     std::string endpoint = rpx::endpointPath(annexa::kDefaultServiceName);
     for (int i = 0; i < 1000 && !std::filesystem::exists(endpoint); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(5));
 
