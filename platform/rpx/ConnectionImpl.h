@@ -369,7 +369,9 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         bool nowPartial = reader.buffered() > 0;
         if (nowPartial && !partial) partialSince = std::chrono::steady_clock::now();
         partial = nowPartial;
-        return ReadStatus::More;
+        // A short read took all there was: the socket's interest is level-triggered, so whatever
+        // comes next is reported again, and asking now would only hear EAGAIN.
+        return static_cast<size_t>(n) < sizeof buf ? ReadStatus::Drained : ReadStatus::More;
     }
 
     void onReadable() EXCLUDES(mutex) {
