@@ -44,7 +44,7 @@ void Store::startWatcher() {
     int in = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
     inotify_add_watch(in, directory().c_str(), IN_CLOSE_WRITE | IN_MOVED_TO);
     stopFd_ = eventfd(0, EFD_CLOEXEC);
-    std::string wakeName = wakePath().substr(wakePath().rfind('/') + 1);
+    std::string wakeName = this->wakeName();
     std::weak_ptr<Store> weak = weak_from_this();
     int stop = stopFd_;
     watcher_ = std::thread([weak, in, stop, wakeName] {

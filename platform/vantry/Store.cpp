@@ -121,7 +121,7 @@ void Store::checkFreshness() {
     // Asking SQLite takes a read transaction and its file locks, the larger part of a query
     // answered from memory. Every writer touches the wake file after its commit (wake()), so the
     // version is asked only after one did, and once a second in case a writer died in between.
-    if (!commits_) commits_ = std::make_unique<notify::ChangeWatch>(directory(), wakePath().substr(directory().size() + 1));
+    if (!commits_) commits_ = std::make_unique<notify::ChangeWatch>(directory(), wakeName());
     auto now = std::chrono::steady_clock::now();
     if (!commits_->changed() && now - versionAskedAt_ < std::chrono::seconds(1)) return;
     versionAskedAt_ = now;

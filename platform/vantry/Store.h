@@ -161,6 +161,7 @@ private:
 
     std::string directory() const { return path_.substr(0, path_.rfind('/')); }
     std::string wakePath() const { return path_ + ".events"; }
+    std::string wakeName() const { return wakePath().substr(directory().size() + 1); }
     std::string pathsFile() const { return path_ + ".paths"; }
 
     Error sqlError(const char* what) const;
