@@ -1,6 +1,7 @@
 #include "platform/dispatch/Dispatch.h"
 
 #include <pthread.h>
+#include <sched.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -67,6 +68,7 @@ void drain(const std::shared_ptr<State>& state) {
         // Per-thread nice value; raising priority fails without CAP_SYS_NICE, which is fine.
         (void)setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), nice);
     }
+    if (state->qos >= QoS::UserInitiated) requestShortSlices();
     Entered entered(state.get());
     for (;;) {
         std::function<void()> task;
@@ -108,6 +110,26 @@ bool runHereIfIdle(State& state, const std::function<void()>& task) {
 }
 
 }  // namespace
+
+void requestShortSlices() {
+    // The kernel's struct sched_attr (its first version); <linux/sched/types.h> cannot be included
+    // beside <sched.h>.
+    struct {
+        uint32_t size;
+        uint32_t policy;
+        uint64_t flags;
+        int32_t nice;
+        uint32_t priority;
+        uint64_t runtime;
+        uint64_t deadline;
+        uint64_t period;
+    } attr{};
+    attr.size = sizeof attr;
+    attr.policy = SCHED_OTHER;
+    attr.nice = getpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)));
+    attr.runtime = 100 * 1000;  // nanoseconds: the shortest slice the kernel grants
+    (void)syscall(SYS_sched_setattr, 0, &attr, 0);
+}
 
 std::shared_ptr<Queue> Queue::create(std::string label, QoS qos) {
     return std::shared_ptr<Queue>(new Queue(std::move(label), qos));
