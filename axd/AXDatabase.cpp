@@ -71,10 +71,6 @@ std::vector<AXDPlugInPtr> AXDatabase::plugInsForUUIDs(const std::vector<UUID>& u
     databaseQueue_->sync([&] {
         databaseQueue_->assertCurrent();
         for (size_t i = 0; i < uuids.size(); ++i) {
-            if (i > 0 && uuids[i] == uuids[i - 1]) {  // a UUID repeated: its plug-in again
-                result[i] = result[i - 1];
-                continue;
-            }
             auto it = cache_.find(uuids[i]);
             if (it != cache_.end()) {
                 result[i] = it->second;

@@ -142,24 +142,31 @@ bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>
         return false;
     }
     // The plug-ins are looked up in one visit to the database, up to the first element that is no
-    // UUID; the walk then answers for the elements in order, as if each were looked up in turn.
-    const Array& elements = *uuids->asArray();
-    std::vector<UUID> parsed;
-    parsed.reserve(elements.size());
-    for (const Value& element : elements) {
-        const UUID* uuid = element.asUUID();
-        if (!uuid) break;
-        parsed.push_back(*uuid);
+    // UUID, and a run of one UUID repeated only once; the walk then answers for the elements in
+    // order, as if each were looked up in turn.
+    bool allUuids = true;
+    std::vector<UUID> parsed = corvane::rpx::leadingUuids(*uuids, allUuids);
+    std::vector<UUID> distinct;
+    std::vector<size_t> runs;
+    for (size_t i = 0; i < parsed.size(); ++i) {
+        if (i > 0 && parsed[i] == parsed[i - 1]) {
+            ++runs.back();
+            continue;
+        }
+        distinct.push_back(parsed[i]);
+        runs.push_back(1);
     }
-    std::vector<AXDPlugInPtr> plugIns = server().plugInsForUUIDs(parsed);
-    for (const AXDPlugInPtr& plugIn : plugIns) {
-        if (!plugIn) {
+    std::vector<AXDPlugInPtr> plugIns = server().plugInsForUUIDs(distinct);
+    for (size_t r = 0; r < plugIns.size(); ++r) {
+        if (!plugIns[r]) {
             failMessage(AXErrorCode::InvalidRequest, "no such plugin (uuid not found)");
             return false;
         }
-        if (handler(plugIn) == Walk::Stop) return false;
+        for (size_t k = 0; k < runs[r]; ++k) {
+            if (handler(plugIns[r]) == Walk::Stop) return false;
+        }
     }
-    if (parsed.size() < elements.size()) {
+    if (!allUuids) {
         failMessage(AXErrorCode::InvalidRequest, "invalid request (bad uuid array)");
         return false;
     }

@@ -27,7 +27,8 @@ namespace {
 // The limits are read once per process: this program runs with small ones, so that tests reach them
 // quickly.
 const bool kSmallLimits = [] {
-    setenv("CORVANE_RPX_LIMITS", "queued-reply-mib=16,partial-frame-seconds=1,connections-per-process=8", 1);
+    setenv("CORVANE_RPX_LIMITS",
+           "queued-reply-mib=16,partial-frame-seconds=1,connections-per-process=8,read-mib-per-second=2", 1);
     return true;
 }();
 
@@ -243,9 +244,10 @@ TEST(RpxWire, LargeFramesDecodeTheirElementsOnFirstLookWithTheSameResult) {
     wire::Frame f;
     std::string error;
     ASSERT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+    EXPECT_TRUE(f.body["matches"].encoding()) << "a large value of the body stays encoded";
     const Array* got = f.body["matches"].asArray();
     ASSERT_TRUE(got);
-    EXPECT_TRUE((*got)[0].encoding()) << "a large element stays encoded";
+    EXPECT_TRUE((*got)[0].encoding()) << "a large element of it stays encoded in turn";
     EXPECT_FALSE(got->back().encoding()) << "a small one is decoded at once";
     EXPECT_EQ((*got)[0].kind(), Value::Kind::Dictionary);
     EXPECT_EQ((*got)[0].kindsInside() & (1u << static_cast<unsigned>(Value::Kind::Null)), 0u);
@@ -279,6 +281,50 @@ TEST(RpxWire, LargeFramesDecodeTheirElementsOnFirstLookWithTheSameResult) {
 
 // Encodings put together from parts (as the daemon sends its plug-in forms) decode to the value
 // the parts make, whatever the order of a dictionary's entries.
+// The UUIDs of a request's array are read from its encoding, as the decoded array would give them.
+TEST(RpxWire, LeadingUuidsReadEncodedAndDecodedArraysAlike) {
+    UUID a = *UUID::parse("A9A0A1B6-6E1B-4C4C-9F57-3A3E1D0C0001");
+    UUID b = *UUID::parse("A9A0A1B6-6E1B-4C4C-9F57-3A3E1D0C0002");
+    Array many(100, Value(a));  // large enough to arrive encoded
+    many.push_back(Value(b));
+    Array thenText = many;
+    thenText.push_back(Value("not a uuid"));
+    thenText.push_back(Value(a));
+    struct Case {
+        const char* name;
+        Value array;
+        size_t uuids;
+        bool all;
+    };
+    const Case cases[] = {
+        {"all UUIDs", Value(many), 101, true},
+        {"a text among them", Value(thenText), 101, false},
+        {"a text first", Value(Array{Value("x"), Value(a)}), 0, false},
+        {"empty", Value(Array{}), 0, true},
+        {"no array", Value("x"), 0, true},
+    };
+    for (const Case& c : cases) {
+        // Once as sent in a large frame (kept encoded), once as a plain value.
+        Value body = dict({{"uuids", c.array}, {"padding", std::string(8192, 'p')}});
+        std::string bytes = frameBytes(wire::FrameKind::Request, 1, body);
+        wire::FrameReader reader(4 << 20, rpx::kMaxDepth);
+        reader.append(bytes.data(), bytes.size());
+        wire::Frame f;
+        std::string error;
+        ASSERT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+        for (const Value* array : {&f.body["uuids"], &c.array}) {
+            bool all = !c.all;
+            std::vector<UUID> got = rpx::leadingUuids(*array, all);
+            EXPECT_EQ(got.size(), c.uuids) << c.name;
+            EXPECT_EQ(all, c.all) << c.name;
+            if (got.size() == 101) {
+                EXPECT_EQ(got.front(), a) << c.name;
+                EXPECT_EQ(got.back(), b) << c.name;
+            }
+        }
+    }
+}
+
 TEST(RpxWire, EncodingsPutTogetherFromPartsDecodeToTheirValue) {
     std::string entries;
     ASSERT_TRUE(wire::appendEntry(entries, "b", dict({{"x", Value(Array{Value(1)})}})));
@@ -820,6 +866,38 @@ TEST(Rpx, MessagesWithoutRepliesAreBackPressuredToo) {
         pending->events.clear();
         return taken >= sent;
     })) << taken << " of " << sent;
+    ::close(fd);
+}
+
+// A peer sending large frames one after another is read at its allowance (2 MiB a second here,
+// after a burst of as much), and nothing it sent is lost.
+TEST(Rpx, LargeFramesAreReadAtTheirConnectionsAllowance) {
+    axtest::PlatformRoot root;
+    auto listener = rpx::Listener::create("com.test.allowance", dispatch::Queue::create("test.listener"));
+    ASSERT_TRUE(listener);
+    std::atomic<int> taken{0};
+    (*listener)->setConnectionHandler([&taken](rpx::ConnectionPtr conn) {
+        conn->setEventHandler([&taken](const rpx::Event& ev) {
+            if (!ev.isError()) ++taken;
+        });
+        conn->resume();
+    });
+    (*listener)->resume();
+    int fd = rawConnect("com.test.allowance");
+    std::string frame = frameBytes(wire::FrameKind::Message, 1, dict({{"x", Value::data(std::string(1 << 20, 'x').data(), 1 << 20)}}));
+    std::string all;
+    for (int i = 0; i < 6; ++i) all += frame;
+    std::thread writer([&] {
+        for (size_t done = 0; done < all.size();) {
+            ssize_t n = write(fd, all.data() + done, all.size() - done);
+            if (n <= 0) return;
+            done += static_cast<size_t>(n);
+        }
+    });
+    std::this_thread::sleep_for(500ms);
+    EXPECT_LE(taken.load(), 4) << "2 MiB at once, then 2 MiB a second";
+    EXPECT_TRUE(axtest::eventually([&] { return taken.load() == 6; })) << taken.load() << " of 6";
+    writer.join();
     ::close(fd);
 }
 

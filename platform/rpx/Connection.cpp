@@ -28,21 +28,25 @@ Connection::~Connection() {
 }
 
 std::shared_ptr<Connection> Connection::connect(const std::string& name, dispatch::QueuePtr queue) {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     std::string path = endpointPath(name);
     struct sockaddr_un addr {};
     addr.sun_family = AF_UNIX;
     bool ok = fd >= 0 && path.size() < sizeof addr.sun_path;
     if (ok) {
         std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
-        // A local connect completes at once or fails; EAGAIN means the backlog is full: retry
-        // briefly.
+        // A local connect completes at once, fails, or, while the listener's backlog is full,
+        // waits in the kernel for room (for at most a second): queued there beside any other
+        // process that waits, rather than trying again now and then and losing each time to a
+        // process that floods the listener.
+        struct timeval patience {1, 0};
+        ::setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
         int rc;
-        int tries = 0;
-        while ((rc = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr)) != 0 &&
-               (errno == EAGAIN || errno == EINTR) && ++tries < 200)
-            std::this_thread::sleep_for(std::chrono::milliseconds(5));
-        ok = rc == 0;
+        while ((rc = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr)) != 0 && errno == EINTR) {
+        }
+        struct timeval forever {0, 0};
+        ok = rc == 0 && ::setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &forever, sizeof forever) == 0 &&
+             ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK) == 0;
     }
     if (!ok && fd >= 0) {
         ::close(fd);

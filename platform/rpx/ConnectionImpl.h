@@ -89,6 +89,14 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     bool partial GUARDED_BY(mutex) = false;
     pid_t peerPid = 0;  // set before start, then fixed
     bool accepted = false;  // taken from a listener's backlog; set before start, then fixed
+    // The reading allowance of an accepted connection, in bytes: refilled at read-mib-per-second
+    // up to a second's worth, spent by every large frame; below zero, reading pauses until it is
+    // back. One peer that sends huge requests one after another so gets its share of the daemon,
+    // and no more. Small frames are bounded by the count of unfinished work instead: charging them
+    // too would only make a flood of them come in bursts.
+    double readAllowance GUARDED_BY(mutex) = static_cast<double>(limits().readMiBPerSecond) * (1 << 20);
+    std::chrono::steady_clock::time_point allowanceAt GUARDED_BY(mutex) = std::chrono::steady_clock::now();
+    bool allowanceTimer GUARDED_BY(mutex) = false;  // a resumption is already arranged
     // An accepted connection keeps itself alive until its invalid event has been delivered.
     std::shared_ptr<Connection> self GUARDED_BY(mutex);
 
@@ -105,11 +113,34 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         if (fd >= 0) IoLoop::shared().modify(fd, interest());
     }
 
+    // Whether an accepted connection has read past its allowance. When it has, resumption is
+    // arranged for when the allowance is back.
+    bool overAllowance() REQUIRES(mutex) {
+        if (!accepted) return false;
+        double perSecond = static_cast<double>(limits().readMiBPerSecond) * (1 << 20);
+        auto now = std::chrono::steady_clock::now();
+        double seconds = std::chrono::duration<double>(now - allowanceAt).count();
+        readAllowance = std::min(perSecond, readAllowance + seconds * perSecond);
+        allowanceAt = now;
+        if (readAllowance >= 0) return false;
+        if (!allowanceTimer) {
+            allowanceTimer = true;
+            auto wait = std::chrono::duration<double>(-readAllowance / perSecond);
+            std::weak_ptr<Impl> weak = shared_from_this();
+            internal::afterDelay(std::chrono::duration_cast<std::chrono::nanoseconds>(wait), [weak] {
+                relieve(weak, Relief::AllowanceBack);
+            });
+        }
+        return true;
+    }
+
     // Back-pressure: stop reading from a peer that does not keep up, resume when it has.
     void checkPressure() REQUIRES(mutex) {
-        bool over = outBytes > kHighWaterBytes || outReplies > kMaxQueuedReplies || unfinished > kMaxUnfinished;
+        bool overspent = overAllowance();
+        bool over = outBytes > kHighWaterBytes || outReplies > kMaxQueuedReplies || unfinished > kMaxUnfinished ||
+                    overspent;
         bool under = outBytes <= kHighWaterBytes / 2 && outReplies <= kMaxQueuedReplies / 2 &&
-                     unfinished <= kMaxUnfinished / 2;
+                     unfinished <= kMaxUnfinished / 2 && !overspent;
         if (!readPaused && over) {
             readPaused = true;
             updateInterest();
@@ -133,6 +164,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
                 closeForViolation(error);
                 return;
             }
+            if (accepted && frame.bytes >= kLargeFrameBytes) readAllowance -= static_cast<double>(frame.bytes);
             handleFrame(std::move(frame));
             partial = false;
             checkPressure();
@@ -283,17 +315,25 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     void closeForViolation(const std::string& why) REQUIRES(mutex) {
         log::error(rpxLog(), "rpx: closing connection to pid %d: %{public}s", peerPid, why);
         if (accepted && !invalid) internal::recordViolation(peerPid);
-        closeLocked();
+        closeLocked(Closing::BySoonest);
     }
 
+    // Who closes the socket: this thread, or the reaper (a peer that broke the protocol may have
+    // left descriptors in flight whose release takes long).
+    enum class Closing { Here, BySoonest };
+
     // The connection ends: no more I/O, pending replies fail, the invalid event is delivered.
-    void closeLocked() REQUIRES(mutex) {
+    void closeLocked(Closing closing = Closing::Here) REQUIRES(mutex) {
         if (invalid) return;
         invalid = true;
         if (fd >= 0) {
             IoLoop::shared().remove(fd);
             ::shutdown(fd, SHUT_RDWR);  // wakes a synchronous reader polling its duplicate
-            ::close(fd);
+            if (closing == Closing::BySoonest) {
+                internal::closeSoon(fd);
+            } else {
+                ::close(fd);
+            }
             fd = -1;
         }
         out.clear();
@@ -374,12 +414,13 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         return static_cast<size_t>(n) < sizeof buf ? ReadStatus::Drained : ReadStatus::More;
     }
 
+    // One read per wake-up: the interest is level-triggered, so what is left is reported again,
+    // after the other connections that are ready have had their turn. A peer sending a frame of
+    // megabytes holds the I/O thread for one read at a time, not for the whole frame.
     void onReadable() EXCLUDES(mutex) {
-        for (;;) {
-            MutexLock lock(mutex);
-            if (fd < 0 || readPaused || syncReader) return;
-            if (readOnce() != ReadStatus::More) return;
-        }
+        MutexLock lock(mutex);
+        if (fd < 0 || readPaused || syncReader) return;
+        (void)readOnce();
     }
 
     // Becomes the synchronous reader, if the connection allows one now.
@@ -433,15 +474,24 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         ++unfinished;
         std::weak_ptr<Impl> weak = shared_from_this();
         return std::shared_ptr<void>(nullptr, [weak](void*) {
-            auto impl = weak.lock();
-            if (!impl) return;
-            {
-                MutexLock lock(impl->mutex);
-                if (impl->unfinished) --impl->unfinished;
-                if (!impl->invalid) impl->checkPressure();
-            }
-            impl->runReady();
+            relieve(weak, Relief::WorkDone);
         });
+    }
+
+    // What may have held reading back: a unit of work, or the wait for the allowance.
+    enum class Relief { WorkDone, AllowanceBack };
+
+    // It ended: looks at the back-pressure again, and runs the events that resuming made ready.
+    static void relieve(const std::weak_ptr<Impl>& weak, Relief relief) {
+        auto impl = weak.lock();
+        if (!impl) return;
+        {
+            MutexLock lock(impl->mutex);
+            if (relief == Relief::WorkDone && impl->unfinished) --impl->unfinished;
+            if (relief == Relief::AllowanceBack) impl->allowanceTimer = false;
+            if (!impl->invalid) impl->checkPressure();
+        }
+        impl->runReady();
     }
 
     void handleFrame(wire::Frame frame) REQUIRES(mutex) {

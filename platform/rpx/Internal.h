@@ -4,6 +4,7 @@
 #include <sys/epoll.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -25,6 +26,9 @@ namespace corvane::rpx::internal {
 inline constexpr size_t kHighWaterBytes = 8u << 20;
 inline constexpr size_t kMaxQueuedReplies = 64;
 inline constexpr size_t kMaxUnfinished = 32;
+// Frames from this size on are charged to their connection's reading allowance
+// (read-mib-per-second).
+inline constexpr size_t kLargeFrameBytes = 64u << 10;
 
 const log::Handle& rpxLog();
 
@@ -68,6 +72,7 @@ private:
 
     void run() {
         pthread_setname_np(pthread_self(), "rpx-io");
+        dispatch::requestShortSlices();
         struct epoll_event events[64];
         for (;;) {
             int n = epoll_wait(epoll_, events, 64, -1);
@@ -104,6 +109,8 @@ extern std::atomic<size_t> gClosedSinceTrim;
 void startSweeper();
 // Runs `task` on the I/O thread at the sweeper's next round (within a second).
 void afterSweep(std::function<void()> task);
+// Runs `task` on the I/O thread once `delay` has passed.
+void afterDelay(std::chrono::nanoseconds delay, std::function<void()> task);
 
 // Counts a protocol violation by the peer process of an accepted connection: past
 // `violations-per-second` of them in a second, its new connections are refused for a while
@@ -111,6 +118,10 @@ void afterSweep(std::function<void()> task);
 void recordViolation(pid_t pid);
 // Whether new connections of the process are refused now.
 bool connectionsBarred(pid_t pid);
+
+// Closes the socket of a peer that broke the protocol on the reaper thread, at the lowest priority,
+// or here when the reaper is already behind.
+void closeSoon(int fd);
 
 // The identity of the process at the other end of a connected socket.
 PeerIdentity identityOfSocket(int sock);

@@ -17,8 +17,11 @@ namespace corvane::rpx {
 namespace {
 constexpr int kAcceptsPerWakeup = 16;
 constexpr size_t kRememberedProcesses = 1024;
-// How long accepting pauses after a wake-up that closed connections of a barred process.
-constexpr long kBarredPauseNanoseconds = 10'000'000;
+// How long accepting pauses after a wake-up that closed connections of a barred process: long
+// enough that a flooding process spends most of its time blocked in connect() (after 10 ms pauses
+// it still kept a core busy sending into the backlog); a well-behaved client's connect waits in the
+// kernel meanwhile and is taken at the next wake-up.
+constexpr long kBarredPauseNanoseconds = 50'000'000;
 }  // namespace
 
 struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
@@ -163,7 +166,7 @@ struct Listener::Impl : std::enable_shared_from_this<Listener::Impl> {
             socklen_t credLength = sizeof cred;
             getsockopt(client, SOL_SOCKET, SO_PEERCRED, &cred, &credLength);
             if (connectionsBarred(cred.pid)) {
-                ::close(client);
+                closeSoon(client);
                 closedBarred = true;
                 continue;
             }

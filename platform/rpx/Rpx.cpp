@@ -30,6 +30,7 @@ Limits readLimits() {
         if (name == "queued-reply-mib") l.queuedReplyMiB = n;
         if (name == "partial-frame-seconds") l.partialFrameSeconds = static_cast<unsigned>(n);
         if (name == "violations-per-second") l.violationsPerSecond = static_cast<unsigned>(n);
+        if (name == "read-mib-per-second") l.readMiBPerSecond = n;
     }
     return l;
 }

@@ -86,6 +86,7 @@ struct Limits {
     size_t queuedReplyMiB = 64;           // "queued-reply-mib": replies queued for all peers together
     unsigned partialFrameSeconds = 10;    // "partial-frame-seconds": a frame begun and not finished
     unsigned violationsPerSecond = 8;     // "violations-per-second": more bar a process's new connections
+    size_t readMiBPerSecond = 4;          // "read-mib-per-second": large frames one accepted connection may send
 };
 const Limits& limits();
 
@@ -226,6 +227,12 @@ Result<std::shared_ptr<Listener>> serveRequests(const std::string& name, dispatc
 // endpoint this process does not serve, or one under another platform root): their clients are
 // refused at once instead of waiting for ever. A daemon calls it once all its listeners exist.
 void closeUnclaimedSockets();
+
+// The UUIDs at the start of an array, up to its first element that is no UUID; `all` tells whether
+// every element was one. An array that arrived encoded is read straight from its bytes, without
+// making a value per element: a request that names thousands of plug-ins costs a copy of their
+// UUIDs.
+std::vector<UUID> leadingUuids(const Value& array, bool& all);
 
 // The socket path of an endpoint under the current platform root.
 std::string endpointPath(const std::string& name);

@@ -1,9 +1,11 @@
 // The sweeper: once a second, ends connections stuck in a partial frame, and after a burst of
-// closed connections gives the freed memory back to the system.
+// closed connections gives the freed memory back to the system. Beside it, the timer that runs
+// tasks on the I/O thread after a delay.
 #include <malloc.h>
 #include <sys/timerfd.h>
 
 #include <chrono>
+#include <map>
 #include <mutex>
 #include <vector>
 
@@ -66,6 +68,61 @@ void internal::startSweeper() {
             sweep();
         });
     });
+}
+
+namespace {
+
+Mutex gDelayedMutex;
+int gDelayTimer GUARDED_BY(gDelayedMutex) = -1;
+std::multimap<std::chrono::steady_clock::time_point, std::function<void()>>& delayed() REQUIRES(gDelayedMutex) {
+    static auto* tasks = new std::multimap<std::chrono::steady_clock::time_point, std::function<void()>>();
+    return *tasks;
+}
+
+// Sets the timer to the earliest task, or disarms it.
+void armDelayTimer() REQUIRES(gDelayedMutex) {
+    struct itimerspec at {};
+    if (!delayed().empty()) {
+        auto wait = delayed().begin()->first - std::chrono::steady_clock::now();
+        auto ns = std::max<int64_t>(1, std::chrono::duration_cast<std::chrono::nanoseconds>(wait).count());
+        at.it_value.tv_sec = ns / 1'000'000'000;
+        at.it_value.tv_nsec = ns % 1'000'000'000;
+    }
+    timerfd_settime(gDelayTimer, 0, &at, nullptr);
+}
+
+void runDueTasks() {
+    std::vector<std::function<void()>> due;
+    {
+        MutexLock lock(gDelayedMutex);
+        uint64_t expirations;
+        (void)!::read(gDelayTimer, &expirations, sizeof expirations);
+        auto now = std::chrono::steady_clock::now();
+        auto& tasks = delayed();
+        while (!tasks.empty() && tasks.begin()->first <= now) {
+            due.push_back(std::move(tasks.begin()->second));
+            tasks.erase(tasks.begin());
+        }
+        armDelayTimer();
+    }
+    for (auto& task : due) task();
+}
+
+}  // namespace
+
+void internal::afterDelay(std::chrono::nanoseconds delay, std::function<void()> task) {
+    MutexLock lock(gDelayedMutex);
+    if (gDelayTimer < 0) {
+        gDelayTimer = timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
+        if (gDelayTimer < 0) {
+            // No timer to be had: the sweeper's next round is later, but still comes.
+            afterSweep(std::move(task));
+            return;
+        }
+        IoLoop::shared().add(gDelayTimer, EPOLLIN, [](uint32_t) { runDueTasks(); });
+    }
+    delayed().emplace(std::chrono::steady_clock::now() + delay, std::move(task));
+    armDelayTimer();
 }
 
 }  // namespace corvane::rpx

@@ -108,20 +108,29 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
 
 constexpr uint32_t bit(Value::Kind k) { return 1u << static_cast<unsigned>(k); }
 
-// Array elements of at least this many bytes in a large frame are decoded when first looked at.
+// Array elements and dictionary values of at least this many bytes in a large frame are decoded
+// when first looked at.
 constexpr size_t kLazyElementBytes = 512;
 // Frames from this size on are decoded lazily (their payload is kept for the elements). A frame of
 // a few large elements already gains: a host that asks for ten plug-ins and looks at one of them
 // decodes one.
 constexpr size_t kLazyFrameBytes = 4 * 1024;
 
-Value decodeValidated(std::string_view bytes);
+Value decodeValidated(const Value::Encoding& encoding);
+Value decodeKeepingElements(const Value::Encoding& encoding);
+
+// How deep below a frame's body values may be kept encoded: the body's own values (a reply's
+// "matches") and their elements (each form). Every level of keeping walks the kept bytes once more
+// to check them, so the levels are few: what a peer sends costs a bounded number of walks.
+constexpr size_t kLazyLevels = 2;
 
 class Decoder {
 public:
+    // With `buffer` (which `s` lies inside), values down to `lazyLevels` levels below the root may
+    // be kept encoded.
     Decoder(std::string_view s, const std::vector<std::shared_ptr<FileDescriptor>>& fds,
-            size_t maxDepth, std::shared_ptr<const std::string> buffer = nullptr)
-        : s_(s), fds_(fds), maxDepth_(maxDepth), buffer_(std::move(buffer)) {}
+            size_t maxDepth, std::shared_ptr<const std::string> buffer = nullptr, size_t lazyLevels = 0)
+        : s_(s), fds_(fds), maxDepth_(maxDepth), buffer_(std::move(buffer)), lazyLevels_(lazyLevels) {}
 
     std::optional<Value> all() {
         auto v = value(0);
@@ -133,8 +142,9 @@ private:
     std::string_view s_;
     const std::vector<std::shared_ptr<FileDescriptor>>& fds_;
     size_t maxDepth_;
-    // When set, `s_` lies inside it and large array elements are decoded lazily.
+    // When set, `s_` lies inside it and large values down to `lazyLevels_` are decoded lazily.
     std::shared_ptr<const std::string> buffer_;
+    size_t lazyLevels_;
     size_t pos_ = 0;
 
     struct Shape {
@@ -214,10 +224,12 @@ private:
         }
     }
 
-    // One array element: a large container without descriptors is kept encoded, to be decoded
-    // when it is first looked at; anything else is decoded now.
+    // One array element or dictionary value: a large container without descriptors is kept
+    // encoded, to be decoded when it is first looked at (by the thread that looks, not the I/O
+    // thread that reads every connection); anything else is decoded now.
     std::optional<Value> element(size_t depth) {
-        if (!buffer_ || !has(1) || (s_[pos_] != kArray && s_[pos_] != kDictionary)) return value(depth);
+        if (!buffer_ || depth > lazyLevels_ || !has(1) || (s_[pos_] != kArray && s_[pos_] != kDictionary))
+            return value(depth);
         size_t start = pos_;
         auto shape = skip(depth);
         if (!shape) return std::nullopt;
@@ -230,7 +242,7 @@ private:
                                .bytes = s_.substr(start, pos_ - start),
                                .nesting = shape->nesting,
                                .kindsInside = shape->kinds,
-                               .decode = decodeValidated});
+                               .decode = depth < lazyLevels_ ? decodeKeepingElements : decodeValidated});
     }
 
     std::optional<Value> value(size_t depth) {
@@ -301,7 +313,7 @@ private:
                 for (uint64_t i = 0; i < *n; ++i) {
                     auto key = text();
                     if (!key) return std::nullopt;
-                    auto e = value(depth + 1);
+                    auto e = element(depth + 1);
                     if (!e) return std::nullopt;
                     d.insert_or_assign(std::move(*key), std::move(*e));
                 }
@@ -318,9 +330,16 @@ private:
 };
 
 // The bytes were checked when the element was skipped; the depth was checked there too.
-Value decodeValidated(std::string_view bytes) {
-    static const std::vector<std::shared_ptr<FileDescriptor>> kNoFds;
-    auto v = Decoder(bytes, kNoFds, SIZE_MAX).all();
+const std::vector<std::shared_ptr<FileDescriptor>> kNoFds;
+
+Value decodeValidated(const Value::Encoding& encoding) {
+    auto v = Decoder(encoding.bytes, kNoFds, SIZE_MAX).all();
+    return v ? std::move(*v) : Value();
+}
+
+// Decodes a value of the frame's body, keeping its own large elements encoded in turn.
+Value decodeKeepingElements(const Value::Encoding& encoding) {
+    auto v = Decoder(encoding.bytes, kNoFds, SIZE_MAX, encoding.buffer, 1).all();
     return v ? std::move(*v) : Value();
 }
 
@@ -399,7 +418,7 @@ std::optional<Value> decodeValue(std::shared_ptr<const std::string> payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
                                  size_t maxDepth) {
     std::string_view view = *payload;
-    return Decoder(view, fds, maxDepth, std::move(payload)).all();
+    return Decoder(view, fds, maxDepth, std::move(payload), kLazyLevels).all();
 }
 
 FrameReader::Status FrameReader::next(Frame& frame, std::string& error) {
@@ -417,7 +436,12 @@ FrameReader::Status FrameReader::next(Frame& frame, std::string& error) {
                 std::to_string(maxFrame_);
         return Status::Error;
     }
-    if (rest.size() < kHeaderSize + length) return Status::NeedMore;
+    if (rest.size() < kHeaderSize + length) {
+        // Room for the whole frame at once, rather than growing (and copying) it read by read;
+        // only once a good part has come, so that a header alone reserves nothing.
+        if (rest.size() >= 65536) buffer_.reserve(offset_ + kHeaderSize + length);
+        return Status::NeedMore;
+    }
     // The descriptors of a frame arrive with its first bytes, so they are here by now.
     if (fdCount > fds_.size()) {
         error = "frame names descriptors that did not arrive";
@@ -426,18 +450,29 @@ FrameReader::Status FrameReader::next(Frame& frame, std::string& error) {
     std::vector<std::shared_ptr<FileDescriptor>> fds(fds_.begin(),
                                                      fds_.begin() + static_cast<long>(fdCount));
     fds_.erase(fds_.begin(), fds_.begin() + static_cast<long>(fdCount));
+    uint64_t id = get(rest, 8, 8);
     std::string_view payload = rest.substr(kHeaderSize, length);
-    auto body = payload.size() >= kLazyFrameBytes
-                    ? decodeValue(std::make_shared<const std::string>(payload), fds, maxDepth_)
-                    : decodeValue(payload, fds, maxDepth_);
+    std::optional<Value> body;
+    if (payload.size() < kLazyFrameBytes) {
+        body = decodeValue(payload, fds, maxDepth_);
+        offset_ += kHeaderSize + length;
+    } else if (offset_ == 0 && buffer_.size() == kHeaderSize + length) {
+        // The buffer holds this frame alone: the decoded value keeps the buffer itself.
+        auto kept = std::make_shared<const std::string>(std::move(buffer_));
+        buffer_.clear();
+        body = Decoder(std::string_view(*kept).substr(kHeaderSize), fds, maxDepth_, kept, kLazyLevels).all();
+    } else {
+        body = decodeValue(std::make_shared<const std::string>(payload), fds, maxDepth_);
+        offset_ += kHeaderSize + length;
+    }
     if (!body) {
         error = "frame does not decode";
         return Status::Error;
     }
     frame.kind = static_cast<FrameKind>(kind);
-    frame.id = get(rest, 8, 8);
+    frame.id = id;
     frame.body = std::move(*body);
-    offset_ += kHeaderSize + length;
+    frame.bytes = kHeaderSize + length;
     // Drop consumed bytes now and then, not on every frame.
     if (offset_ > 65536 && offset_ * 2 > buffer_.size()) {
         buffer_.erase(0, offset_);
@@ -460,3 +495,40 @@ void FrameReader::clear() {
 }
 
 }  // namespace corvane::rpx::wire
+
+namespace corvane::rpx {
+
+std::vector<UUID> leadingUuids(const Value& array, bool& all) {
+    std::vector<UUID> uuids;
+    const Value::Encoding* encoding = array.encoding();
+    if (!encoding || encoding->kind != Value::Kind::Array) {
+        const Array* elements = array.asArray();
+        all = true;
+        if (!elements) return uuids;
+        uuids.reserve(elements->size());
+        for (const Value& element : *elements) {
+            const UUID* uuid = element.asUUID();
+            if (!uuid) {
+                all = false;
+                break;
+            }
+            uuids.push_back(*uuid);
+        }
+        return uuids;
+    }
+    // The bytes were checked when the frame was read: a tag, a count, then the elements.
+    std::string_view bytes = encoding->bytes;
+    uint64_t count = wire::get(bytes, 1, 4);
+    size_t at = 5;
+    uuids.reserve(count);
+    for (uint64_t i = 0; i < count; ++i, at += 17) {
+        if (static_cast<uint8_t>(bytes[at]) != wire::kUUID) break;
+        UUID uuid;
+        std::memcpy(uuid.bytes.data(), bytes.data() + at + 1, 16);
+        uuids.push_back(uuid);
+    }
+    all = uuids.size() == count;
+    return uuids;
+}
+
+}  // namespace corvane::rpx

@@ -24,6 +24,7 @@ struct Frame {
     FrameKind kind = FrameKind::Message;
     uint64_t id = 0;
     Value body;
+    size_t bytes = 0;  // of the frame on the wire, header included; set by FrameReader
 };
 
 // Encodes a frame. The descriptors inside `body` are appended to `fds`, in the order the payload
@@ -36,9 +37,9 @@ std::optional<Value> decodeValue(std::string_view payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
                                  size_t maxDepth);
 
-// The same for a payload that the decoded value may keep: large array elements (dictionaries and
-// arrays of 512 bytes and more, without descriptors) are checked now and decoded when first looked
-// at. Frames of 4 KiB and more are decoded so.
+// The same for a payload that the decoded value may keep: large values of the body and large
+// elements of those (dictionaries and arrays of 512 bytes and more, without descriptors) are
+// checked now and decoded when first looked at. Frames of 4 KiB and more are decoded so.
 std::optional<Value> decodeValue(std::shared_ptr<const std::string> payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
                                  size_t maxDepth);

@@ -113,7 +113,7 @@ public:
     explicit EncodedContainer(Value::Encoding encoding) : encoding_(std::move(encoding)) {}
     const Value::Encoding& encoding() const { return encoding_; }
     const Value& decoded() const {
-        std::call_once(once_, [this] { decoded_ = encoding_.decode(encoding_.bytes); });
+        std::call_once(once_, [this] { decoded_ = encoding_.decode(encoding_); });
         return decoded_;
     }
 

@@ -204,7 +204,7 @@ public:
         std::string_view bytes;           // the value's whole encoding, inside `buffer`
         size_t nesting = 0;               // levels of containers, the value itself included
         uint32_t kindsInside = 0;         // bit (1 << Kind) for every kind inside, the value's own too
-        Value (*decode)(std::string_view bytes) = nullptr;  // never fails on these bytes
+        Value (*decode)(const Encoding& self) = nullptr;  // never fails on these bytes
     };
     static Value encoded(Encoding encoding);
     // The encoding of a value made by `encoded`; null for any other value.
