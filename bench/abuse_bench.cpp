@@ -242,8 +242,11 @@ void end(pid_t pid, int sig) {
 
 int runAbuse(int argc, char** argv) {
     double seconds = 2;
-    for (int i = 1; i + 1 < argc; i += 2)
+    std::string only;  // one kind of abuse, when profiling it
+    for (int i = 1; i + 1 < argc; i += 2) {
         if (std::strcmp(argv[i], "--seconds") == 0) seconds = std::atof(argv[i + 1]);
+        if (std::strcmp(argv[i], "--only") == 0) only = argv[i + 1];
+    }
     char tmpl[] = "/tmp/axbench-abuse.XXXXXX";
     std::string root = mkdtemp(tmpl);
     setenv("CORVANE_ROOT", root.c_str(), 1);
@@ -291,6 +294,7 @@ int runAbuse(int argc, char** argv) {
     long maxRss = baseline.rssMiB;
     long unanswered = baseline.unanswered;
     for (const char* kind : kKinds) {
+        if (!only.empty() && only != kind) continue;
         pid_t agent = spawn({self, "abuse-agent", kind, uuid});
         std::this_thread::sleep_for(std::chrono::milliseconds(300));  // the abuse is under way
         Phase p = measure(axd, seconds);
