@@ -136,6 +136,16 @@ struct EchoServer {
     }
 };
 
+// The one frame in `bytes`, read as a connection reads it.
+wire::Frame readFrame(const std::string& bytes) {
+    wire::FrameReader reader(4 << 20, rpx::kMaxDepth);
+    reader.append(bytes.data(), bytes.size());
+    wire::Frame f;
+    std::string error;
+    EXPECT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+    return f;
+}
+
 int rawConnect(const std::string& name) {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     struct sockaddr_un addr {};
@@ -306,12 +316,7 @@ TEST(RpxWire, LeadingUuidsReadEncodedAndDecodedArraysAlike) {
     for (const Case& c : cases) {
         // Once as sent in a large frame (kept encoded), once as a plain value.
         Value body = dict({{"uuids", c.array}, {"padding", std::string(8192, 'p')}});
-        std::string bytes = frameBytes(wire::FrameKind::Request, 1, body);
-        wire::FrameReader reader(4 << 20, rpx::kMaxDepth);
-        reader.append(bytes.data(), bytes.size());
-        wire::Frame f;
-        std::string error;
-        ASSERT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+        wire::Frame f = readFrame(frameBytes(wire::FrameKind::Request, 1, body));
         for (const Value* array : {&f.body["uuids"], &c.array}) {
             bool all = !c.all;
             std::vector<UUID> got = rpx::leadingUuids(*array, all);
@@ -341,12 +346,7 @@ TEST(RpxWire, EncodingsPutTogetherFromPartsDecodeToTheirValue) {
                                         expected.kindsInside());
     EXPECT_EQ(made, expected);
     Value body = dict({{"matches", made}});
-    std::string bytes = frameBytes(wire::FrameKind::Reply, 1, body);
-    wire::FrameReader reader(1 << 20, rpx::kMaxDepth);
-    reader.append(bytes.data(), bytes.size());
-    wire::Frame f;
-    std::string error;
-    ASSERT_EQ(reader.next(f, error), wire::FrameReader::Status::Frame) << error;
+    wire::Frame f = readFrame(frameBytes(wire::FrameKind::Reply, 1, body));
     EXPECT_EQ(f.body, dict({{"matches", expected}}));
     // Too deep for the encoder's limit, an encoded part is refused like any other value.
     std::vector<int> fds;
