@@ -141,13 +141,24 @@ int runAgent(int argc, char** argv) {
         if (argc < 3) return 64;
         auto uuid = UUID::parse(argv[2]);
         if (!uuid) return 64;
+        // Encoded once and sent again and again, as an attacker would: the daemon gets as many
+        // requests as it takes, and the abuser spends no processor time of its own on each.
         Array many(20000, Value(*uuid));
-        auto queue = dispatch::Queue::create("agent");
-        auto c = rpx::Connection::connect(kEndpoint, queue);
-        c->setEventHandler([](const rpx::Event&) {});
-        c->resume();
         Value body = request("annotate", {{"annotations", dict({{"election", 1}})}, {"uuids", Value(many)}});
-        for (;;) (void)c->sendWithReplySync(body);
+        std::string bytes = frame(wire::FrameKind::Request, 1, body);
+        int fd = rawConnect();
+        wire::FrameReader replies(1 << 20, rpx::kMaxDepth);
+        char buf[4096];
+        for (;;) {
+            writeAll(fd, bytes);
+            wire::Frame reply;
+            std::string error;
+            while (replies.next(reply, error) == wire::FrameReader::Status::NeedMore) {
+                ssize_t n = read(fd, buf, sizeof buf);
+                if (n <= 0) return 0;
+                replies.append(buf, static_cast<size_t>(n));
+            }
+        }
     }
     return 64;
 }
