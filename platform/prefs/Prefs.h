@@ -16,7 +16,7 @@ namespace corvane::prefs {
 // The file that holds a domain's values.
 std::string domainPath(const std::string& domain);
 
-// Re-reads the domain from storage. Reads never return what a finished write changed, so this only
+// Re-reads the domain from storage. Every read already sees each finished write, so this only
 // exists for callers that state the intent; it checks that the domain name is usable.
 Status synchronize(const std::string& domain);
 

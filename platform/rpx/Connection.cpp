@@ -4,8 +4,6 @@
 #include <fcntl.h>
 
 #include <atomic>
-#include <chrono>
-#include <thread>
 
 #include "platform/rpx/ConnectionImpl.h"
 

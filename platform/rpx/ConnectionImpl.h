@@ -94,7 +94,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     // back. One peer that sends huge requests one after another so gets its share of the daemon,
     // and no more. Small frames are bounded by the count of unfinished work instead: charging them
     // too would only make a flood of them come in bursts.
-    double readAllowance GUARDED_BY(mutex) = static_cast<double>(limits().readMiBPerSecond) * (1 << 20);
+    double readAllowance GUARDED_BY(mutex) = allowancePerSecond();
     std::chrono::steady_clock::time_point allowanceAt GUARDED_BY(mutex) = std::chrono::steady_clock::now();
     bool allowanceTimer GUARDED_BY(mutex) = false;  // a resumption is already arranged
     // An accepted connection keeps itself alive until its invalid event has been delivered.
@@ -113,19 +113,33 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         if (fd >= 0) IoLoop::shared().modify(fd, interest());
     }
 
-    // Whether an accepted connection has read past its allowance. When it has, resumption is
-    // arranged for when the allowance is back.
-    bool overAllowance() REQUIRES(mutex) {
-        if (!accepted) return false;
-        double perSecond = static_cast<double>(limits().readMiBPerSecond) * (1 << 20);
+    static double allowancePerSecond() { return static_cast<double>(limits().readMiBPerSecond) * (1 << 20); }
+
+    // Adds what the time since the last refill earned, up to a second's worth.
+    void refillAllowance() REQUIRES(mutex) {
         auto now = std::chrono::steady_clock::now();
         double seconds = std::chrono::duration<double>(now - allowanceAt).count();
-        readAllowance = std::min(perSecond, readAllowance + seconds * perSecond);
+        readAllowance = std::min(allowancePerSecond(), readAllowance + seconds * allowancePerSecond());
         allowanceAt = now;
+    }
+
+    // A large frame of an accepted connection was read: it is paid from the allowance.
+    void chargeAllowance(size_t bytes) REQUIRES(mutex) {
+        if (!accepted || bytes < kLargeFrameBytes) return;
+        refillAllowance();
+        readAllowance -= static_cast<double>(bytes);
+    }
+
+    // Whether the connection has read past its allowance. When it has, resumption is arranged for
+    // when the allowance is back. Only an overspent allowance needs the clock: every frame passes
+    // here.
+    bool overAllowance() REQUIRES(mutex) {
+        if (readAllowance >= 0) return false;
+        refillAllowance();
         if (readAllowance >= 0) return false;
         if (!allowanceTimer) {
             allowanceTimer = true;
-            auto wait = std::chrono::duration<double>(-readAllowance / perSecond);
+            auto wait = std::chrono::duration<double>(-readAllowance / allowancePerSecond());
             std::weak_ptr<Impl> weak = shared_from_this();
             internal::afterDelay(std::chrono::duration_cast<std::chrono::nanoseconds>(wait), [weak] {
                 relieve(weak, Relief::AllowanceBack);
@@ -164,7 +178,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
                 closeForViolation(error);
                 return;
             }
-            if (accepted && frame.bytes >= kLargeFrameBytes) readAllowance -= static_cast<double>(frame.bytes);
+            chargeAllowance(frame.bytes);
             handleFrame(std::move(frame));
             partial = false;
             checkPressure();
@@ -315,12 +329,12 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     void closeForViolation(const std::string& why) REQUIRES(mutex) {
         log::error(rpxLog(), "rpx: closing connection to pid %d: %{public}s", peerPid, why);
         if (accepted && !invalid) internal::recordViolation(peerPid);
-        closeLocked(Closing::BySoonest);
+        closeLocked(Closing::ByReaper);
     }
 
     // Who closes the socket: this thread, or the reaper (a peer that broke the protocol may have
     // left descriptors in flight whose release takes long).
-    enum class Closing { Here, BySoonest };
+    enum class Closing { Here, ByReaper };
 
     // The connection ends: no more I/O, pending replies fail, the invalid event is delivered.
     void closeLocked(Closing closing = Closing::Here) REQUIRES(mutex) {
@@ -329,7 +343,7 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
         if (fd >= 0) {
             IoLoop::shared().remove(fd);
             ::shutdown(fd, SHUT_RDWR);  // wakes a synchronous reader polling its duplicate
-            if (closing == Closing::BySoonest) {
+            if (closing == Closing::ByReaper) {
                 internal::closeSoon(fd);
             } else {
                 ::close(fd);
