@@ -97,30 +97,46 @@ bool collapse(const AXDPlugIn& p, Results& results, uint64_t flags, std::map<con
 }
 
 // The "matches" array as the wire carries it: each chosen plug-in's encoded form with this
-// request's annotations and replacement marks in front. Null when a form holds a value that a
-// message cannot carry, as the reply conversion would give.
+// request's annotations and replacement marks in front. The forms are not copied: the array is
+// put together from this request's own bytes and the forms where their plug-ins keep them, and the
+// reply goes to the socket so. Null when a form holds a value that a message cannot carry, as the
+// reply conversion would give.
 Value encodeMatches(const ResultList& list) {
     namespace wire = corvane::rpx::wire;
-    auto bytes = std::make_shared<std::string>();
-    size_t size = 16;
-    for (const auto& chosen : list) size += chosen.form->entries.size() + 64;
-    bytes->reserve(size);
-    wire::appendArrayHeader(*bytes, static_cast<uint32_t>(list.size()));
+    auto own = std::make_shared<std::string>();
+    own->reserve(16 + list.size() * 64);
+    wire::appendArrayHeader(*own, static_cast<uint32_t>(list.size()));
+    std::vector<size_t> ownEnds;  // where each form's own bytes end in `own`
+    ownEnds.reserve(list.size());
     size_t nesting = 0;
     uint32_t kinds = 0;
     for (const auto& chosen : list) {
         uint32_t count = chosen.form->count + 1 + (chosen.overrider ? 1 : 0) + (chosen.overriding ? 1 : 0);
-        wire::appendDictionaryHeader(*bytes, count);
-        bool written = wire::appendEntry(*bytes, form::kAnnotations, chosen.annotations);
-        if (chosen.overrider) written = written && wire::appendEntry(*bytes, form::kOverrider, Value(*chosen.overrider));
-        if (chosen.overriding) written = written && wire::appendEntry(*bytes, form::kOverriding, Value(*chosen.overriding));
+        wire::appendDictionaryHeader(*own, count);
+        bool written = wire::appendEntry(*own, form::kAnnotations, chosen.annotations);
+        if (chosen.overrider) written = written && wire::appendEntry(*own, form::kOverrider, Value(*chosen.overrider));
+        if (chosen.overriding) written = written && wire::appendEntry(*own, form::kOverriding, Value(*chosen.overriding));
         if (!written) return Value();
-        bytes->append(chosen.form->entries);
+        ownEnds.push_back(own->size());
         nesting = std::max({nesting, chosen.form->nesting + 1, wire::nestingOf(chosen.annotations) + 2});
         kinds |= chosen.form->kindsInside | chosen.annotations.kindsInside();
     }
+    Value::Encoding::Pieces pieces;
+    pieces.bytes.reserve(2 * list.size());
+    pieces.owners.reserve(list.size() + 1);
+    size_t from = 0, next = 0;
+    for (const auto& chosen : list) {
+        pieces.bytes.emplace_back(own->data() + from, ownEnds[next] - from);
+        from = ownEnds[next++];
+        pieces.bytes.emplace_back(chosen.form->entries);
+        pieces.owners.push_back(chosen.form);
+        pieces.size += chosen.form->entries.size();
+    }
+    if (from < own->size()) pieces.bytes.emplace_back(own->data() + from, own->size() - from);  // no forms
+    pieces.size += own->size();
+    pieces.owners.push_back(std::move(own));
     // The reply conversion reads what the encoded array holds without decoding it.
-    return convertValueToMessage(wire::encodedContainer(std::move(bytes), nesting, kinds));
+    return convertValueToMessage(wire::encodedPieces(std::move(pieces), nesting, kinds));
 }
 
 }  // namespace

@@ -11,6 +11,7 @@
 #include <condition_variable>
 #include <cstring>
 #include <filesystem>
+#include <mutex>
 #include <thread>
 
 #include "platform/log/Log.h"
@@ -106,6 +107,8 @@ struct EchoServer {
     struct State {
         std::atomic<int> requests{0};
         std::atomic<size_t> replyPadding{0};
+        std::mutex mutex;
+        Value attachment;  // sent with every reply when set
         Recorder recorder;
     };
     dispatch::QueuePtr queue = dispatch::Queue::create("test.listener");
@@ -128,6 +131,10 @@ struct EchoServer {
                 ++state->requests;
                 Dictionary reply{{"echo", ev.message}};
                 if (size_t pad = state->replyPadding) reply.emplace("pad", Value(std::string(pad, 'x')));
+                {
+                    std::lock_guard lock(state->mutex);
+                    if (!state->attachment.isNull()) reply.emplace("attachment", state->attachment);
+                }
                 conn->sendReply(ev.messageId, Value(std::move(reply)));
             });
             c->resume();
@@ -351,6 +358,58 @@ TEST(RpxWire, EncodingsPutTogetherFromPartsDecodeToTheirValue) {
     // Too deep for the encoder's limit, an encoded part is refused like any other value.
     std::vector<int> fds;
     EXPECT_FALSE(wire::encodeFrame(wire::Frame{wire::FrameKind::Reply, 1, body}, fds, 3));
+
+    // The same bytes in pieces that others own: decoded alike, and copied into a small frame.
+    auto owner = std::make_shared<std::string>(whole);
+    Value::Encoding::Pieces pieces;
+    for (size_t at = 0; at < owner->size(); at += 7)
+        pieces.bytes.push_back(std::string_view(*owner).substr(at, 7));
+    pieces.owners.push_back(owner);
+    pieces.size = owner->size();
+    Value inPieces = wire::encodedPieces(pieces, wire::nestingOf(expected), expected.kindsInside());
+    EXPECT_EQ(inPieces, expected);
+    auto small = wire::encodeFramePieces(wire::Frame{wire::FrameKind::Reply, 1, dict({{"matches", inPieces}})}, fds, 16);
+    ASSERT_TRUE(small);
+    EXPECT_EQ(small->pieces.size(), 1u);
+    EXPECT_EQ(readFrame(small->joined()).body, dict({{"matches", expected}}));
+}
+
+// Many elements of 1 KiB in pieces: the array a match reply sends.
+static Value largeArrayInPieces(size_t count, Value& expected) {
+    auto header = std::make_shared<std::string>();
+    wire::appendArrayHeader(*header, static_cast<uint32_t>(count));
+    Value::Encoding::Pieces pieces;
+    pieces.bytes.push_back(*header);
+    pieces.owners.push_back(header);
+    Array elements;
+    for (size_t i = 0; i < count; ++i) {
+        auto element = std::make_shared<std::string>();
+        Value one = dict({{"n", Value(static_cast<int64_t>(i))}, {"pad", std::string(1000, 'a' + i % 26)}});
+        wire::appendDictionaryHeader(*element, 2);
+        wire::appendEntry(*element, "n", one["n"]);
+        wire::appendEntry(*element, "pad", one["pad"]);
+        pieces.bytes.push_back(*element);
+        pieces.owners.push_back(element);
+        elements.push_back(one);
+    }
+    pieces.size = header->size() + count * pieces.bytes.back().size();
+    expected = Value(std::move(elements));
+    return wire::encodedPieces(std::move(pieces), 2, expected.kindsInside());
+}
+
+TEST(RpxWire, LargeEncodingsInPiecesAreReferredToNotCopied) {
+    Value expected;
+    Value large = largeArrayInPieces(100, expected);
+    std::vector<int> fds;
+    auto frame = wire::encodeFramePieces(wire::Frame{wire::FrameKind::Reply, 9, dict({{"matches", large}})}, fds, 16);
+    ASSERT_TRUE(frame);
+    // The frame's own bytes before, the 101 pieces as they are kept, nothing after.
+    ASSERT_EQ(frame->pieces.size(), 102u);
+    EXPECT_EQ(frame->pieces[1].data(), large.encoding()->pieces->bytes[0].data());
+    EXPECT_EQ(frame->pieces[101].data(), large.encoding()->pieces->bytes[100].data());
+    wire::Frame f = readFrame(frame->joined());
+    EXPECT_EQ(f.id, 9u);
+    EXPECT_EQ(f.body, dict({{"matches", expected}}));
 }
 
 TEST(Rpx, TwoProcessesExchangeEveryKindIncludingDescriptors) {
@@ -389,6 +448,15 @@ TEST(Rpx, RepliesAreBoundToTheirRequestsAndArriveOnTheChosenQueue) {
     auto big = c->sendWithReplySync(dict({{"big", true}}));
     ASSERT_TRUE(big.ok()) << big.description();
     EXPECT_EQ(big.value["pad"].asString()->size(), 256u * 1024);
+    // So does one that the socket is given in thousands of pieces, many times its buffer.
+    Value expected;
+    {
+        std::lock_guard lock(server.state->mutex);
+        server.state->attachment = largeArrayInPieces(3000, expected);
+    }
+    auto pieces = c->sendWithReplySync(dict({{"pieces", true}}));
+    ASSERT_TRUE(pieces.ok()) << pieces.description();
+    EXPECT_EQ(pieces.value["attachment"], expected);
 }
 
 TEST(Rpx, AnUnreachableEndpointIsAnInvalidConnection) {

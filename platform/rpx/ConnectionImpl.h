@@ -23,8 +23,9 @@ using namespace internal;
 
 struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     struct Outgoing {
-        std::string bytes;
-        size_t offset = 0;
+        wire::FrameBytes frame;
+        size_t piece = 0, offset = 0;  // the next byte to send: frame.pieces[piece][offset]
+        size_t sent = 0;
         std::vector<std::shared_ptr<FileDescriptor>> fds;  // sent with the first byte
         bool reply = false;
     };
@@ -248,12 +249,20 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
     void flush() REQUIRES(mutex) {
         while (!out.empty() && fd >= 0) {
             Outgoing& o = out.front();
-            struct iovec iov {o.bytes.data() + o.offset, o.bytes.size() - o.offset};
+            // As many pieces as one call takes, from where the last one stopped.
+            constexpr size_t kMaxPieces = 64;
+            struct iovec iov[kMaxPieces];
+            size_t count = 0;
+            for (size_t i = o.piece; i < o.frame.pieces.size() && count < kMaxPieces; ++i) {
+                std::string_view piece = o.frame.pieces[i];
+                size_t skip = i == o.piece ? o.offset : 0;
+                iov[count++] = {const_cast<char*>(piece.data()) + skip, piece.size() - skip};
+            }
             struct msghdr msg {};
-            msg.msg_iov = &iov;
-            msg.msg_iovlen = 1;
+            msg.msg_iov = iov;
+            msg.msg_iovlen = count;
             std::vector<char> control;
-            if (o.offset == 0 && !o.fds.empty()) {
+            if (o.sent == 0 && !o.fds.empty()) {
                 control.resize(CMSG_SPACE(sizeof(int) * o.fds.size()));
                 msg.msg_control = control.data();
                 msg.msg_controllen = control.size();
@@ -271,10 +280,20 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
                 closeLocked();
                 return;
             }
-            o.offset += static_cast<size_t>(n);
+            o.sent += static_cast<size_t>(n);
             outBytes -= static_cast<size_t>(n);
             gQueuedReplyBytes -= static_cast<size_t>(n);
-            if (o.offset == o.bytes.size()) {
+            for (size_t left = static_cast<size_t>(n); left > 0;) {
+                size_t rest = o.frame.pieces[o.piece].size() - o.offset;
+                if (left < rest) {
+                    o.offset += left;
+                    break;
+                }
+                left -= rest;
+                ++o.piece;
+                o.offset = 0;
+            }
+            if (o.sent == o.frame.size) {
                 if (o.reply) --outReplies;
                 out.pop_front();
             } else {
@@ -291,13 +310,13 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
 
     bool sendFrame(wire::FrameKind kind, uint64_t id, const Value& body) REQUIRES(mutex) {
         std::vector<int> raw;
-        auto bytes = wire::encodeFrame(wire::Frame{kind, id, body}, raw, kMaxDepth);
+        auto bytes = wire::encodeFramePieces(wire::Frame{kind, id, body}, raw, kMaxDepth);
         if (!bytes) {
             log::error(rpxLog(), "rpx: message to pid %d nested too deeply; not sent", peerPid);
             return false;
         }
         Outgoing o;
-        o.bytes = std::move(*bytes);
+        o.frame = std::move(*bytes);
         o.reply = kind == wire::FrameKind::Reply;
         for (int f : raw) {
             int copy = fcntl(f, F_DUPFD_CLOEXEC, 0);
@@ -309,8 +328,8 @@ struct Connection::Impl : std::enable_shared_from_this<Connection::Impl> {
             o.fds.push_back(std::make_shared<FileDescriptor>(copy));
         }
         if (invalid) return false;
-        outBytes += o.bytes.size();
-        size_t queued = gQueuedReplyBytes += o.bytes.size();
+        outBytes += o.frame.size;
+        size_t queued = gQueuedReplyBytes += o.frame.size;
         if (o.reply) ++outReplies;
         out.push_back(std::move(o));
         flush();

@@ -36,12 +36,61 @@ uint64_t get(std::string_view s, size_t at, int bytes) {
     return v;
 }
 
-bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t depth, size_t maxDepth) {
+// Encoded values of at least this many bytes go to the socket from where they are kept, not
+// copied into the frame.
+constexpr size_t kReferBytes = 16 * 1024;
+
+// Collects a frame as pieces: what the encoder writes is owned by the frame; large encoded values
+// are referred to where they are kept.
+class Splicer {
+public:
+    explicit Splicer(FrameBytes& frame) : frame_(frame) {}
+
+    // Ends the bytes written so far as one piece of the frame; the encoder goes on in `out` anew.
+    void seal(std::string& out) {
+        if (out.empty()) return;
+        auto owned = std::make_shared<std::string>(std::move(out));
+        out.clear();
+        frame_.pieces.emplace_back(*owned);
+        frame_.size += owned->size();
+        if (!first_) first_ = owned;
+        frame_.owners.push_back(std::move(owned));
+    }
+    void refer(std::string& out, const Value::Encoding& e) {
+        seal(out);
+        if (e.pieces) {
+            frame_.pieces.insert(frame_.pieces.end(), e.pieces->bytes.begin(), e.pieces->bytes.end());
+            frame_.size += e.pieces->size;
+            frame_.owners.push_back(e.pieces);
+        } else {
+            frame_.pieces.push_back(e.bytes);
+            frame_.size += e.bytes.size();
+            frame_.owners.push_back(e.buffer);
+        }
+    }
+    // The first piece the encoder wrote, where the header goes.
+    std::string* first() const { return first_.get(); }
+
+private:
+    FrameBytes& frame_;
+    std::shared_ptr<std::string> first_;
+};
+
+size_t encodedSize(const Value::Encoding& e) { return e.pieces ? e.pieces->size : e.bytes.size(); }
+
+bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t depth, size_t maxDepth,
+            Splicer* splicer = nullptr) {
     if (depth > maxDepth) return false;
     if (const Value::Encoding* e = v.encoding()) {
         // Never holds a descriptor: the decoder and encodedContainer leave those out.
         if (depth + e->nesting > maxDepth) return false;
-        out.append(e->bytes);
+        if (splicer && encodedSize(*e) >= kReferBytes) {
+            splicer->refer(out, *e);
+        } else if (e->pieces) {
+            for (std::string_view piece : e->pieces->bytes) out.append(piece);
+        } else {
+            out.append(e->bytes);
+        }
         return true;
     }
     using K = Value::Kind;
@@ -86,7 +135,7 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
             out.push_back(kArray);
             put32(out, static_cast<uint32_t>(v.asArray()->size()));
             for (const Value& e : *v.asArray())
-                if (!encode(out, e, fds, depth + 1, maxDepth)) return false;
+                if (!encode(out, e, fds, depth + 1, maxDepth, splicer)) return false;
             break;
         case K::Dictionary:
             out.push_back(kDictionary);
@@ -94,7 +143,7 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
             for (const auto& [key, e] : *v.asDictionary()) {
                 put32(out, static_cast<uint32_t>(key.size()));
                 out += key;
-                if (!encode(out, e, fds, depth + 1, maxDepth)) return false;
+                if (!encode(out, e, fds, depth + 1, maxDepth, splicer)) return false;
             }
             break;
         case K::Fd:
@@ -242,7 +291,8 @@ private:
                                .bytes = s_.substr(start, pos_ - start),
                                .nesting = shape->nesting,
                                .kindsInside = shape->kinds,
-                               .decode = depth < lazyLevels_ ? decodeKeepingElements : decodeValidated});
+                               .decode = depth < lazyLevels_ ? decodeKeepingElements : decodeValidated,
+                               .pieces = nullptr});
     }
 
     std::optional<Value> value(size_t depth) {
@@ -337,6 +387,15 @@ Value decodeValidated(const Value::Encoding& encoding) {
     return v ? std::move(*v) : Value();
 }
 
+// An encoding in pieces is decoded from its pieces joined.
+Value decodeJoined(const Value::Encoding& encoding) {
+    std::string joined;
+    joined.reserve(encoding.pieces->size);
+    for (std::string_view piece : encoding.pieces->bytes) joined.append(piece);
+    auto v = Decoder(joined, kNoFds, SIZE_MAX).all();
+    return v ? std::move(*v) : Value();
+}
+
 // Decodes a value of the frame's body, keeping its own large elements encoded in turn.
 Value decodeKeepingElements(const Value::Encoding& encoding) {
     auto v = Decoder(encoding.bytes, kNoFds, SIZE_MAX, encoding.buffer, 1).all();
@@ -387,14 +446,31 @@ Value encodedContainer(std::shared_ptr<const std::string> bytes, size_t nesting,
                            .bytes = view,
                            .nesting = nesting,
                            .kindsInside = kindsInside | bit(kind),
-                           .decode = decodeValidated});
+                           .decode = decodeValidated,
+                           .pieces = nullptr});
 }
 
-std::optional<std::string> encodeFrame(const Frame& frame, std::vector<int>& fds, size_t maxDepth) {
+Value encodedPieces(Value::Encoding::Pieces pieces, size_t nesting, uint32_t kindsInside) {
+    Value::Kind kind = !pieces.bytes.empty() && !pieces.bytes.front().empty() && pieces.bytes.front()[0] == kArray
+                           ? Value::Kind::Array
+                           : Value::Kind::Dictionary;
+    return Value::encoded({.kind = kind,
+                           .buffer = nullptr,
+                           .bytes = {},
+                           .nesting = nesting,
+                           .kindsInside = kindsInside | bit(kind),
+                           .decode = decodeJoined,
+                           .pieces = std::make_shared<const Value::Encoding::Pieces>(std::move(pieces))});
+}
+
+std::optional<FrameBytes> encodeFramePieces(const Frame& frame, std::vector<int>& fds, size_t maxDepth) {
+    FrameBytes bytes;
+    Splicer splicer(bytes);
     std::string out(kHeaderSize, '\0');
     size_t firstFd = fds.size();
-    if (!encode(out, frame.body, fds, 0, maxDepth)) return std::nullopt;
-    size_t payload = out.size() - kHeaderSize;
+    if (!encode(out, frame.body, fds, 0, maxDepth, &splicer)) return std::nullopt;
+    splicer.seal(out);
+    size_t payload = bytes.size - kHeaderSize;
     if (payload > UINT32_MAX || fds.size() - firstFd > UINT16_MAX) return std::nullopt;
     std::string header;
     put32(header, static_cast<uint32_t>(payload));
@@ -404,8 +480,22 @@ std::optional<std::string> encodeFrame(const Frame& frame, std::vector<int>& fds
     header.push_back(static_cast<char>(count & 0xff));
     header.push_back(static_cast<char>(count >> 8));
     put64(header, frame.id);
-    out.replace(0, kHeaderSize, header);
+    // The first piece is the encoder's own and begins with the room for the header.
+    splicer.first()->replace(0, kHeaderSize, header);
+    return bytes;
+}
+
+std::string FrameBytes::joined() const {
+    std::string out;
+    out.reserve(size);
+    for (std::string_view piece : pieces) out.append(piece);
     return out;
+}
+
+std::optional<std::string> encodeFrame(const Frame& frame, std::vector<int>& fds, size_t maxDepth) {
+    auto bytes = encodeFramePieces(frame, fds, maxDepth);
+    if (!bytes) return std::nullopt;
+    return bytes->joined();
 }
 
 std::optional<Value> decodeValue(std::string_view payload,
@@ -501,7 +591,7 @@ namespace corvane::rpx {
 std::vector<UUID> leadingUuids(const Value& array, bool& all) {
     std::vector<UUID> uuids;
     const Value::Encoding* encoding = array.encoding();
-    if (!encoding || encoding->kind != Value::Kind::Array) {
+    if (!encoding || encoding->kind != Value::Kind::Array || encoding->pieces) {
         const Array* elements = array.asArray();
         all = true;
         if (!elements) return uuids;

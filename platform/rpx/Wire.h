@@ -32,6 +32,16 @@ struct Frame {
 // `maxDepth`.
 std::optional<std::string> encodeFrame(const Frame& frame, std::vector<int>& fds, size_t maxDepth);
 
+// A frame as the socket is given it: the pieces one after the other. Encoded values of 16 KiB and
+// more are not copied into it but referred to where they are kept, and kept alive by `owners`.
+struct FrameBytes {
+    std::vector<std::string_view> pieces;
+    std::vector<std::shared_ptr<const void>> owners;
+    size_t size = 0;  // of all pieces together
+    std::string joined() const;
+};
+std::optional<FrameBytes> encodeFramePieces(const Frame& frame, std::vector<int>& fds, size_t maxDepth);
+
 // Decodes one value; `fds` are the frame's descriptors. nullopt when malformed.
 std::optional<Value> decodeValue(std::string_view payload,
                                  const std::vector<std::shared_ptr<FileDescriptor>>& fds,
@@ -60,6 +70,9 @@ size_t nestingOf(const Value& value);
 // it, and it is decoded when first looked at. `nesting` and `kindsInside` describe its contents
 // (Value::Encoding).
 Value encodedContainer(std::shared_ptr<const std::string> bytes, size_t nesting, uint32_t kindsInside);
+// The same for an encoding put together from pieces that others keep (Value::Encoding::Pieces):
+// a frame refers to them where they are, without copying.
+Value encodedPieces(Value::Encoding::Pieces pieces, size_t nesting, uint32_t kindsInside);
 
 // Reassembles frames from a byte stream that arrives in pieces of any size, with the descriptors
 // that arrived alongside.

@@ -205,6 +205,15 @@ public:
         size_t nesting = 0;               // levels of containers, the value itself included
         uint32_t kindsInside = 0;         // bit (1 << Kind) for every kind inside, the value's own too
         Value (*decode)(const Encoding& self) = nullptr;  // never fails on these bytes
+        // A large encoding may instead be put together from pieces that others own too (the forms
+        // of a match reply, each kept by its plug-in): then `bytes` is empty and the encoding is
+        // the pieces one after the other. An encoder copies them, or hands them to the socket.
+        struct Pieces {
+            std::vector<std::string_view> bytes;
+            std::vector<std::shared_ptr<const void>> owners;  // keep the pieces alive
+            size_t size = 0;                                   // of all pieces together
+        };
+        std::shared_ptr<const Pieces> pieces;
     };
     static Value encoded(Encoding encoding);
     // The encoding of a value made by `encoded`; null for any other value.
