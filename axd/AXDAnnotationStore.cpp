@@ -55,6 +55,7 @@ AXDAnnotationStore::AXDAnnotationStore(const char* path)
         return;
     }
     annotations_.clear();
+    ++changes_;
 }
 
 Value AXDAnnotationStore::annotationForIdentifier(const std::string& key) const {
@@ -73,6 +74,7 @@ void AXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, 
         if (it == annotations_.end()) return;
         annotations_.erase(it);
         changed_ = true;
+        ++changes_;
         return;
     }
     const Dictionary* current = it != annotations_.end() ? it->second.asDictionary() : nullptr;
@@ -84,6 +86,7 @@ void AXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, 
     if (current && merged == *current) return;
     annotations_.insert_or_assign(key, Value(std::move(merged)));
     changed_ = true;
+    ++changes_;
 }
 
 void AXDAnnotationStore::saveIfChanged() {
@@ -111,6 +114,7 @@ Status AXDAnnotationStore::loadDb(const std::string& path) {
     // A current file whose "data" is missing or of another type still gives a usable table.
     const Dictionary* data = (*top)["data"].asDictionary();
     annotations_ = data ? *data : Dictionary{};
+    ++changes_;
     return {};
 }
 

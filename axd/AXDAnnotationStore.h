@@ -8,6 +8,7 @@
 // releases, <root>/var/db/Annexa-Annotations, is migrated when the primary file cannot be loaded.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <optional>
 #include <string>
@@ -65,6 +66,9 @@ public:
     // Writes the whole table to annotationsURL().
     Status saveDb();
 
+    // Changes whenever any store's table changes, in memory (not when it is saved).
+    static uint64_t changeCount() { return changes_.load(); }
+
     // The default file location, creating its directory (fatal when that fails).
     static std::string defaultDatabaseURL();
     // The daemon's data container directory (fatal when there is none).
@@ -74,6 +78,7 @@ private:
     std::string annotationsURL_;
     Dictionary annotations_;
     bool changed_ = false;  // since the last save
+    static inline std::atomic<uint64_t> changes_{0};
 };
 
 }  // namespace annexa

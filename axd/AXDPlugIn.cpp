@@ -66,7 +66,7 @@ corvane::vantry::PlugInRecordPtr AXDPlugIn::vtproxy() const {
 void AXDPlugIn::setVtproxy(corvane::vantry::PlugInRecordPtr record) {
     corvane::MutexLock lock(mutex_);
     vtproxy_ = std::move(record);
-    encodedForm_.reset();
+    dropEncodedForm();
 }
 
 // A name set on the plug-in wins; otherwise the registry record's answers.
@@ -78,7 +78,7 @@ std::optional<std::string> AXDPlugIn::localizedName() const {
 void AXDPlugIn::setLocalizedName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
     namesLocked().name = v;
-    encodedForm_.reset();
+    dropEncodedForm();
 }
 std::optional<std::string> AXDPlugIn::localizedShortName() const {
     corvane::MutexLock lock(mutex_);
@@ -88,7 +88,7 @@ std::optional<std::string> AXDPlugIn::localizedShortName() const {
 void AXDPlugIn::setLocalizedShortName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
     namesLocked().shortName = v;
-    encodedForm_.reset();
+    dropEncodedForm();
 }
 std::optional<std::string> AXDPlugIn::localizedContainingName() const {
     corvane::MutexLock lock(mutex_);
@@ -99,7 +99,12 @@ std::optional<std::string> AXDPlugIn::localizedContainingName() const {
 void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) {
     corvane::MutexLock lock(mutex_);
     namesLocked().containingName = v;
+    dropEncodedForm();
+}
+
+void AXDPlugIn::dropEncodedForm() {
     encodedForm_.reset();
+    ++formsDropped_;
 }
 
 AXDPlugIn::SetNames& AXDPlugIn::namesLocked() {

@@ -2,6 +2,7 @@
 // plug-in, answering its metadata lookups from that record instead of from stored dictionaries.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -58,6 +59,8 @@ public:
     };
     using EncodedFormPtr = std::shared_ptr<const EncodedForm>;
     corvane::Result<EncodedFormPtr> encodedForm() const;
+    // Changes whenever any plug-in's kept form is dropped (its record or a name was replaced).
+    static uint64_t formsDropped() { return formsDropped_.load(); }
 
     // The entries whose keys do not begin with "DT".
     static Dictionary prunedInfoDictionaryFor(const Value& dictionary);
@@ -112,6 +115,8 @@ private:
         std::optional<std::string> name, shortName, containingName;
     };
     SetNames& namesLocked() REQUIRES(mutex_);
+    void dropEncodedForm() REQUIRES(mutex_);
+    static inline std::atomic<uint64_t> formsDropped_{0};
     std::unique_ptr<SetNames> setNames_ GUARDED_BY(mutex_);
     // Held through a pointer: an Error inline would make each of thousands of plug-ins 80 bytes larger.
     mutable std::shared_ptr<const corvane::Result<EncodedFormPtr>> encodedForm_ GUARDED_BY(mutex_);

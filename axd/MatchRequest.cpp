@@ -3,6 +3,7 @@
 // identifier collapse to one answer; plug-ins that replace others are marked. With the flag of our
 // own, the reply also says for every installed plug-in the step that left it out.
 #include <algorithm>
+#include <deque>
 #include <list>
 #include <map>
 #include <unordered_map>
@@ -15,6 +16,7 @@
 #include "platform/rpx/Wire.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/trace/Trace.h"
+#include "platform/types/Types.h"
 
 namespace annexa {
 
@@ -141,9 +143,94 @@ Value encodeMatches(const ResultList& list) {
 
 }  // namespace
 
+// What a "match" depends on besides the host, its rules and its flags. The request reads them once,
+// at its start, and its walk uses what it read.
+struct MatchInputs {
+    uint64_t registry = 0;     // the registry's contents
+    uint64_t annotations = 0;  // the annotation table
+    uint64_t forms = 0;        // the plug-ins' kept forms
+    std::vector<Value> exclusions;
+    std::vector<std::shared_ptr<const AXDPlugInHold>> holds;
+    std::shared_ptr<const corvane::types::TypeDatabase> types;  // for type tests in patterns
+    bool operator==(const MatchInputs&) const = default;
+};
+
+// A walk's answer, with the log lines it wrote: an answer given again writes them again.
+struct MatchAnswer {
+    Value matches;       // the encoded array; null for a version without "matches"
+    Value explanations;  // with the explain flag only
+    unsigned raw = 0;    // the registry's candidates
+    unsigned returned = 0;
+    std::vector<std::string> logged;        // debug lines: exclusions and authorization
+    std::vector<std::string> exportErrors;  // error lines
+    std::vector<std::pair<std::string, std::string>> overrides;  // overrider, overridden (info lines)
+};
+
+namespace {
+
+MatchInputs currentMatchInputs(AXDServer& server) {
+    MatchInputs inputs;
+    // The versions first: a change after this point is seen by the next request.
+    inputs.registry = server.workspace().contentVersion();
+    inputs.annotations = AXDAnnotationStore::changeCount();
+    inputs.forms = AXDPlugIn::formsDropped();
+    inputs.exclusions = server.userPrefs().exclusionPatterns();
+    inputs.holds = server.currentHolds();
+    inputs.types = corvane::types::database();
+    return inputs;
+}
+
+// The last answers to "match" without rules, for the few hosts that asked last. While nothing the
+// answer depends on changed, a host that lists every plug-in again gets the same answer without a
+// walk over every plug-in. A host connection is one identity (its entitlements and bundle do not
+// change), so the key is the connection itself.
+class KeptAnswers {
+public:
+    std::shared_ptr<const MatchAnswer> find(const std::shared_ptr<AXDRpxClient>& client, uint64_t flags, uint64_t version,
+                                            const MatchInputs& inputs) {
+        corvane::MutexLock lock(mutex_);
+        for (auto it = kept_.begin(); it != kept_.end(); ++it) {
+            if (it->client.lock() != client || it->flags != flags || it->version != version) continue;
+            if (!(it->inputs == inputs)) {
+                kept_.erase(it);
+                return nullptr;
+            }
+            return it->answer;
+        }
+        return nullptr;
+    }
+    void keep(const std::shared_ptr<AXDRpxClient>& client, uint64_t flags, uint64_t version, const MatchInputs& inputs,
+              std::shared_ptr<const MatchAnswer> answer) {
+        corvane::MutexLock lock(mutex_);
+        // Answers of hosts that went, and the oldest beyond the few kept, go.
+        std::erase_if(kept_, [&](const Kept& k) { return k.client.expired() || k.client.lock() == client; });
+        if (kept_.size() >= kMaxKept) kept_.pop_front();
+        kept_.push_back(Kept{client, flags, version, inputs, std::move(answer)});
+    }
+
+private:
+    static constexpr size_t kMaxKept = 4;
+    struct Kept {
+        std::weak_ptr<AXDRpxClient> client;
+        uint64_t flags;
+        uint64_t version;
+        MatchInputs inputs;
+        std::shared_ptr<const MatchAnswer> answer;
+    };
+    corvane::Mutex mutex_;
+    std::deque<Kept> kept_ GUARDED_BY(mutex_);
+};
+
+KeptAnswers& keptAnswers() {
+    static auto* answers = new KeptAnswers();  // for the process's life, as the server
+    return *answers;
+}
+
+}  // namespace
+
 std::optional<std::string> Transaction::matchRefusal(
     const AXDPlugIn& p, const Value& rules, uint64_t flags, const std::vector<Value>& exclusions,
-    const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds) {
+    const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds, std::vector<std::string>& logged) {
     using namespace discovery;
     if (!(flags & kAll)) {
         if (!p.onSystemVolume()) {
@@ -164,58 +251,40 @@ std::optional<std::string> Transaction::matchRefusal(
     }
     for (const Value& exclusion : exclusions) {
         if (!p.match(exclusion)) continue;
-        log::debug(logOps(), "client %d plugin %{public}@ globally excluded", client_->pid(), p.uuid());
+        logged.push_back(log::formatText("client %d plugin %@ globally excluded", client_->pid(), p.uuid()));
         return "excluded by the user: " + exclusion.description();
     }
     if (!(flags & kAll)) {
         if (auto reason = p.allowForClient(*client_)) {
-            log::debug(logOps(), "client %d cannot use plugin %{public}@: %{public}@", client_->pid(), p.uuid(),
-                       *reason);
+            logged.push_back(
+                log::formatText("client %d cannot use plugin %@: %@", client_->pid(), p.uuid(), *reason));
             return "not allowed: " + *reason;
         }
     }
     return std::nullopt;
 }
 
-void Transaction::matchPlugIns() {
-    using namespace discovery;
-    const Value& rulesEntry = request()[message::kRules];
-    if (!rulesEntry.isNull() && !rulesEntry.isDictionary()) {
-        failMessage(AXErrorCode::InvalidRequest, "invalid request format (bad rules dictionary)");
-        return;
-    }
-    Value rules = rulesEntry.isNull() ? Value() : convertMessageToValue(rulesEntry);
-    uint64_t flags = request()[message::kFlags].uint64Value().value_or(0);
-    if ((flags & kAll) && (!client_->hasEntitlement(keys::kManagerEntitlement) || corvane::sandbox::isSandboxed(client_->pid()))) {
-        failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (AXDiscoverAll)");
-        return;
-    }
-    // The explanation names plug-ins the host may not see: not for sandboxed callers.
-    bool explain = flags & kExplain;
-    if (explain && corvane::sandbox::isSandboxed(client_->pid())) {
-        failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (explain)");
-        return;
-    }
-    std::vector<Value> exclusions = server().userPrefs().exclusionPatterns();
+std::shared_ptr<const MatchAnswer> Transaction::walkForMatch(const Value& rules, uint64_t flags, bool explain,
+                                                          const MatchInputs& inputs) {
+    auto answer = std::make_shared<MatchAnswer>();
     // Explaining looks at every installed plug-in: the registry's query never drops one that the
     // rules would take, so what is returned is the same.
     std::vector<AXDPlugInPtr> candidates = server().findPlugIns(explain ? Value() : rules);
-    AXD_TRACE(discover__raw, static_cast<unsigned>(candidates.size()));
+    answer->raw = static_cast<unsigned>(candidates.size());
+    AXD_TRACE(discover__raw, answer->raw);
 
     std::map<const AXDPlugIn*, std::string> outcome;  // explain only
-    // The request sees the holds as they were when it began, as it sees one registry.
-    auto holds = server().currentHolds();
     Results results(candidates.size());
     std::unordered_map<std::string, ResultList::iterator> overrides;
     for (const auto& p : candidates) {
-        if (auto refusal = matchRefusal(*p, rules, flags, exclusions, holds)) {
+        if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, inputs.holds, answer->logged)) {
             if (explain) outcome[p.get()] = *refusal;
             continue;
         }
         auto encoded = p->encodedForm();
         if (!encoded) {
-            log::error(logOps(), "failed to export matching plug-in %{public}@: %{public}@", p->uuid()->string(),
-                       encoded.error());
+            answer->exportErrors.push_back(log::formatText("failed to export matching plug-in %@: %@",
+                                                           p->uuid()->string(), encoded.error()));
             if (explain) outcome[p.get()] = "cannot be exported: " + encoded.error().description();
             continue;
         }
@@ -238,9 +307,9 @@ void Transaction::matchPlugIns() {
         std::string overriddenUuid = chosen.plugIn->uuid()->string();
         chosen.overrider = overriderUuid;
         o->second->overriding = chosen.plugIn->identifier().value_or("");
-        log::info(logOps(), "plug-in %{public}@ overrides %{public}@", overriderUuid, overriddenUuid);
+        answer->overrides.emplace_back(overriderUuid, overriddenUuid);
     }
-    log::info(logOps(), "match returned %u plug-ins", static_cast<unsigned>(results.list().size()));
+    answer->returned = static_cast<unsigned>(results.list().size());
     // The annotations of the forms that stay, all in one visit to the database.
     std::vector<const AXDPlugIn*> chosenPlugIns;
     chosenPlugIns.reserve(results.list().size());
@@ -251,8 +320,7 @@ void Transaction::matchPlugIns() {
         Value& annotation = annotations[next++];
         chosen.annotations = annotation.isNull() ? Value(Dictionary{}) : std::move(annotation);
     }
-    // What the reply conversion gives for this request's version: nothing but at the current one.
-    if (version() == kCurrentProtocolVersion) reply()[message::kMatches] = encodeMatches(results.list());
+    if (version() == kCurrentProtocolVersion) answer->matches = encodeMatches(results.list());
     if (explain) {
         Array explanations;
         for (const auto& p : candidates) {
@@ -261,8 +329,47 @@ void Transaction::matchPlugIns() {
                                                   {"path", p->path()},
                                                   {"outcome", outcome[p.get()]}}));
         }
-        reply()["explanations"] = Value(std::move(explanations));
+        answer->explanations = Value(std::move(explanations));
     }
+    return answer;
+}
+
+void Transaction::matchPlugIns() {
+    using namespace discovery;
+    const Value& rulesEntry = request()[message::kRules];
+    if (!rulesEntry.isNull() && !rulesEntry.isDictionary()) {
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (bad rules dictionary)");
+        return;
+    }
+    Value rules = rulesEntry.isNull() ? Value() : convertMessageToValue(rulesEntry);
+    uint64_t flags = request()[message::kFlags].uint64Value().value_or(0);
+    if ((flags & kAll) && (!client_->hasEntitlement(keys::kManagerEntitlement) || corvane::sandbox::isSandboxed(client_->pid()))) {
+        failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (AXDiscoverAll)");
+        return;
+    }
+    // The explanation names plug-ins the host may not see: not for sandboxed callers.
+    bool explain = flags & kExplain;
+    if (explain && corvane::sandbox::isSandboxed(client_->pid())) {
+        failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (explain)");
+        return;
+    }
+    MatchInputs inputs = currentMatchInputs(server());
+    bool keepable = !explain && (rules.isNull() || (rules.asDictionary() && rules.asDictionary()->empty()));
+    auto answer = keepable ? keptAnswers().find(client_, flags, version(), inputs) : nullptr;
+    if (!answer) {
+        answer = walkForMatch(rules, flags, explain, inputs);
+        if (keepable) keptAnswers().keep(client_, flags, version(), inputs, answer);
+    } else {
+        AXD_TRACE(discover__raw, answer->raw);
+    }
+    for (const auto& line : answer->logged) log::debug(logOps(), "%{public}s", line);
+    for (const auto& line : answer->exportErrors) log::error(logOps(), "%{public}s", line);
+    for (const auto& [overrider, overridden] : answer->overrides)
+        log::info(logOps(), "plug-in %{public}@ overrides %{public}@", overrider, overridden);
+    log::info(logOps(), "match returned %u plug-ins", answer->returned);
+    // What the reply conversion gives for this request's version: nothing but at the current one.
+    if (version() == kCurrentProtocolVersion) reply()[message::kMatches] = answer->matches;
+    if (explain) reply()["explanations"] = answer->explanations;
     log::debug(logOps(), "reply marshalled");
     done();
 }

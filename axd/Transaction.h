@@ -17,6 +17,8 @@ namespace annexa {
 class AXDRpxClient;
 class AXDPlugInHold;
 class AXDServer;
+struct MatchAnswer;
+struct MatchInputs;
 
 // Lives on: the service queue, for the length of its handler.
 class Transaction {
@@ -69,9 +71,14 @@ public:
 private:
     // Why "match" leaves the plug-in out before export (visibility, the holds taken at the
     // request's start, rules, exclusions, authorization), or nothing.
+    // Refusals that the log shows (exclusions, authorization) add their line to `logged`.
     std::optional<std::string> matchRefusal(const AXDPlugIn& plugIn, const Value& rules, uint64_t flags,
                                             const std::vector<Value>& exclusions,
-                                            const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds);
+                                            const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds,
+                                            std::vector<std::string>& logged);
+    // The walk of "match" over the registry's candidates, with what the request read at its start.
+    std::shared_ptr<const MatchAnswer> walkForMatch(const Value& rules, uint64_t flags, bool explain,
+                                                    const MatchInputs& inputs);
 
     // The request's "annotations" dictionary as a Value; nullopt after answering that it is
     // missing or holds what the annotation file cannot keep.

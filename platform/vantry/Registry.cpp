@@ -55,6 +55,8 @@ Subscription Registry::subscribe(Observer& observer) { return store_->subscribe(
 
 void Registry::dropCaches() { store_->dropCaches(); }
 
+uint64_t Registry::contentVersion() { return store_->contentVersion(); }
+
 Result<std::vector<std::string>> Registry::rebuild(const std::string& path) {
     auto list = plist::readWholeFile(path + ".paths");
     std::string aside = path + ".damaged-" + std::to_string(Date::now().wholeSeconds());

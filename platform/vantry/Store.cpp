@@ -135,6 +135,7 @@ void Store::checkFreshness() {
 }
 
 void Store::forgetRecords() {
+    ++forgotten_;
     byUUID_.clear();
     apps_.clear();
     rows_.clear();
@@ -242,6 +243,12 @@ std::vector<ApplicationRecordPtr> Store::installedApplications() {
 void Store::dropCaches() {
     MutexLock lock(mutex_);
     forgetRecords();
+}
+
+uint64_t Store::contentVersion() {
+    MutexLock lock(mutex_);
+    checkFreshness();
+    return forgotten_;
 }
 
 // ---- registration

@@ -146,6 +146,8 @@ public:
     std::vector<std::string> registeredPaths() EXCLUDES(mutex_);
     std::vector<ApplicationRecordPtr> installedApplications() EXCLUDES(mutex_);
     void dropCaches() EXCLUDES(mutex_);
+    // Changes whenever records built earlier may no longer be what the database holds.
+    uint64_t contentVersion() EXCLUDES(mutex_);
 
     // Writes.
     Status registerBundle(const std::string& given, bool placeholder) EXCLUDES(mutex_);
@@ -201,6 +203,7 @@ private:
     sqlite3* db_ = nullptr;
     Mutex mutex_;
     int64_t seenDataVersion_ GUARDED_BY(mutex_) = -1;
+    uint64_t forgotten_ GUARDED_BY(mutex_) = 0;  // times the records were forgotten
     std::unordered_map<UUID, PlugInRecordPtr, UUIDHash> byUUID_ GUARDED_BY(mutex_);
     std::map<std::string, ApplicationRecordPtr> apps_ GUARDED_BY(mutex_);
     // Answers of queries by their SQL and arguments; a few hundred at most.

@@ -166,6 +166,9 @@ public:
     // ends; the observer must outlive the subscription.
     Subscription subscribe(Observer& observer);
     void dropCaches();
+    // A number that changes whenever the registry's contents may have changed (a commit by any
+    // writer, or dropCaches): while it stays, every query has the same answer.
+    uint64_t contentVersion();
 
     // Moves the database at `path` aside (damaged or not) and registers again every path that was
     // registered in it and can still be read. Returns the paths that could not be registered.

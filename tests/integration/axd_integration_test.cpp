@@ -556,6 +556,66 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("returned"), std::string::npos) << explained.out;
 }
 
+// A host that asks again on its connection gets its last answer again only while nothing it
+// depends on changed: after each change below, the same question sees the change.
+TEST(Axd, AnAnswerGivenAgainFollowsEveryChange) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto host = d.connect();
+    auto holder = d.connect();
+    auto match = [&] {
+        auto r = host->sendWithReplySync(request("match"));
+        EXPECT_TRUE(r.ok()) << r.description();
+        std::vector<std::string> out;
+        if (const Array* forms = r.value["matches"].asArray())
+            for (const Value& f : *forms) out.push_back(*f["identifier"].asString() + f["annotations"].description());
+        std::sort(out.begin(), out.end());
+        return out;
+    };
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    UUID one = (*registry)->plugInForPath(app + "/PlugIns/One.appex")->uuid();
+    std::string later = axtest::makeBundle(d.root.path(), "Later.app", axtest::appInfo("com.example.later"), "/bin/true");
+    axtest::makeBundle(later + "/PlugIns", "Three.appex", axtest::plugInInfo("com.example.three", dict({{"KSExtensionProtocol", "P"}})), "/bin/true");
+    auto setExclusions = [](Value list) {
+        ASSERT_TRUE(prefs::setValue("exclusions", std::move(list), "com.corvane.annexa.userprefs").ok());
+    };
+    using Ids = std::vector<std::string>;
+    struct Step {
+        const char* change;
+        std::function<void()> make;
+        Ids expected;
+    };
+    std::vector<Step> steps = {
+        {"nothing", [] {}, {"com.example.One{}", "com.example.Two{}"}},
+        {"nothing again", [] {}, {"com.example.One{}", "com.example.Two{}"}},
+        {"an election", [&] { ASSERT_EQ(d.axctl({"annotate", "--election", "1", one.string()}).status, 0); },
+         {"com.example.One{\"election\": 1}", "com.example.Two{}"}},
+        {"an exclusion", [&] { setExclusions(Value(Array{dict({{"KSExtensionIdentifier", "com.example.Two"}})})); },
+         {"com.example.One{\"election\": 1}"}},
+        {"no exclusions", [&] { setExclusions(Value(Array{})); },
+         {"com.example.One{\"election\": 1}", "com.example.Two{}"}},
+        {"a hold",
+         [&] {
+             auto r = holder->sendWithReplySync(
+                 request("lock", {{"paths", Value(Array{Value(app + "/PlugIns/Two.appex")})}, {"flags", uint64_t{2}}}));
+             ASSERT_TRUE(r.ok() && r.value["errorcode"].isNull()) << r.value.description();
+         },
+         {"com.example.One{\"election\": 1}"}},
+        {"the holder gone", [&] { holder.reset(); }, {"com.example.One{\"election\": 1}", "com.example.Two{}"}},
+        {"an installation", [&] { ASSERT_EQ(d.axctl({"add", later}).status, 0); },
+         {"com.example.One{\"election\": 1}", "com.example.Two{}", "com.example.three{}"}},
+        {"an uninstallation", [&] { ASSERT_TRUE((*registry)->unregisterBundle(app).ok()); }, {"com.example.three{}"}},
+    };
+    for (const auto& step : steps) {
+        step.make();
+        // Holds and registry events reach the daemon on their own threads: the answer follows soon.
+        Ids got;
+        EXPECT_TRUE(axtest::eventually([&] { return (got = match()) == step.expected; }))
+            << "after " << step.change << ": " << ::testing::PrintToString(got);
+    }
+}
+
 TEST(Axd, SendRoundTripsTheTextNotation) {
     Daemon d;
     auto sent = d.axctl({"send"}, "{ \"request\" : \"bulk\", \"version\": 3u }");
