@@ -157,6 +157,20 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
 
 constexpr uint32_t bit(Value::Kind k) { return 1u << static_cast<unsigned>(k); }
 
+// Most texts of a message (keys above all) are short and ASCII: checked here, eight bytes at a
+// time, without a call.
+inline bool isAscii(std::string_view s) {
+    uint64_t high = 0;
+    size_t i = 0;
+    for (; i + 8 <= s.size(); i += 8) {
+        uint64_t word;
+        std::memcpy(&word, s.data() + i, 8);
+        high |= word;
+    }
+    for (; i < s.size(); ++i) high |= static_cast<uint8_t>(s[i]);
+    return (high & 0x8080808080808080ull) == 0;
+}
+
 // Array elements and dictionary values of at least this many bytes in a large frame are decoded
 // when first looked at.
 constexpr size_t kLazyElementBytes = 512;
@@ -213,7 +227,7 @@ private:
         if (!n || !has(*n)) return std::nullopt;
         std::string_view s = s_.substr(pos_, *n);
         pos_ += *n;
-        if (!isValidUtf8(s)) return std::nullopt;
+        if (!isAscii(s) && !isValidUtf8(s)) return std::nullopt;
         return s;
     }
     std::optional<std::string> text() {
