@@ -168,15 +168,19 @@ struct MatchAnswer {
 
 namespace {
 
-MatchInputs currentMatchInputs(AXDServer& server) {
+// The versions are read only for an answer that may be kept: a request with rules never compares
+// them, and the registry's costs a look at its wake file.
+MatchInputs currentMatchInputs(AXDServer& server, bool keepable) {
     MatchInputs inputs;
-    // The versions first: a change after this point is seen by the next request.
-    inputs.registry = server.workspace().contentVersion();
-    inputs.annotations = AXDAnnotationStore::changeCount();
-    inputs.forms = AXDPlugIn::formsDropped();
+    if (keepable) {
+        // The versions first: a change after this point is seen by the next request.
+        inputs.registry = server.workspace().contentVersion();
+        inputs.annotations = AXDAnnotationStore::changeCount();
+        inputs.forms = AXDPlugIn::formsDropped();
+        inputs.types = corvane::types::database();
+    }
     inputs.exclusions = server.userPrefs().exclusionPatterns();
     inputs.holds = server.currentHolds();
-    inputs.types = corvane::types::database();
     return inputs;
 }
 
@@ -353,8 +357,8 @@ void Transaction::matchPlugIns() {
         failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (explain)");
         return;
     }
-    MatchInputs inputs = currentMatchInputs(server());
     bool keepable = !explain && (rules.isNull() || (rules.asDictionary() && rules.asDictionary()->empty()));
+    MatchInputs inputs = currentMatchInputs(server(), keepable);
     auto answer = keepable ? keptAnswers().find(client_, flags, version(), inputs) : nullptr;
     if (!answer) {
         answer = walkForMatch(rules, flags, explain, inputs);
