@@ -54,12 +54,17 @@ void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
     }
     (void)identity();
     auto transaction = std::make_shared<Transaction>(event, shared_from_this());
-    server_->submitWork([transaction] {
+    auto work = [transaction] {
         AXDRpxClient& client = *transaction->client();
         uint32_t count = client.countRequest();
         if (count % 1000 == 0) log::debug(logOps(), "client %d used %u requests so far", client.pid(), count);
         transaction->dispatch();
-    });
+    };
+    if (transaction->onlyReads()) {
+        server_->submitReadingWork(work);
+    } else {
+        server_->submitWork(std::move(work));
+    }
 }
 
 int AXDRpxClient::pid() const { return connection_.expired() ? 0 : pid_; }

@@ -80,6 +80,10 @@ void AXDServer::run() {
 
 void AXDServer::submitWork(std::function<void()> work) { mainQueue_->async(std::move(work)); }
 
+void AXDServer::submitReadingWork(const std::function<void()>& work) {
+    if (!mainQueue_->runIfIdle(work)) mainQueue_->async(work);
+}
+
 void AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
     Value event = corvane::dict({{"event", "hold"}, {"token", hold->uuid()}, {"plugins", hold->plugIns()}});
     syncQueue_->sync([&] {

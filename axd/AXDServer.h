@@ -53,6 +53,10 @@ public:
     // Resumes the listener and serves for the life of the process.
     [[noreturn]] void run();
     void submitWork(std::function<void()> work);
+    // For work that only reads what the daemon keeps in memory and waits on no other process: it
+    // runs at once on the calling thread (the listener's I/O thread) when the service queue is
+    // idle, saving the hand-over to the queue's thread, and is queued otherwise.
+    void submitReadingWork(const std::function<void()>& work);
 
     void addHold(std::shared_ptr<AXDPlugInHold> hold);
     void unholdToken(const UUID& token);

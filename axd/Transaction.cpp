@@ -81,6 +81,11 @@ void Transaction::dispatch() {
     failMessage(AXErrorCode::InvalidRequest, "unrecognized request");
 }
 
+bool Transaction::onlyReads() const {
+    const std::string* name = request()[message::kRequest].asString();
+    return name && *name == request::kMatch;
+}
+
 void Transaction::done() {
     if (answered_) return;
     answered_ = true;

@@ -33,6 +33,9 @@ public:
     Transaction& operator=(const Transaction&) = delete;
 
     void dispatch();
+    // A request that reads what the daemon keeps and waits on no other process ("match"), so that
+    // it may run wherever the service queue's one running task may.
+    bool onlyReads() const;
     // Saves the annotations the request changed, then sends the reply (dropped when the connection
     // is gone or no reply is expected): what a reply acknowledges is on disk, at one write per
     // request.

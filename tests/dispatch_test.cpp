@@ -2,6 +2,8 @@
 #include <pthread.h>
 
 #include <atomic>
+#include <mutex>
+#include <thread>
 #include <vector>
 
 #include "platform/dispatch/Dispatch.h"
@@ -41,6 +43,36 @@ TEST(Dispatch, IsCurrentOnlyOnTheQueue) {
     EXPECT_TRUE(onA);
     EXPECT_FALSE(bFromA);
     EXPECT_EQ(a->syncResult([] { return 42; }), 42);
+}
+
+TEST(Dispatch, RunIfIdleRunsHereOnlyOnAnIdleQueue) {
+    auto q = Queue::create("service");
+    std::thread::id ranOn;
+    bool current = false;
+    EXPECT_TRUE(q->runIfIdle([&] {
+        ranOn = std::this_thread::get_id();
+        current = q->isCurrent();
+    }));
+    EXPECT_EQ(ranOn, std::this_thread::get_id());
+    EXPECT_TRUE(current);
+
+    // Busy: a task is running on the queue's thread; nothing runs here, and the queue stays one
+    // task at a time.
+    std::mutex gate;
+    std::unique_lock<std::mutex> held(gate);
+    std::atomic<bool> started{false};
+    q->async([&] {
+        started = true;
+        std::lock_guard<std::mutex> wait(gate);
+    });
+    while (!started) std::this_thread::yield();
+    bool ran = false;
+    EXPECT_FALSE(q->runIfIdle([&] { ran = true; }));
+    EXPECT_FALSE(ran);
+    // Inside a task of its own the queue is busy too.
+    held.unlock();
+    q->sync([&] { EXPECT_FALSE(q->runIfIdle([&] { ran = true; })); });
+    EXPECT_FALSE(ran);
 }
 
 TEST(DispatchDeathTest, SyncOntoTheCurrentQueueAborts) {

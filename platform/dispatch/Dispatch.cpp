@@ -184,6 +184,10 @@ void Queue::sync(const std::function<void()>& task) {
     while (!done.done) done.cv.wait(lock);
 }
 
+bool Queue::runIfIdle(const std::function<void()>& task) {
+    return runHereIfIdle(*state_, task);
+}
+
 bool Queue::isCurrent() const {
     return std::find(tCurrent.begin(), tCurrent.end(), state_.get()) != tCurrent.end();
 }

@@ -48,6 +48,10 @@ public:
     void async(std::function<void()> task);
     // Runs the task on the queue and waits until it has run.
     void sync(const std::function<void()>& task);
+    // Runs the task at once on the caller's thread, as the queue's one running task, when the queue
+    // is idle (nothing running, nothing waiting); false, and nothing run, otherwise. For a caller
+    // that would rather run a short task itself than wake the queue's thread for it.
+    bool runIfIdle(const std::function<void()>& task);
     // Runs `fn` on the queue and returns its result.
     template <class F>
     auto syncResult(F&& fn) -> std::invoke_result_t<F> {
