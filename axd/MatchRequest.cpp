@@ -168,33 +168,34 @@ struct MatchAnswer {
 
 namespace {
 
-// The versions are read only for an answer that may be kept: a request with rules never compares
-// them, and the registry's costs a look at its wake file.
-MatchInputs currentMatchInputs(AXDServer& server, bool keepable) {
+MatchInputs currentMatchInputs(AXDServer& server) {
     MatchInputs inputs;
-    if (keepable) {
-        // The versions first: a change after this point is seen by the next request.
-        inputs.registry = server.workspace().contentVersion();
-        inputs.annotations = AXDAnnotationStore::changeCount();
-        inputs.forms = AXDPlugIn::formsDropped();
-        inputs.types = corvane::types::database();
-    }
+    // The versions first: a change after this point is seen by the next request.
+    inputs.registry = server.workspace().contentVersion();
+    inputs.annotations = AXDAnnotationStore::changeCount();
+    inputs.forms = AXDPlugIn::formsDropped();
+    inputs.types = corvane::types::database();
     inputs.exclusions = server.userPrefs().exclusionPatterns();
     inputs.holds = server.currentHolds();
     return inputs;
 }
 
-// The last answers to "match" without rules, for the few hosts that asked last. While nothing the
-// answer depends on changed, a host that lists every plug-in again gets the same answer without a
-// walk over every plug-in. A host connection is one identity (its entitlements and bundle do not
-// change), so the key is the connection itself.
+// The last answers to "match", for the few requests asked last. While nothing an answer depends on
+// changed, a host that asks the same again (the same rules and flags) gets the same answer without
+// a walk. A host connection is one identity (its entitlements and bundle do not change), so the
+// key is the connection itself.
 class KeptAnswers {
 public:
-    std::shared_ptr<const MatchAnswer> find(const std::shared_ptr<AXDRpxClient>& client, uint64_t flags, uint64_t version,
-                                            const MatchInputs& inputs) {
+    struct Key {
+        std::weak_ptr<AXDRpxClient> client;
+        Value rules;  // null for none
+        uint64_t flags;
+        uint64_t version;
+    };
+    std::shared_ptr<const MatchAnswer> find(const Key& key, const MatchInputs& inputs) {
         corvane::MutexLock lock(mutex_);
         for (auto it = kept_.begin(); it != kept_.end(); ++it) {
-            if (it->client.lock() != client || it->flags != flags || it->version != version) continue;
+            if (!sameKey(it->key, key)) continue;
             if (!(it->inputs == inputs)) {
                 kept_.erase(it);
                 return nullptr;
@@ -203,24 +204,34 @@ public:
         }
         return nullptr;
     }
-    void keep(const std::shared_ptr<AXDRpxClient>& client, uint64_t flags, uint64_t version, const MatchInputs& inputs,
-              std::shared_ptr<const MatchAnswer> answer) {
+    void keep(Key key, const MatchInputs& inputs, std::shared_ptr<const MatchAnswer> answer) {
         corvane::MutexLock lock(mutex_);
         // Answers of hosts that went, and the oldest beyond the few kept, go.
-        std::erase_if(kept_, [&](const Kept& k) { return k.client.expired() || k.client.lock() == client; });
-        if (kept_.size() >= kMaxKept) kept_.pop_front();
-        kept_.push_back(Kept{client, flags, version, inputs, std::move(answer)});
+        std::erase_if(kept_, [&](const Kept& k) { return k.key.client.expired() || sameKey(k.key, key); });
+        size_t forms = answer->returned;
+        for (const Kept& k : kept_) forms += k.answer->returned;
+        while (!kept_.empty() && (kept_.size() >= kMaxKept || forms > kMaxKeptForms)) {
+            forms -= kept_.front().answer->returned;
+            kept_.pop_front();
+        }
+        kept_.push_back(Kept{std::move(key), inputs, std::move(answer)});
     }
 
 private:
-    static constexpr size_t kMaxKept = 4;
+    // An answer of every plug-in holds about 100 bytes of its own per form (the rest refers to the
+    // forms their plug-ins keep): a few of those, or many short answers.
+    static constexpr size_t kMaxKept = 16;
+    static constexpr size_t kMaxKeptForms = 25000;
     struct Kept {
-        std::weak_ptr<AXDRpxClient> client;
-        uint64_t flags;
-        uint64_t version;
+        Key key;
         MatchInputs inputs;
         std::shared_ptr<const MatchAnswer> answer;
     };
+    static bool sameKey(const Key& a, const Key& b) {
+        // The same connection, without taking a reference to it.
+        bool sameClient = !a.client.owner_before(b.client) && !b.client.owner_before(a.client);
+        return a.flags == b.flags && a.version == b.version && sameClient && a.rules == b.rules;
+    }
     corvane::Mutex mutex_;
     std::deque<Kept> kept_ GUARDED_BY(mutex_);
 };
@@ -357,12 +368,15 @@ void Transaction::matchPlugIns() {
         failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (explain)");
         return;
     }
-    bool keepable = !explain && (rules.isNull() || (rules.asDictionary() && rules.asDictionary()->empty()));
-    MatchInputs inputs = currentMatchInputs(server(), keepable);
-    auto answer = keepable ? keptAnswers().find(client_, flags, version(), inputs) : nullptr;
+    MatchInputs inputs = currentMatchInputs(server());
+    // Empty rules are no rules.
+    if (const Dictionary* tests = rules.asDictionary(); tests && tests->empty()) rules = Value();
+    // An explanation is not kept: it is asked rarely, and it is as long as the registry.
+    KeptAnswers::Key key{client_, rules, flags, version()};
+    auto answer = explain ? nullptr : keptAnswers().find(key, inputs);
     if (!answer) {
         answer = walkForMatch(rules, flags, explain, inputs);
-        if (keepable) keptAnswers().keep(client_, flags, version(), inputs, answer);
+        if (!explain) keptAnswers().keep(std::move(key), inputs, answer);
     } else {
         AXD_TRACE(discover__raw, answer->raw);
     }
