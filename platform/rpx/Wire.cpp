@@ -4,6 +4,8 @@
 #include <cstdint>
 #include <cstring>
 
+#include <endian.h>
+
 namespace corvane::rpx::wire {
 
 namespace {
@@ -238,52 +240,84 @@ private:
 
     // Walks one value as value() would decode it, checking the same things, without building it.
     std::optional<Shape> skip(size_t depth) {
+        const char* p = s_.data() + pos_;
+        Shape shape;
+        bool ok = skipAt(p, s_.data() + s_.size(), depth, shape.nesting, shape.kinds);
+        pos_ = static_cast<size_t>(p - s_.data());
+        if (!ok) return std::nullopt;
+        return shape;
+    }
+
+    static uint32_t load32(const char* p) {
+        uint32_t v;
+        std::memcpy(&v, p, 4);
+        return le32toh(v);
+    }
+
+    static bool skipText(const char*& p, const char* end) {
+        if (end - p < 4) return false;
+        uint32_t n = load32(p);
+        p += 4;
+        if (static_cast<size_t>(end - p) < n) return false;
+        std::string_view s(p, n);
+        p += n;
+        return isAscii(s) || isValidUtf8(s);
+    }
+
+    // The walk itself, on a cursor: `nesting` is the value's, `kinds` gathers the kinds in it.
+    // Every walked byte of a large reply passes here, so it is kept to a few instructions per
+    // element.
+    bool skipAt(const char*& p, const char* end, size_t depth, size_t& nesting, uint32_t& kinds) const {
         using K = Value::Kind;
-        if (depth > maxDepth_ || !has(1)) return std::nullopt;
-        auto tag = static_cast<uint8_t>(s_[pos_++]);
-        auto fixed = [&](K kind, size_t bytes) -> std::optional<Shape> {
-            if (!has(bytes)) return std::nullopt;
-            pos_ += bytes;
-            return Shape{0, bit(kind)};
+        if (depth > maxDepth_ || p == end) return false;
+        auto tag = static_cast<uint8_t>(*p++);
+        auto fixed = [&](K kind, size_t bytes) {
+            if (static_cast<size_t>(end - p) < bytes) return false;
+            p += bytes;
+            kinds |= bit(kind);
+            return true;
         };
+        nesting = 0;
         switch (tag) {
-            case kNull: return Shape{0, bit(K::Null)};
+            case kNull: kinds |= bit(K::Null); return true;
             case kFalse:
-            case kTrue: return Shape{0, bit(K::Bool)};
+            case kTrue: kinds |= bit(K::Bool); return true;
             case kInt64: return fixed(K::Int64, 8);
             case kUInt64: return fixed(K::UInt64, 8);
             case kDouble: return fixed(K::Double, 8);
             case kDate: return fixed(K::Date, 8);
             case kUUID: return fixed(K::UUID, 16);
             case kString:
-                if (!textView()) return std::nullopt;
-                return Shape{0, bit(K::String)};
-            case kData: {
-                auto n = take(4);
-                if (!n) return std::nullopt;
-                return fixed(K::Data, *n);
-            }
+                kinds |= bit(K::String);
+                return skipText(p, end);
+            case kData:
+                if (end - p < 4) return false;
+                p += 4;
+                return fixed(K::Data, load32(p - 4));
             case kArray:
             case kDictionary: {
                 bool isArray = tag == kArray;
-                auto n = take(4);
-                if (!n || !has(*n * (isArray ? 1 : 5))) return std::nullopt;
-                Shape shape{0, bit(isArray ? K::Array : K::Dictionary)};
-                for (uint64_t i = 0; i < *n; ++i) {
-                    if (!isArray && !textView()) return std::nullopt;
-                    auto e = skip(depth + 1);
-                    if (!e) return std::nullopt;
-                    shape.nesting = std::max(shape.nesting, e->nesting + 1);
-                    shape.kinds |= e->kinds;
+                if (end - p < 4) return false;
+                uint64_t n = load32(p);
+                p += 4;
+                if (static_cast<uint64_t>(end - p) < n * (isArray ? 1 : 5)) return false;
+                kinds |= bit(isArray ? K::Array : K::Dictionary);
+                for (uint64_t i = 0; i < n; ++i) {
+                    if (!isArray && !skipText(p, end)) return false;
+                    size_t inner = 0;
+                    if (!skipAt(p, end, depth + 1, inner, kinds)) return false;
+                    nesting = std::max(nesting, inner + 1);
                 }
-                return shape;
+                return true;
             }
             case kFd: {
-                auto index = take(4);
-                if (!index || *index >= fds_.size()) return std::nullopt;
-                return Shape{0, bit(K::Fd)};
+                if (end - p < 4) return false;
+                uint32_t index = load32(p);
+                p += 4;
+                kinds |= bit(K::Fd);
+                return index < fds_.size();
             }
-            default: return std::nullopt;
+            default: return false;
         }
     }
 
