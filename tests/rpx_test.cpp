@@ -294,6 +294,24 @@ TEST(RpxWire, LargeFramesDecodeTheirElementsOnFirstLookWithTheSameResult) {
         wire::Frame bad;
         EXPECT_EQ(r.next(bad, error), wire::FrameReader::Status::Error) << c.name;
     }
+
+    // A text at the deepest level allowed is taken inside a kept element; one level deeper, the
+    // frame is refused, as when decoded at once.
+    for (size_t leafDepth : {rpx::kMaxDepth, rpx::kMaxDepth + 1}) {
+        Value nested(std::string(600, 'l'));
+        for (size_t i = 1; i < leafDepth; ++i) nested = Value(Array{nested});
+        std::vector<int> fds;
+        auto deep = wire::encodeFrame(
+            wire::Frame{wire::FrameKind::Reply, 8, dict({{"m", nested}, {"pad", std::string(5000, 'p')}})}, fds,
+            rpx::kMaxDepth + 1);
+        ASSERT_TRUE(deep);
+        wire::FrameReader r(4 << 20, rpx::kMaxDepth);
+        r.append(deep->data(), deep->size());
+        wire::Frame deepFrame;
+        EXPECT_EQ(r.next(deepFrame, error), leafDepth <= rpx::kMaxDepth ? wire::FrameReader::Status::Frame
+                                                                  : wire::FrameReader::Status::Error)
+            << leafDepth;
+    }
 }
 
 // Encodings put together from parts (as the daemon sends its plug-in forms) decode to the value

@@ -89,6 +89,7 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
         if (splicer && encodedSize(*e) >= kReferBytes) {
             splicer->refer(out, *e);
         } else if (e->pieces) {
+            out.reserve(out.size() + e->pieces->size);
             for (std::string_view piece : e->pieces->bytes) out.append(piece);
         } else {
             out.append(e->bytes);
@@ -304,6 +305,14 @@ private:
                 kinds |= bit(isArray ? K::Array : K::Dictionary);
                 for (uint64_t i = 0; i < n; ++i) {
                     if (!isArray && !skipText(p, end)) return false;
+                    // Texts, the most common elements, without a call of their own.
+                    if (depth < maxDepth_ && p != end && static_cast<uint8_t>(*p) == kString) {
+                        ++p;
+                        if (!skipText(p, end)) return false;
+                        kinds |= bit(K::String);
+                        nesting = std::max<size_t>(nesting, 1);
+                        continue;
+                    }
                     size_t inner = 0;
                     if (!skipAt(p, end, depth + 1, inner, kinds)) return false;
                     nesting = std::max(nesting, inner + 1);
