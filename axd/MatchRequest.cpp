@@ -4,6 +4,7 @@
 // own, the reply also says for every installed plug-in the step that left it out.
 #include <algorithm>
 #include <deque>
+#include <malloc.h>
 #include <list>
 #include <map>
 #include <unordered_map>
@@ -142,6 +143,9 @@ Value encodeMatches(const ResultList& list) {
 }
 
 }  // namespace
+
+// A walk over at least this many candidates gives the freed memory back to the system.
+constexpr size_t kTrimAfterCandidates = 1000;
 
 // What a "match" depends on besides the host, its rules and its flags. The request reads them once,
 // at its start, and its walk uses what it read.
@@ -376,6 +380,9 @@ void Transaction::matchPlugIns() {
     auto answer = explain ? nullptr : keptAnswers().find(key, inputs);
     if (!answer) {
         answer = walkForMatch(rules, flags, explain, inputs);
+        // A walk over many plug-ins leaves megabytes of freed lists and maps in the heap, spread
+        // between what stays; they go back to the system (about half a millisecond at 10,000).
+        if (answer->raw >= kTrimAfterCandidates) malloc_trim(0);
         if (!explain) keptAnswers().keep(std::move(key), inputs, answer);
     } else {
         AXD_TRACE(discover__raw, answer->raw);
