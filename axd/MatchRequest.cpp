@@ -375,15 +375,18 @@ void Transaction::matchPlugIns() {
     MatchInputs inputs = currentMatchInputs(server());
     // Empty rules are no rules.
     if (const Dictionary* tests = rules.asDictionary(); tests && tests->empty()) rules = Value();
-    // An explanation is not kept: it is asked rarely, and it is as long as the registry.
+    // An explanation is not kept: it is asked rarely, and it is as long as the registry. Nor is
+    // the answer to rules that came encoded (at least half a kilobyte in a large frame): its key
+    // would keep the whole request's bytes.
+    bool keepable = !explain && !rulesEntry.encoding();
     KeptAnswers::Key key{client_, rules, flags, version()};
-    auto answer = explain ? nullptr : keptAnswers().find(key, inputs);
+    auto answer = keepable ? keptAnswers().find(key, inputs) : nullptr;
     if (!answer) {
         answer = walkForMatch(rules, flags, explain, inputs);
         // A walk over many plug-ins leaves megabytes of freed lists and maps in the heap, spread
         // between what stays; they go back to the system (about half a millisecond at 10,000).
         if (answer->raw >= kTrimAfterCandidates) malloc_trim(0);
-        if (!explain) keptAnswers().keep(std::move(key), inputs, answer);
+        if (keepable) keptAnswers().keep(std::move(key), inputs, answer);
     } else {
         AXD_TRACE(discover__raw, answer->raw);
     }
