@@ -52,8 +52,9 @@ std::shared_ptr<AXDServer> AXDServer::initForService(const std::string& serviceN
         return nullptr;
     }
     server->service_ = *listener;
-    // A client's handler only wraps each request and hands it to the service queue, so it runs on
-    // the I/O thread rather than costing a further thread hand-over per request.
+    // A client's handler wraps each request and hands it to the service queue (or, for a request
+    // that only reads, runs it when the queue is idle), so it runs on the I/O thread rather than
+    // costing a further thread hand-over per request.
     server->service_->setInlineDelivery(true);
     gServer = server;
     server->setDelegate(server.get());
