@@ -80,6 +80,12 @@ private:
 
 size_t encodedSize(const Value::Encoding& e) { return e.pieces ? e.pieces->size : e.bytes.size(); }
 
+// Appends pieces of `size` bytes in all, in one allocation.
+void appendPieces(std::string& out, const std::vector<std::string_view>& pieces, size_t size) {
+    out.reserve(out.size() + size);
+    for (std::string_view piece : pieces) out.append(piece);
+}
+
 bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t depth, size_t maxDepth,
             Splicer* splicer = nullptr) {
     if (depth > maxDepth) return false;
@@ -89,8 +95,7 @@ bool encode(std::string& out, const Value& v, std::vector<int>& fds, size_t dept
         if (splicer && encodedSize(*e) >= kReferBytes) {
             splicer->refer(out, *e);
         } else if (e->pieces) {
-            out.reserve(out.size() + e->pieces->size);
-            for (std::string_view piece : e->pieces->bytes) out.append(piece);
+            appendPieces(out, e->pieces->bytes, e->pieces->size);
         } else {
             out.append(e->bytes);
         }
@@ -226,12 +231,11 @@ private:
         return v;
     }
     std::optional<std::string_view> textView() {
-        auto n = take(4);
-        if (!n || !has(*n)) return std::nullopt;
-        std::string_view s = s_.substr(pos_, *n);
-        pos_ += *n;
-        if (!isAscii(s) && !isValidUtf8(s)) return std::nullopt;
-        return s;
+        const char* start = s_.data() + pos_;
+        const char* p = start;
+        if (!skipText(p, s_.data() + s_.size())) return std::nullopt;
+        pos_ += static_cast<size_t>(p - start);
+        return std::string_view(start + 4, static_cast<size_t>(p - start) - 4);
     }
     std::optional<std::string> text() {
         auto s = textView();
@@ -447,8 +451,7 @@ Value decodeValidated(const Value::Encoding& encoding) {
 // An encoding in pieces is decoded from its pieces joined.
 Value decodeJoined(const Value::Encoding& encoding) {
     std::string joined;
-    joined.reserve(encoding.pieces->size);
-    for (std::string_view piece : encoding.pieces->bytes) joined.append(piece);
+    appendPieces(joined, encoding.pieces->bytes, encoding.pieces->size);
     auto v = Decoder(joined, kNoFds, SIZE_MAX).all();
     return v ? std::move(*v) : Value();
 }
@@ -544,8 +547,7 @@ std::optional<FrameBytes> encodeFramePieces(const Frame& frame, std::vector<int>
 
 std::string FrameBytes::joined() const {
     std::string out;
-    out.reserve(size);
-    for (std::string_view piece : pieces) out.append(piece);
+    appendPieces(out, pieces, size);
     return out;
 }
 
