@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cinttypes>
 #include <cmath>
@@ -177,23 +178,89 @@ Result<Value> parse(std::string_view bytes) {
     return std::move(*v);
 }
 
+// ---- the file system
+
+int FileSystem::openFile(const std::string& path, int flags, mode_t mode, int& fd) {
+    fd = ::open(path.c_str(), flags | O_CLOEXEC, mode);
+    return fd < 0 ? errno : 0;
+}
+
+int FileSystem::writeSome(int fd, const char* data, size_t size, size_t& written) {
+    for (;;) {
+        ssize_t n = ::write(fd, data, size);
+        if (n >= 0) {
+            written = static_cast<size_t>(n);
+            return 0;
+        }
+        if (errno != EINTR) return errno;
+    }
+}
+
+int FileSystem::readSome(int fd, char* data, size_t size, size_t& got) {
+    for (;;) {
+        ssize_t n = ::read(fd, data, size);
+        if (n >= 0) {
+            got = static_cast<size_t>(n);
+            return 0;
+        }
+        if (errno != EINTR) return errno;
+    }
+}
+
+int FileSystem::syncFile(int fd) { return ::fsync(fd) == 0 ? 0 : errno; }
+
+int FileSystem::closeFile(int fd) { return ::close(fd) == 0 ? 0 : errno; }
+
+int FileSystem::linkOpenFile(int fd, const std::string& path) {
+    std::string self = "/proc/self/fd/" + std::to_string(fd);
+    return ::linkat(AT_FDCWD, self.c_str(), AT_FDCWD, path.c_str(), AT_SYMLINK_FOLLOW) == 0 ? 0 : errno;
+}
+
+int FileSystem::linkFile(const std::string& from, const std::string& to) {
+    return ::link(from.c_str(), to.c_str()) == 0 ? 0 : errno;
+}
+
+int FileSystem::renameFile(const std::string& from, const std::string& to) {
+    return ::rename(from.c_str(), to.c_str()) == 0 ? 0 : errno;
+}
+
+int FileSystem::removeFile(const std::string& path) { return ::unlink(path.c_str()) == 0 ? 0 : errno; }
+
+int FileSystem::syncDirectory(const std::string& path) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (fd < 0) return errno;
+    int err = ::fsync(fd) == 0 ? 0 : errno;
+    ::close(fd);
+    return err;
+}
+
+namespace {
+
+FileSystem gRealFileSystem;
+std::atomic<FileSystem*> gFileSystem{&gRealFileSystem};
+
+}  // namespace
+
+FileSystem& fileSystem() { return *gFileSystem.load(); }
+
+void setFileSystem(FileSystem* replacement) { gFileSystem.store(replacement ? replacement : &gRealFileSystem); }
+
 Result<std::string> readWholeFile(const std::string& path) {
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return Error::file(errno, path, false);
+    FileSystem& fs = fileSystem();
+    int fd = -1;
+    if (int err = fs.openFile(path, O_RDONLY, 0, fd)) return Error::file(err, path, false);
     std::string out;
     char buf[65536];
     for (;;) {
-        ssize_t n = ::read(fd, buf, sizeof buf);
-        if (n < 0) {
-            if (errno == EINTR) continue;
-            int err = errno;
-            ::close(fd);
+        size_t got = 0;
+        if (int err = fs.readSome(fd, buf, sizeof buf, got)) {
+            fs.closeFile(fd);
             return Error::file(err, path, false);
         }
-        if (n == 0) break;
-        out.append(buf, static_cast<size_t>(n));
+        if (got == 0) break;
+        out.append(buf, got);
     }
-    ::close(fd);
+    fs.closeFile(fd);
     return out;
 }
 
@@ -220,62 +287,89 @@ std::string baseOf(const std::string& path) {
 
 }  // namespace
 
+namespace {
+
+// The temporary names of one write beside `path`: ".<name>.<pid>-<write>.<suffix>", which
+// removeStaleTemporaries clears; writes of the same file by two threads use names of their own.
+std::string besideTarget(const std::string& dir, const std::string& base, uint64_t write, const char* suffix) {
+    return dir + "/." + base + "." + std::to_string(::getpid()) + "-" + std::to_string(write) + "." + suffix;
+}
+
+std::atomic<uint64_t> gWrites{0};
+
+// Writes all of `bytes` to `fd`; 0 or the errno.
+int writeAll(FileSystem& fs, int fd, std::string_view bytes) {
+    size_t done = 0;
+    while (done < bytes.size()) {
+        size_t written = 0;
+        if (int err = fs.writeSome(fd, bytes.data() + done, bytes.size() - done, written)) return err;
+        if (written == 0) return EIO;
+        done += written;
+    }
+    return 0;
+}
+
+}  // namespace
+
 Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+    FileSystem& fs = fileSystem();
     std::string dir = directoryOf(path);
     std::string base = baseOf(path);
+    uint64_t write = ++gWrites;
+    mode_t mask = umask(0);
+    umask(mask);
     // The new contents are written to an unnamed file, which gets a name only for the instant
     // between linking it in and renaming it over the old file: a process killed while writing
     // leaves nothing behind. File systems without unnamed files get a named temporary instead.
     std::string tmp;
-    int fd = ::open(dir.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, 0600);
-    bool unnamed = fd >= 0;
-    if (!unnamed) {
-        tmp = dir + "/." + base + ".XXXXXX";
-        fd = mkostemp(tmp.data(), O_CLOEXEC);
-        if (fd < 0) return Error::file(errno, path, true);
+    int fd = -1;
+    int err = fs.openFile(dir, O_TMPFILE | O_WRONLY, 0600, fd);
+    bool unnamed = err == 0;
+    if (err == EOPNOTSUPP || err == EISDIR) {
+        tmp = besideTarget(dir, base, write, "new");
+        (void)fs.removeFile(tmp);
+        err = fs.openFile(tmp, O_WRONLY | O_CREAT | O_EXCL, 0600, fd);
+        if (err) tmp.clear();
     }
-    auto failWith = [&](int err) {
-        ::close(fd);
-        if (!tmp.empty()) ::unlink(tmp.c_str());
-        return Error::file(err, path, true);
+    if (err) return Error::file(err, path, true);
+    auto failWith = [&](int e) {
+        if (fd >= 0) (void)fs.closeFile(fd);
+        if (!tmp.empty()) (void)fs.removeFile(tmp);
+        return Error::file(e, path, true);
     };
-    mode_t mask = umask(0);
-    umask(mask);
     if (fchmod(fd, mode & ~mask) != 0) return failWith(errno);
-    size_t done = 0;
-    while (done < bytes.size()) {
-        ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
-        if (n < 0) {
-            if (errno == EINTR) continue;
-            return failWith(errno);
-        }
-        done += static_cast<size_t>(n);
-    }
-    if (fsync(fd) != 0) return failWith(errno);
+    if ((err = writeAll(fs, fd, bytes)) || (err = fs.syncFile(fd))) return failWith(err);
     if (unnamed) {
-        tmp = dir + "/." + base + "." + std::to_string(::getpid()) + ".new";
-        ::unlink(tmp.c_str());
-        std::string self = "/proc/self/fd/" + std::to_string(fd);
-        if (::linkat(AT_FDCWD, self.c_str(), AT_FDCWD, tmp.c_str(), AT_SYMLINK_FOLLOW) != 0) {
-            tmp.clear();
-            return failWith(errno);
+        std::string name = besideTarget(dir, base, write, "new");
+        (void)fs.removeFile(name);
+        if ((err = fs.linkOpenFile(fd, name))) return failWith(err);
+        tmp = name;
+    }
+    err = fs.closeFile(fd);
+    fd = -1;
+    if (err) return failWith(err);
+    // The old file stays reachable until the directory holds the new name for good, so that a
+    // failed directory sync can put it back.
+    std::string old = besideTarget(dir, base, write, "old");
+    (void)fs.removeFile(old);
+    err = fs.linkFile(path, old);
+    bool hadOld = err == 0;
+    if (err && err != ENOENT) return failWith(err);
+    if ((err = fs.renameFile(tmp, path))) {
+        if (hadOld) (void)fs.removeFile(old);
+        return failWith(err);
+    }
+    tmp.clear();
+    if ((err = fs.syncDirectory(dir))) {
+        if (hadOld) {
+            (void)fs.renameFile(old, path);
+        } else {
+            (void)fs.removeFile(path);
         }
-    }
-    if (::close(fd) != 0) {
-        int err = errno;
-        ::unlink(tmp.c_str());
+        (void)fs.syncDirectory(dir);
         return Error::file(err, path, true);
     }
-    if (::rename(tmp.c_str(), path.c_str()) != 0) {
-        int err = errno;
-        ::unlink(tmp.c_str());
-        return Error::file(err, path, true);
-    }
-    int dfd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dfd >= 0) {
-        (void)fsync(dfd);  // the rename is done; a failed directory sync cannot be undone
-        ::close(dfd);
-    }
+    if (hadOld) (void)fs.removeFile(old);
     return {};
 }
 

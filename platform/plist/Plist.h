@@ -38,15 +38,42 @@ Result<Value> readFile(const std::string& path);
 // The XML form of a value.
 Result<std::string> toXML(const Value& value);
 
+// The file operations of the atomic writer and of the stores that keep their files with it (the
+// annotation store reads, writes and moves its file through them), in one small interface: a test
+// replaces it to make any step fail the way a full, failing or read-only disk would (ENOSPC, EIO,
+// EROFS, an fsync that fails). Each operation answers 0 or the errno of its failure.
+// Thread-safety: the real one is safe from any thread; setFileSystem is for tests, before the
+// operations it should affect.
+class FileSystem {
+public:
+    virtual ~FileSystem() = default;
+    virtual int openFile(const std::string& path, int flags, mode_t mode, int& fd);
+    virtual int writeSome(int fd, const char* data, size_t size, size_t& written);
+    virtual int readSome(int fd, char* data, size_t size, size_t& got);
+    virtual int syncFile(int fd);
+    virtual int closeFile(int fd);
+    // Gives the open unnamed file `fd` the name `path`.
+    virtual int linkOpenFile(int fd, const std::string& path);
+    virtual int linkFile(const std::string& from, const std::string& to);
+    virtual int renameFile(const std::string& from, const std::string& to);
+    virtual int removeFile(const std::string& path);
+    virtual int syncDirectory(const std::string& path);
+};
+// The file system the functions below use: the real one unless a test set another.
+FileSystem& fileSystem();
+// Null restores the real one. Not owned.
+void setFileSystem(FileSystem* replacement);
+
 // Reads a whole file.
 Result<std::string> readWholeFile(const std::string& path);
 
 // Replaces the file at `path` with `bytes` so that a reader sees the old contents or the new, never
 // a mix, also across a crash: an unnamed file in the target's directory is written in full,
-// fsynced, linked in as ".<name>.<pid>.new" and at once renamed over the target, and the directory
-// is fsynced. A failure leaves the old file as it was and no temporary file behind; a process killed
-// meanwhile leaves at most the linked name, for the instant between link and rename. The new file
-// gets `mode` (masked by the umask).
+// fsynced, linked in as ".<name>.<pid>-<n>.new" and at once renamed over the target, and the
+// directory is fsynced. A failure at any step, the directory's fsync included, leaves the old file as
+// it was (the old file is kept under ".<name>.<pid>-<n>.old" until the directory is synced, and put back when
+// that fails) and no temporary file behind; a process killed meanwhile leaves at most those names,
+// which removeStaleTemporaries clears. The new file gets `mode` (masked by the umask).
 Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666);
 
 // Removes what writes to `path` killed half-way may have left beside it (".<name>.*"); for the one
