@@ -3,6 +3,7 @@
 #include <cinttypes>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 
 #include "platform/containers/Containers.h"
 #include "platform/layout/Layout.h"
@@ -43,14 +44,27 @@ AXDAnnotationStore::AXDAnnotationStore(const char* path)
     if (loaded.ok()) return;
     const Error& error = loaded.error();
     if (!(error.domain == corvane::kFileErrorDomain && error.code == corvane::kFileNoSuchFile)) {
-        log::error(logOps(), "unable to load annotation database:%{public}@ error:%{public}@ (resetting)",
-                   annotationsURL_, error);
+        // The user's choices in a file we cannot read are not ours to destroy: the file is kept
+        // beside, for whoever can mend it, before the first save writes a new one.
+        std::string aside = annotationsURL_ + ".damaged-" + std::to_string(corvane::Date::now().wholeSeconds());
+        if (int err = corvane::plist::fileSystem().renameFile(annotationsURL_, aside)) {
+            log::error(logOps(),
+                       "unable to load annotation database:%{public}@ error:%{public}@ (resetting; it could not be "
+                       "kept aside: %{public}s)",
+                       annotationsURL_, error, std::strerror(err));
+        } else {
+            log::error(logOps(),
+                       "unable to load annotation database:%{public}@ error:%{public}@ (resetting; the damaged file "
+                       "is kept as %{public}@)",
+                       annotationsURL_, error, aside);
+        }
     }
     if (loadDb(corvane::layout::underRoot(kEarlierReleasesFile)).ok()) {
         log::info(logOps(), "migrating old annotations");
         if (Status saved = saveDb(); !saved.ok()) {
             log::error(logOps(), "unable to save migrated annotations to %{public}@ error:%{public}@",
                        annotationsURL_, saved.error());
+            markChanged();  // the next save tries again
         }
         return;
     }
@@ -63,15 +77,16 @@ Value AXDAnnotationStore::annotationForIdentifier(const std::string& key) const 
     return it == annotations_.end() ? Value() : it->second;
 }
 
-void AXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, const std::string& key) {
+Status AXDAnnotationStore::setAnnotationForIdentifier(const Value& annotation, const std::string& key) {
     changeAnnotationForIdentifier(annotation, key);
-    saveIfChanged();
+    return saveIfChanged();
 }
 
 void AXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, const std::string& key) {
     auto it = annotations_.find(key);
     if (annotation.isNull()) {
         if (it == annotations_.end()) return;
+        if (!changed_) saved_ = annotations_;
         annotations_.erase(it);
         changed_ = true;
         ++changes_;
@@ -84,19 +99,31 @@ void AXDAnnotationStore::changeAnnotationForIdentifier(const Value& annotation, 
     }
     // Setting what is already stored changes nothing, and costs no write of the file.
     if (current && merged == *current) return;
+    if (!changed_) saved_ = annotations_;
     annotations_.insert_or_assign(key, Value(std::move(merged)));
     changed_ = true;
     ++changes_;
 }
 
-void AXDAnnotationStore::saveIfChanged() {
-    if (!changed_) return;
-    if (Status saved = saveDb(); !saved.ok()) {
+void AXDAnnotationStore::markChanged() {
+    if (!changed_) saved_ = annotations_;
+    changed_ = true;
+    ++changes_;
+}
+
+Status AXDAnnotationStore::saveIfChanged() {
+    if (!changed_) return {};
+    changed_ = false;
+    Status saved = saveDb();
+    if (!saved.ok()) {
         log::error(logOps(), "unable to save annotations:%{public}@ error:%{public}@", annotationsURL_,
                    saved.error());
-        return;
+        // What is not on disk is not kept: the table goes back to what the file holds.
+        annotations_ = std::move(saved_);
+        ++changes_;
     }
-    changed_ = false;
+    saved_.clear();
+    return saved;
 }
 
 Status AXDAnnotationStore::loadDb(const std::string& path) {

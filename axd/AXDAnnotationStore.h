@@ -6,6 +6,8 @@
 // opens. Where it lives: the -d path when the daemon got one, else
 // <data container 10 "com.corvane.axd">/com.corvane.annexa/Annotations; a file of earlier
 // releases, <root>/var/db/Annexa-Annotations, is migrated when the primary file cannot be loaded.
+// A file that exists but cannot be loaded is moved aside as <file>.damaged-<seconds since 1970>
+// before the table starts empty. Every file operation goes through corvane::plist::fileSystem().
 #pragma once
 
 #include <atomic>
@@ -37,15 +39,16 @@ public:
     // The stored annotation dictionary for an annotation key, or null.
     Value annotationForIdentifier(const std::string& key) const;
     // Merges the entries of `annotation` into the key's annotation (each entry replaces the entry
-    // of the same key whole), or removes the key's annotation when `annotation` is null; then saves.
-    // A failed save is logged; the change stays in memory.
-    void setAnnotationForIdentifier(const Value& annotation, const std::string& key);
+    // of the same key whole), or removes the key's annotation when `annotation` is null; then saves
+    // (see saveIfChanged).
+    Status setAnnotationForIdentifier(const Value& annotation, const std::string& key);
     // The same change, in memory only: a request makes all its changes so and saves once, with
     // saveIfChanged().
     void changeAnnotationForIdentifier(const Value& annotation, const std::string& key);
-    // Saves when anything changed since the last save (a failed save is logged and tried again
-    // next time).
-    void saveIfChanged();
+    // Saves when anything changed since the last save. A failed save is logged and undoes every
+    // change since the last save that succeeded: the table in memory is always the one on disk,
+    // so nothing is kept that was not acknowledged.
+    Status saveIfChanged();
 
     // Plug-in forms of the two operations: the key is the plug-in's annotationKey().
     template <class PlugIn>
@@ -53,8 +56,8 @@ public:
         return annotationForIdentifier(plugIn.annotationKey());
     }
     template <class PlugIn>
-    void setAnnotationForPlugIn(const Value& annotation, const PlugIn& plugIn) {
-        setAnnotationForIdentifier(annotation, plugIn.annotationKey());
+    Status setAnnotationForPlugIn(const Value& annotation, const PlugIn& plugIn) {
+        return setAnnotationForIdentifier(annotation, plugIn.annotationKey());
     }
     template <class PlugIn>
     void changeAnnotationForPlugIn(const Value& annotation, const PlugIn& plugIn) {
@@ -75,8 +78,12 @@ public:
     static std::string containerURL();
 
 private:
+    // Something changed that the next save writes; the table as saved is kept until then.
+    void markChanged();
+
     std::string annotationsURL_;
     Dictionary annotations_;
+    Dictionary saved_;      // the table as the file holds it, while changes wait for a save
     bool changed_ = false;  // since the last save
     static inline std::atomic<uint64_t> changes_{0};
 };

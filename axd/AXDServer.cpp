@@ -90,6 +90,7 @@ void AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
     syncQueue_->sync([&] {
         syncQueue_->assertCurrent();
         holds_.push_back(std::move(hold));
+        ++holdsChanges_;
     });
     (void)corvane::notify::post(kAnnotationChangeNotification);
     watchers().publish(event);
@@ -112,6 +113,7 @@ void AXDServer::unholdToken(const UUID& token) {
             log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token);
             released = *it;
             holds_.erase(it);
+            ++holdsChanges_;
             (void)corvane::notify::post(kAnnotationChangeNotification);
             return;
         }
@@ -131,6 +133,7 @@ void AXDServer::unholdClient(const AXDRpxClient* client) {
                        client->pid());
             released.push_back(*it);
             holds_.erase(it);
+            ++holdsChanges_;
             (void)corvane::notify::post(kAnnotationChangeNotification);
         }
     });

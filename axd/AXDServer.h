@@ -2,6 +2,7 @@
 // connect, the queues all daemon work runs on, the list of plug-in holds and the preference domain.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <set>
 #include <vector>
@@ -66,6 +67,8 @@ public:
     // A hold's set of blocked plug-ins never changes.
     std::vector<std::shared_ptr<const AXDPlugInHold>> currentHolds();
     size_t holdCount();
+    // Changes whenever a hold is added or released.
+    uint64_t holdsChangeCount() const { return holdsChanges_.load(); }
 
     void removedPlugIns(const std::vector<corvane::vantry::PlugInRecordPtr>& records) override;
 
@@ -87,6 +90,7 @@ private:
     std::unique_ptr<AXDUserPrefs> userPrefs_;
     const corvane::dispatch::QueuePtr syncQueue_;
     std::vector<std::shared_ptr<AXDPlugInHold>> holds_ GUARDED_BY(*syncQueue_);
+    std::atomic<uint64_t> holdsChanges_{0};
 };
 
 }  // namespace annexa

@@ -1,5 +1,8 @@
 #include "axd/AXDatabase.h"
 
+#include <unicode/uchar.h>
+#include <unicode/utf8.h>
+
 #include <unordered_set>
 
 #include <cctype>
@@ -121,6 +124,15 @@ Status AXDatabase::removePlugIn(const std::string& path) {
 
 namespace {
 
+// Whether the first character (UTF-8) is a Unicode letter, mark or number: "«", "—" or a no-break
+// space are not, nor is a byte that begins no character.
+bool beginsWithLetterMarkOrDigit(const std::string& text) {
+    int32_t at = 0;
+    UChar32 c = U_SENTINEL;
+    U8_NEXT(reinterpret_cast<const uint8_t*>(text.data()), at, static_cast<int32_t>(std::min<size_t>(text.size(), 4)), c);
+    return c >= 0 && (U_GET_GC_MASK(c) & (U_GC_L_MASK | U_GC_M_MASK | U_GC_N_MASK)) != 0;
+}
+
 // The registry's answer as the log shows it.
 std::string recordsText(const std::vector<PlugInRecordPtr>& records) {
     std::string text = "(";
@@ -129,6 +141,16 @@ std::string recordsText(const std::vector<PlugInRecordPtr>& records) {
 }
 
 }  // namespace
+
+std::string AXDatabase::electionText(const Value& annotation, const Value& autoElect) {
+    const Value* stored = annotation.find(keys::kElection);
+    int64_t election = stored ? integerValueOf(*stored) : (autoElect.isNumber() && !autoElect.isFalse() ? 1 : 0);
+    return std::to_string(static_cast<uint64_t>(election) & 0xff);
+}
+
+std::string AXDatabase::electionText(const AXDPlugIn& plugIn) {
+    return electionText(annotationForPlugIn(plugIn), plugIn.valueForEntitlement(keys::kAutoElectEntitlement));
+}
 
 std::optional<std::set<std::string>> AXDatabase::electionFilter(const Value& entry) {
     std::vector<Value> elements;
@@ -143,10 +165,9 @@ std::optional<std::set<std::string>> AXDatabase::electionFilter(const Value& ent
     for (const Value& e : elements) {
         const std::string* text = e.asString();
         if (!text || text->empty()) return std::nullopt;
-        auto first = static_cast<unsigned char>((*text)[0]);
-        if (first == '=') {
+        if ((*text)[0] == '=') {
             allowed.insert(text->substr(1));
-        } else if (std::isalnum(first) || first >= 0x80) {  // a letter, mark or digit
+        } else if (beginsWithLetterMarkOrDigit(*text)) {
             allowed.insert(*text);
         } else {
             return std::nullopt;
@@ -173,11 +194,7 @@ std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
                 databaseQueue_->assertCurrent();
                 return annotations_->annotationForIdentifier(key);
             });
-            const Value* stored = annotation.find(keys::kElection);
-            const Value& autoElect = entitlements[keys::kAutoElectEntitlement];
-            int64_t election = stored ? integerValueOf(*stored) : (autoElect.isNumber() && !autoElect.isFalse() ? 1 : 0);
-            std::string text = std::to_string(static_cast<uint64_t>(election) & 0xff);
-            bool kept = allowed->count(text) > 0;
+            bool kept = allowed->count(electionText(annotation, entitlements[keys::kAutoElectEntitlement])) > 0;
             log::debug(logOps(), "vt filter %@ -> %d", key, static_cast<int>(kept));
             return kept;
         };
@@ -236,25 +253,32 @@ Value AXDatabase::annotationForPlugIn(const AXDPlugIn& plugIn) {
 void AXDatabase::setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn) {
     databaseQueue_->assertNotCurrent();
     bool watched = !watchers_.empty();
-    Value before, after;
     databaseQueue_->sync([&] {
         databaseQueue_->assertCurrent();
-        if (watched) before = annotations_->annotationForPlugIn(plugIn);
+        Value before = watched ? annotations_->annotationForPlugIn(plugIn) : Value();
         annotations_->changeAnnotationForPlugIn(annotation, plugIn);
-        if (watched) after = annotations_->annotationForPlugIn(plugIn);
+        if (!watched) return;
+        Value after = annotations_->annotationForPlugIn(plugIn);
+        if (before != after) {
+            unsavedEvents_.push_back(corvane::dict({{"event", "annotation"}, {"plugin", AXDWatchers::summary(plugIn)},
+                                                    {"old", before}, {"new", after}}));
+        }
     });
-    if (watched && before != after) {
-        watchers_.publish(corvane::dict({{"event", "annotation"}, {"plugin", AXDWatchers::summary(plugIn)},
-                                         {"old", before}, {"new", after}}));
-    }
 }
 
-void AXDatabase::saveAnnotations() {
+Status AXDatabase::saveAnnotations() {
     databaseQueue_->assertNotCurrent();
-    databaseQueue_->sync([&] {
+    std::vector<Value> events;
+    Status saved = databaseQueue_->syncResult([&] {
         databaseQueue_->assertCurrent();
-        annotations_->saveIfChanged();
+        Status status = annotations_->saveIfChanged();
+        // Watchers learn of a change once it is on disk; one that could not be saved was undone.
+        if (status.ok()) events = std::move(unsavedEvents_);
+        unsavedEvents_.clear();
+        return status;
     });
+    for (auto& event : events) watchers_.publish(std::move(event));
+    return saved;
 }
 
 void AXDatabase::notifyAnnotationChange() { (void)corvane::notify::post(kAnnotationChangeNotification); }
@@ -265,7 +289,8 @@ void AXDatabase::autoElect(const AXDPlugIn& plugIn) {
     const Value* election = current.find(keys::kElection);
     // An election already made is never overridden.
     if (election && integerValueOf(*election) != 0) return;
-    annotations_->setAnnotationForPlugIn(Value(dictionaryChanging(current, keys::kElection, Value(1))), plugIn);
+    // A failed save is logged and undone: the plug-in is elected again at its next build.
+    (void)annotations_->setAnnotationForPlugIn(Value(dictionaryChanging(current, keys::kElection, Value(1))), plugIn);
 }
 
 void AXDatabase::pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) {

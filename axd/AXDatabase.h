@@ -63,6 +63,10 @@ public:
     std::vector<AXDPlugInPtr> findPlugIns(const Value& query);
     // The election texts a "KSUserElection" entry allows, or nothing when it filters nothing.
     static std::optional<std::set<std::string>> electionFilter(const Value& entry);
+    // The text the election filter compares for a plug-in: its stored election (else 1 when its
+    // auto-elect entitlement is a non-zero number, else 0), reduced to its low 8 bits.
+    static std::string electionText(const Value& annotation, const Value& autoElect);
+    std::string electionText(const AXDPlugIn& plugIn);
 
     // Null (not empty) when the application has no plug-ins or is not known.
     std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& path);
@@ -74,8 +78,10 @@ public:
     std::vector<Value> annotationsForPlugIns(const std::vector<const AXDPlugIn*>& plugIns);
     // Changes the annotation in memory; saveAnnotations() writes the changes of a request at once.
     void setAnnotationForPlugIn(const Value& annotation, const AXDPlugIn& plugIn);
-    // Writes the annotation file when anything changed since the last write.
-    void saveAnnotations();
+    // Writes the annotation file when anything changed since the last write, then tells the
+    // watchers of the changes. When the write fails, every change since the last write is undone
+    // (AXDAnnotationStore::saveIfChanged) and the error returned.
+    Status saveAnnotations();
     void notifyAnnotationChange();
     void autoElect(const AXDPlugIn& plugIn) REQUIRES(*databaseQueue_);
     // The registry's events, on its event thread.
@@ -107,6 +113,7 @@ private:
     const std::shared_ptr<corvane::vantry::Registry> workspace_;
     const corvane::dispatch::QueuePtr databaseQueue_;
     std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(*databaseQueue_);
+    std::vector<Value> unsavedEvents_ GUARDED_BY(*databaseQueue_);  // annotation events, until saved
     std::unordered_map<UUID, AXDPlugInPtr, corvane::UUIDHash> cache_ GUARDED_BY(*databaseQueue_);
     // Last, so that it ends first: no event reaches a database being destroyed.
     corvane::vantry::Subscription subscription_;

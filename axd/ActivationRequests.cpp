@@ -84,7 +84,7 @@ void Transaction::lockDownPlugIns() {
         }
         return done();
     }
-    uint64_t flags = request()[message::kFlags].uint64Value().value_or(0);
+    uint64_t flags = flagsArgument();
     std::vector<AXDPlugInPtr> plugIns;
     bool walked = marshalPaths([&](const std::string& path, bool resolved) {
         if (!resolved) {

@@ -5,12 +5,12 @@
 #include <algorithm>
 #include <deque>
 #include <malloc.h>
-#include <list>
 #include <map>
-#include <unordered_map>
+#include <unordered_set>
 
 #include "Annexa/AXProtocol.h"
 #include "Annexa/AXMessage.h"
+#include "axd/AXDMatchResults.h"
 #include "axd/AXDRpxClient.h"
 #include "axd/AXDServer.h"
 #include "axd/Transaction.h"
@@ -25,86 +25,12 @@ namespace log = corvane::log;
 
 namespace {
 
-// One form chosen so far: the plug-in, its encoded form and what this request adds to it.
-struct Chosen {
-    const AXDPlugIn* plugIn;
-    AXDPlugIn::EncodedFormPtr form;
-    Value annotations;
-    std::optional<std::string> overrider, overriding;
-};
-using ResultList = std::list<Chosen>;
-
-// The result list, with every identifier's entries in list order: collapsing looks at the forms of
-// one identifier without walking the whole list.
-class Results {
-public:
-    explicit Results(size_t expected) { byIdentifier_.reserve(expected); }
-    ResultList& list() { return list_; }
-    std::vector<ResultList::iterator>& of(const std::string& identifier) { return byIdentifier_[identifier]; }
-    void append(const std::string& identifier, Chosen chosen) {
-        list_.push_back(std::move(chosen));
-        of(identifier).push_back(std::prev(list_.end()));
-    }
-    void remove(const std::string& identifier, size_t index) {
-        auto& entries = of(identifier);
-        list_.erase(entries[index]);
-        entries.erase(entries.begin() + static_cast<long>(index));
-    }
-
-private:
-    ResultList list_;
-    std::unordered_map<std::string, std::vector<ResultList::iterator>> byIdentifier_;
-};
-
-std::string versionText(const AXDPlugIn& p) {
-    Value version = p.version();
-    const std::string* text = version.asString();
-    return text ? *text : std::string();
-}
-
-// Decides between p and the forms of the same identifier chosen so far: false drops p; true lets
-// it go on, after removing the form it displaces, if any. A chosen form says what its plug-in
-// says: its "version", "systemResident", "lastmodified" and "uuid" are read from the plug-in.
-bool collapse(const AXDPlugIn& p, Results& results, uint64_t flags, std::map<const AXDPlugIn*, std::string>& outcome,
-              bool explain) {
-    using namespace discovery;
-    std::string identifier = p.identifier().value_or("");
-    auto& same = results.of(identifier);
-    if (same.empty()) return true;
-    std::string pVersion = versionText(p);
-    for (size_t i = 0; i < same.size(); ++i) {
-        const AXDPlugIn& m = *same[i]->plugIn;
-        Ordering order = compareVersionString(pVersion, versionText(m));
-        bool newer = order == Ordering::Descending;
-        bool equal = order == Ordering::Same;
-        bool preferP = (p.onSystemVolume() && !m.onSystemVolume()) || p.lastModified() > m.lastModified();
-        bool decided = false;
-        bool keepP = false;
-        if (!(flags & kAllVersions)) {
-            decided = true;
-            keepP = newer || (equal && preferP);
-        } else if (equal && !(flags & kDuplicates)) {
-            decided = true;
-            keepP = preferP;
-        }
-        if (!decided) continue;
-        if (keepP) {
-            if (explain) outcome[&m] = "collapsed in favour of " + p.uuid()->string();
-            results.remove(identifier, i);
-        } else if (explain) {
-            outcome[&p] = "collapsed in favour of " + m.uuid()->string();
-        }
-        return keepP;
-    }
-    return true;
-}
-
 // The "matches" array as the wire carries it: each chosen plug-in's encoded form with this
 // request's annotations and replacement marks in front. The forms are not copied: the array is
 // put together from this request's own bytes and the forms where their plug-ins keep them, and the
 // reply goes to the socket so. Null when a form holds a value that a message cannot carry, as the
 // reply conversion would give.
-Value encodeMatches(const ResultList& list) {
+Value encodeMatches(const std::vector<AXDMatchResults::EntryPtr>& list, const std::vector<Value>& annotations) {
     namespace wire = corvane::rpx::wire;
     auto own = std::make_shared<std::string>();
     own->reserve(16 + list.size() * 64);
@@ -113,16 +39,18 @@ Value encodeMatches(const ResultList& list) {
     ownEnds.reserve(list.size());
     size_t nesting = 0;
     uint32_t kinds = 0;
-    for (const auto& chosen : list) {
+    for (size_t i = 0; i < list.size(); ++i) {
+        const AXDMatchResults::Entry& chosen = *list[i];
+        const Value& annotation = annotations[i];
         uint32_t count = chosen.form->count + 1 + (chosen.overrider ? 1 : 0) + (chosen.overriding ? 1 : 0);
         wire::appendDictionaryHeader(*own, count);
-        bool written = wire::appendEntry(*own, form::kAnnotations, chosen.annotations);
+        bool written = wire::appendEntry(*own, form::kAnnotations, annotation);
         if (chosen.overrider) written = written && wire::appendEntry(*own, form::kOverrider, Value(*chosen.overrider));
         if (chosen.overriding) written = written && wire::appendEntry(*own, form::kOverriding, Value(*chosen.overriding));
         if (!written) return Value();
         ownEnds.push_back(own->size());
-        nesting = std::max({nesting, chosen.form->nesting + 1, wire::nestingOf(chosen.annotations) + 2});
-        kinds |= chosen.form->kindsInside | chosen.annotations.kindsInside();
+        nesting = std::max({nesting, chosen.form->nesting + 1, wire::nestingOf(annotation) + 2});
+        kinds |= chosen.form->kindsInside | annotation.kindsInside();
     }
     Value::Encoding::Pieces pieces;
     pieces.bytes.reserve(2 * list.size());
@@ -131,9 +59,9 @@ Value encodeMatches(const ResultList& list) {
     for (const auto& chosen : list) {
         pieces.bytes.emplace_back(own->data() + from, ownEnds[next] - from);
         from = ownEnds[next++];
-        pieces.bytes.emplace_back(chosen.form->entries);
-        pieces.owners.push_back(chosen.form);
-        pieces.size += chosen.form->entries.size();
+        pieces.bytes.emplace_back(chosen->form->entries);
+        pieces.owners.push_back(chosen->form);
+        pieces.size += chosen->form->entries.size();
     }
     if (from < own->size()) pieces.bytes.emplace_back(own->data() + from, own->size() - from);  // no forms
     pieces.size += own->size();
@@ -153,8 +81,8 @@ struct MatchInputs {
     uint64_t registry = 0;     // the registry's contents
     uint64_t annotations = 0;  // the annotation table
     uint64_t forms = 0;        // the plug-ins' kept forms
+    uint64_t holds = 0;        // the hold list (a kept answer keeps no hold, so none outlives its release)
     std::vector<Value> exclusions;
-    std::vector<std::shared_ptr<const AXDPlugInHold>> holds;
     std::shared_ptr<const corvane::types::TypeDatabase> types;  // for type tests in patterns
     bool operator==(const MatchInputs&) const = default;
 };
@@ -178,9 +106,9 @@ MatchInputs currentMatchInputs(AXDServer& server) {
     inputs.registry = server.workspace().contentVersion();
     inputs.annotations = AXDAnnotationStore::changeCount();
     inputs.forms = AXDPlugIn::formsDropped();
+    inputs.holds = server.holdsChangeCount();
     inputs.types = corvane::types::database();
     inputs.exclusions = server.userPrefs().exclusionPatterns();
-    inputs.holds = server.currentHolds();
     return inputs;
 }
 
@@ -249,7 +177,7 @@ KeptAnswers& keptAnswers() {
 
 std::optional<std::string> Transaction::matchRefusal(
     const AXDPlugIn& p, const Value& rules, uint64_t flags, const std::vector<Value>& exclusions,
-    const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds, std::vector<std::string>& logged) {
+    const MatchHolds& holds, std::vector<std::string>& logged) {
     using namespace discovery;
     if (!(flags & kAll)) {
         if (!p.onSystemVolume()) {
@@ -284,73 +212,71 @@ std::optional<std::string> Transaction::matchRefusal(
 }
 
 std::shared_ptr<const MatchAnswer> Transaction::walkForMatch(const Value& rules, uint64_t flags, bool explain,
-                                                          const MatchInputs& inputs) {
+                                                          const MatchInputs& inputs, const MatchHolds& holds) {
     auto answer = std::make_shared<MatchAnswer>();
-    // Explaining looks at every installed plug-in: the registry's query never drops one that the
-    // rules would take, so what is returned is the same.
-    std::vector<AXDPlugInPtr> candidates = server().findPlugIns(explain ? Value() : rules);
+    std::vector<AXDPlugInPtr> candidates = server().findPlugIns(rules);
     answer->raw = static_cast<unsigned>(candidates.size());
     AXD_TRACE(discover__raw, answer->raw);
 
-    std::map<const AXDPlugIn*, std::string> outcome;  // explain only
-    Results results(candidates.size());
-    std::unordered_map<std::string, ResultList::iterator> overrides;
+    AXDMatchResults::Outcomes outcomes;  // explain only
+    AXDMatchResults::Outcomes* outcome = explain ? &outcomes : nullptr;
+    AXDMatchResults results(flags, candidates.size());
     for (const auto& p : candidates) {
-        if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, inputs.holds, answer->logged)) {
-            if (explain) outcome[p.get()] = *refusal;
+        if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, holds, answer->logged)) {
+            if (outcome) outcomes[p.get()] = *refusal;
             continue;
         }
         auto encoded = p->encodedForm();
         if (!encoded) {
             answer->exportErrors.push_back(log::formatText("failed to export matching plug-in %@: %@",
                                                            p->uuid()->string(), encoded.error()));
-            if (explain) outcome[p.get()] = "cannot be exported: " + encoded.error().description();
+            if (outcome) outcomes[p.get()] = "cannot be exported: " + encoded.error().description();
             continue;
         }
-        if (!collapse(*p, results, flags, outcome, explain)) continue;
-        std::string identifier = p->identifier().value_or("");
-        results.append(identifier, Chosen{p.get(), *encoded, Value(), {}, {}});
-        if (explain) outcome[p.get()] = "returned";
-        Value replaces = p->valueForEntitlement(keys::kReplaceEntitlement);
-        if (const std::string* one = replaces.asString()) {
-            overrides[*one] = std::prev(results.list().end());
-        } else if (const Array* many = replaces.asArray()) {
-            for (const Value& e : *many)
-                if (const std::string* name = e.asString()) overrides[*name] = std::prev(results.list().end());
-        }
+        if (!results.admit(*p, outcome)) continue;
+        results.append(*p, *encoded);
+        if (outcome) outcomes[p.get()] = "returned";
     }
-    for (auto& chosen : results.list()) {
-        auto o = overrides.find(chosen.plugIn->identifier().value_or(""));
-        if (o == overrides.end()) continue;
-        std::string overriderUuid = o->second->plugIn->uuid()->string();
-        std::string overriddenUuid = chosen.plugIn->uuid()->string();
-        chosen.overrider = overriderUuid;
-        o->second->overriding = chosen.plugIn->identifier().value_or("");
-        answer->overrides.emplace_back(overriderUuid, overriddenUuid);
-    }
-    answer->returned = static_cast<unsigned>(results.list().size());
+    std::vector<AXDMatchResults::EntryPtr> chosen = results.finish(answer->overrides);
+    answer->returned = static_cast<unsigned>(chosen.size());
     // The annotations of the forms that stay, all in one visit to the database.
     std::vector<const AXDPlugIn*> chosenPlugIns;
-    chosenPlugIns.reserve(results.list().size());
-    for (const auto& chosen : results.list()) chosenPlugIns.push_back(chosen.plugIn);
+    chosenPlugIns.reserve(chosen.size());
+    for (const auto& entry : chosen) chosenPlugIns.push_back(entry->plugIn);
     std::vector<Value> annotations = server().annotationsForPlugIns(chosenPlugIns);
-    size_t next = 0;
-    for (auto& chosen : results.list()) {
-        Value& annotation = annotations[next++];
-        chosen.annotations = annotation.isNull() ? Value(Dictionary{}) : std::move(annotation);
-    }
-    if (version() == kCurrentProtocolVersion) answer->matches = encodeMatches(results.list());
-    if (explain) {
-        Array explanations;
-        for (const auto& p : candidates) {
-            explanations.push_back(corvane::dict({{"uuid", p->uuid()->string()},
-                                                  {"identifier", p->identifier().value_or("")},
-                                                  {"path", p->path()},
-                                                  {"outcome", outcome[p.get()]}}));
-        }
-        answer->explanations = Value(std::move(explanations));
-    }
+    for (Value& annotation : annotations)
+        if (annotation.isNull()) annotation = Value(Dictionary{});
+    if (version() == kCurrentProtocolVersion) answer->matches = encodeMatches(chosen, annotations);
+    if (explain) answer->explanations = explainAll(candidates, outcomes, rules, flags, inputs, holds);
     return answer;
+}
+
+Value Transaction::explainAll(const std::vector<AXDPlugInPtr>& candidates, AXDMatchResults::Outcomes& outcomes,
+                              const Value& rules, uint64_t flags, const MatchInputs& inputs, const MatchHolds& holds) {
+    // Every installed plug-in is explained, in the registry's order. One the registry's query did
+    // not give (only its election filter drops what the rules would take) says why: the step that
+    // refuses it, else the election filter.
+    std::vector<AXDPlugInPtr> installed = server().findPlugIns(Value());
+    std::unordered_set<const AXDPlugIn*> given;
+    for (const auto& p : candidates) given.insert(p.get());
+    std::vector<std::string> unlogged;
+    Array explanations;
+    explanations.reserve(installed.size());
+    for (const auto& p : installed) {
+        std::string outcome;
+        if (given.count(p.get())) {
+            outcome = outcomes[p.get()];
+        } else if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, holds, unlogged)) {
+            outcome = *refusal;
+        } else {
+            outcome = "left out by the election filter: its election reads as " + server().electionText(*p);
+        }
+        explanations.push_back(corvane::dict({{"uuid", p->uuid()->string()},
+                                              {"identifier", p->identifier().value_or("")},
+                                              {"path", p->path()},
+                                              {"outcome", std::move(outcome)}}));
+    }
+    return Value(std::move(explanations));
 }
 
 void Transaction::matchPlugIns() {
@@ -361,7 +287,7 @@ void Transaction::matchPlugIns() {
         return;
     }
     Value rules = rulesEntry.isNull() ? Value() : convertMessageToValue(rulesEntry);
-    uint64_t flags = request()[message::kFlags].uint64Value().value_or(0);
+    uint64_t flags = flagsArgument();
     if ((flags & kAll) && (!client_->hasEntitlement(keys::kManagerEntitlement) || corvane::sandbox::isSandboxed(client_->pid()))) {
         failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (AXDiscoverAll)");
         return;
@@ -382,7 +308,7 @@ void Transaction::matchPlugIns() {
     KeptAnswers::Key key{client_, rules, flags, version()};
     auto answer = keepable ? keptAnswers().find(key, inputs) : nullptr;
     if (!answer) {
-        answer = walkForMatch(rules, flags, explain, inputs);
+        answer = walkForMatch(rules, flags, explain, inputs, server().currentHolds());
         // A walk over many plug-ins leaves megabytes of freed lists and maps in the heap, spread
         // between what stays; they go back to the system (about half a millisecond at 10,000).
         if (answer->raw >= kTrimAfterCandidates) malloc_trim(0);

@@ -81,6 +81,11 @@ void Transaction::dispatch() {
     failMessage(AXErrorCode::InvalidRequest, "unrecognized request");
 }
 
+uint64_t Transaction::flagsArgument() const {
+    const Value& flags = request()[message::kFlags];
+    return flags.kind() == Value::Kind::UInt64 ? *flags.uint64Value() : 0;
+}
+
 bool Transaction::onlyReads() const {
     const std::string* name = request()[message::kRequest].asString();
     return name && *name == request::kMatch;
@@ -89,7 +94,12 @@ bool Transaction::onlyReads() const {
 void Transaction::done() {
     if (answered_) return;
     answered_ = true;
-    server().saveAnnotations();
+    // Whatever the request changed is on disk before the reply says so; a change that could not be
+    // saved is undone, and the reply says that instead.
+    if (Status saved = server().saveAnnotations(); !saved.ok() && !reply_.count(message::kErrorCode)) {
+        reply_[message::kErrorCode] = Value(static_cast<uint64_t>(errorCodeValue(AXErrorCode::InvalidRequest)));
+        reply_[message::kError] = Value("unable to save annotations: " + saved.error().description());
+    }
     Value reply(reply_);
     if (AXD_TRACE_ENABLED(request__output)) {
         std::string text = reply.description();
@@ -215,7 +225,7 @@ void Transaction::removePlugIns() {
 }
 
 void Transaction::bulkPlugIns() {
-    uint64_t flags = request()[message::kFlags].uint64Value().value_or(0);
+    uint64_t flags = flagsArgument();
     log::info(logOps(), "bulk options 0x%lx not supported", static_cast<unsigned long>(flags & 0xffffffffu));
     done();
 }
@@ -274,7 +284,14 @@ void Transaction::annotatePlugIns() {
         server().setAnnotationForPlugIn(c, *p);
         return Walk::Continue;
     });
-    if (!walked) return;
+    if (walked) commitAnnotations();
+}
+
+void Transaction::commitAnnotations() {
+    if (Status saved = server().saveAnnotations(); !saved.ok()) {
+        failMessage(AXErrorCode::InvalidRequest, "unable to save annotations: " + saved.error().description());
+        return;
+    }
     server().notifyAnnotationChange();
     done();
 }
@@ -286,29 +303,38 @@ void Transaction::bulkAnnotatePlugIns() {
     const Dictionary* entries = d.asDictionary();
     size_t count = entries ? entries->size() : 0;
     log::debug(logOps(), "bulk change requested for %u plug-ins", static_cast<unsigned>(count));
+    // Every entry is checked and its plug-in looked up before any change is made, so that nothing
+    // else (a record built on the way, with its auto-election) is saved between this request's
+    // changes. The entries before a failing one are changed all the same, and saved with the reply.
+    std::vector<std::pair<AXDPlugInPtr, const Value*>> changes;
+    std::optional<std::pair<AXErrorCode, const char*>> failure;
     if (entries) {
         for (const auto& [key, value] : *entries) {
-            if (!value.isDictionary()) {
-                failMessage(AXErrorCode::BadAnnotation, "annotations values must be dictionaries");
-                return;
-            }
             auto uuid = UUID::parse(key);
-            if (!uuid) {
-                failMessage(AXErrorCode::BadAnnotation, "invalid plug-in UUID value");
-                return;
+            AXDPlugInPtr p = value.isDictionary() && uuid ? server().findPlugIn(*uuid) : nullptr;
+            if (!value.isDictionary()) {
+                failure.emplace(AXErrorCode::BadAnnotation, "annotations values must be dictionaries");
+            } else if (!uuid) {
+                failure.emplace(AXErrorCode::BadAnnotation, "invalid plug-in UUID value");
+            } else if (!p) {
+                failure.emplace(AXErrorCode::RegistryRefused, "no plug-in with the requested uuid");
+            } else {
+                changes.emplace_back(std::move(p), &value);
+                continue;
             }
-            AXDPlugInPtr p = server().findPlugIn(*uuid);
-            if (!p) {
-                failMessage(AXErrorCode::RegistryRefused, "no plug-in with the requested uuid");
-                return;
-            }
-            log::debug(logOps(), "client %d plug-in %@(%{public}@) extension := %@", client_->pid(), p->identifier(),
-                       p->uuid(), value);
-            server().setAnnotationForPlugIn(corvane::dict({{keys::kAnnotationExtension, value}}), *p);
+            break;
         }
     }
-    server().notifyAnnotationChange();
-    done();
+    for (const auto& [p, value] : changes) {
+        log::debug(logOps(), "client %d plug-in %@(%{public}@) extension := %@", client_->pid(), p->identifier(),
+                   p->uuid(), *value);
+        server().setAnnotationForPlugIn(corvane::dict({{keys::kAnnotationExtension, *value}}), *p);
+    }
+    if (failure) {
+        failMessage(failure->first, failure->second);
+        return;
+    }
+    commitAnnotations();
 }
 
 }  // namespace annexa

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -17,6 +18,7 @@ namespace annexa {
 class AXDRpxClient;
 class AXDPlugInHold;
 class AXDServer;
+using MatchHolds = std::vector<std::shared_ptr<const AXDPlugInHold>>;
 struct MatchAnswer;
 struct MatchInputs;
 
@@ -76,13 +78,21 @@ private:
     // request's start, rules, exclusions, authorization), or nothing.
     // Refusals that the log shows (exclusions, authorization) add their line to `logged`.
     std::optional<std::string> matchRefusal(const AXDPlugIn& plugIn, const Value& rules, uint64_t flags,
-                                            const std::vector<Value>& exclusions,
-                                            const std::vector<std::shared_ptr<const AXDPlugInHold>>& holds,
+                                            const std::vector<Value>& exclusions, const MatchHolds& holds,
                                             std::vector<std::string>& logged);
     // The walk of "match" over the registry's candidates, with what the request read at its start.
     std::shared_ptr<const MatchAnswer> walkForMatch(const Value& rules, uint64_t flags, bool explain,
-                                                    const MatchInputs& inputs);
+                                                    const MatchInputs& inputs, const MatchHolds& holds);
+    // The explanation of every installed plug-in: the outcome the walk gave it, or why the registry's
+    // query left it out.
+    Value explainAll(const std::vector<AXDPlugInPtr>& candidates, std::map<const AXDPlugIn*, std::string>& outcomes,
+                     const Value& rules, uint64_t flags, const MatchInputs& inputs, const MatchHolds& holds);
+    // The request's "flags": an unsigned number; absent, or of another type, reads as 0.
+    uint64_t flagsArgument() const;
 
+    // Saves the request's annotation changes, then posts the annotation-change notification and
+    // answers; a failed save answers with its error instead.
+    void commitAnnotations();
     // The request's "annotations" dictionary as a Value; nullopt after answering that it is
     // missing or holds what the annotation file cannot keep.
     std::optional<Value> annotationsArgument();

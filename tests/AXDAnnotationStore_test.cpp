@@ -39,7 +39,7 @@ TEST(AXDAnnotationStore, FirstStartIsEmptyAndSilentUntilTheFirstChange) {
     for (const auto& r : capture.records()) EXPECT_NE(r.level, log::Level::Error) << r.message;
     EXPECT_FALSE(axtest::exists(store.annotationsURL()));
 
-    store.setAnnotationForPlugIn(corvane::dict({{"election", 1}}), FakePlugIn{"com.example.a"});
+    ASSERT_TRUE(store.setAnnotationForPlugIn(corvane::dict({{"election", 1}}), FakePlugIn{"com.example.a"}).ok());
     auto onDisk = corvane::plist::readFile(store.annotationsURL());
     ASSERT_TRUE(onDisk);
     EXPECT_EQ(*onDisk, table({{"com.example.a", corvane::dict({{"election", 1}})}}));
@@ -76,15 +76,22 @@ TEST(AXDAnnotationStore, UnloadableFilesResetWithoutEndingTheProcess) {
         axtest::writeFile(path, c.contents);
         log::CaptureSink capture;
         AXDAnnotationStore store(path.c_str());
+        std::vector<std::string> aside;
+        for (const auto& e : std::filesystem::directory_iterator(dir.path()))
+            if (e.path().filename().string().rfind("Annotations.damaged-", 0) == 0) aside.push_back(e.path());
         if (c.logged) {
             EXPECT_TRUE(capture.contains(c.logged)) << c.name;
-            EXPECT_TRUE(capture.contains("(resetting)")) << c.name;
+            // The file is kept beside before the table starts over, and the log says where.
+            ASSERT_EQ(aside.size(), 1u) << c.name;
+            EXPECT_EQ(axtest::readFile(aside[0]), c.contents) << c.name;
+            EXPECT_TRUE(capture.contains("(resetting; the damaged file is kept as " + aside[0] + ")")) << c.name;
             EXPECT_TRUE(store.annotations().empty()) << c.name;
         } else {
-            EXPECT_FALSE(capture.contains("(resetting)")) << c.name;
+            EXPECT_FALSE(capture.contains("(resetting")) << c.name;
+            EXPECT_TRUE(aside.empty()) << c.name;
         }
         // The first change writes a good file over whatever was there.
-        store.setAnnotationForIdentifier(corvane::dict({{"election", 1}}), "p");
+        ASSERT_TRUE(store.setAnnotationForIdentifier(corvane::dict({{"election", 1}}), "p").ok()) << c.name;
         auto back = corvane::plist::readFile(path);
         ASSERT_TRUE(back) << c.name;
         EXPECT_EQ((*back)["version"], Value(16)) << c.name;
@@ -123,22 +130,27 @@ TEST(AXDAnnotationStore, ChangesMergeByEntryAndSharedKeysSeeEachOther) {
     FakePlugIn replaced{"com.example.a"};
     FakePlugIn replacer{"com.example.a"};  // its replace-plugin entitlement names the first
     Value e = corvane::dict({{"x", 1}, {"nested", corvane::dict({{"y", 2}})}});
-    store.setAnnotationForPlugIn(corvane::dict({{"election", 0}, {"extension", e}}), replaced);
-    store.setAnnotationForPlugIn(corvane::dict({{"election", 1}}), replacer);
+    ASSERT_TRUE(store.setAnnotationForPlugIn(corvane::dict({{"election", 0}, {"extension", e}}), replaced).ok());
+    ASSERT_TRUE(store.setAnnotationForPlugIn(corvane::dict({{"election", 1}}), replacer).ok());
     EXPECT_EQ(store.annotationForPlugIn(replaced), corvane::dict({{"election", 1}, {"extension", e}}));
     Value f = corvane::dict({{"nested", corvane::dict({})}});
-    store.setAnnotationForPlugIn(corvane::dict({{"extension", f}}), replaced);
+    ASSERT_TRUE(store.setAnnotationForPlugIn(corvane::dict({{"extension", f}}), replaced).ok());
     EXPECT_EQ(store.annotationForPlugIn(replacer), corvane::dict({{"election", 1}, {"extension", f}}));
-    store.setAnnotationForPlugIn(Value(), replacer);
+    ASSERT_TRUE(store.setAnnotationForPlugIn(Value(), replacer).ok());
     EXPECT_TRUE(store.annotationForPlugIn(replaced).isNull());
     EXPECT_EQ(*corvane::plist::readFile(path), table({}));
 
-    // A value without a property-list form: the save fails and is logged, memory keeps the change.
+    // A value without a property-list form: the save fails and is logged, and the change is undone
+    // with every other one since the last save, so memory holds what the file holds.
+    store.changeAnnotationForIdentifier(corvane::dict({{"election", 5}}), "v");
     log::CaptureSink capture;
-    store.setAnnotationForIdentifier(corvane::dict({{"extension", Value(corvane::UUID::random())}}), "u");
+    EXPECT_FALSE(store.setAnnotationForIdentifier(corvane::dict({{"extension", Value(corvane::UUID::random())}}), "u").ok());
     EXPECT_TRUE(capture.contains("unable to save annotations:"));
-    EXPECT_FALSE(store.annotationForIdentifier("u").isNull());
+    EXPECT_TRUE(store.annotationForIdentifier("u").isNull());
+    EXPECT_TRUE(store.annotationForIdentifier("v").isNull());
     EXPECT_EQ(*corvane::plist::readFile(path), table({}));
+    EXPECT_TRUE(store.setAnnotationForIdentifier(corvane::dict({{"election", 5}}), "v").ok());
+    EXPECT_EQ(*corvane::plist::readFile(path), table({{"v", corvane::dict({{"election", 5}})}}));
 }
 
 TEST(AXDAnnotationStore, OtherReadersSeeExactlyVersionAndData) {
@@ -146,7 +158,7 @@ TEST(AXDAnnotationStore, OtherReadersSeeExactlyVersionAndData) {
     std::string path = dir / "Annotations";
     {
         AXDAnnotationStore store(path.c_str());
-        store.setAnnotationForIdentifier(corvane::dict({{"election", -1}}), "com.example.a");
+        ASSERT_TRUE(store.setAnnotationForIdentifier(corvane::dict({{"election", -1}}), "com.example.a").ok());
     }
     auto py = axtest::run({"/usr/bin/python3", "-c",
                            "import plistlib,sys; d=plistlib.load(open(sys.argv[1],'rb')); "
@@ -167,14 +179,14 @@ TEST(AXDAnnotationStore, AKilledSaverLeavesTheOldOrTheNewTable) {
     };
     {
         AXDAnnotationStore first(path.c_str());
-        first.setAnnotationForIdentifier(table(-1), "p");
+        ASSERT_TRUE(first.setAnnotationForIdentifier(table(-1), "p").ok());
     }
     for (int round = 0; round < 20; ++round) {
         pid_t pid = fork();
         ASSERT_GE(pid, 0);
         if (pid == 0) {
             AXDAnnotationStore store(path.c_str());
-            for (int i = 0;; ++i) store.setAnnotationForIdentifier(table(i), "p");
+            for (int i = 0;; ++i) (void)store.setAnnotationForIdentifier(table(i), "p");
         }
         usleep(static_cast<useconds_t>(2000 + round * 1500));
         kill(pid, SIGKILL);
@@ -206,11 +218,11 @@ TEST(AXDAnnotationStore, ChangesAreSavedOnceWhenAsked) {
     AXDAnnotationStore store(path.c_str());
     for (int i = 0; i < 50; ++i) store.changeAnnotationForIdentifier(corvane::dict({{"election", i}}), "k" + std::to_string(i));
     EXPECT_FALSE(axtest::exists(path));
-    store.saveIfChanged();
+    ASSERT_TRUE(store.saveIfChanged().ok());
     ASSERT_TRUE(axtest::exists(path));
     struct stat before {};
     ::stat(path.c_str(), &before);
-    store.saveIfChanged();  // nothing changed: no write
+    ASSERT_TRUE(store.saveIfChanged().ok());  // nothing changed: no write
     struct stat after {};
     ::stat(path.c_str(), &after);
     EXPECT_EQ(before.st_ino, after.st_ino);
@@ -236,7 +248,7 @@ TEST(AXDAnnotationStore, ChangesAreSavedOnceWhenAsked) {
         struct stat was {};
         ::stat(path.c_str(), &was);
         store.changeAnnotationForIdentifier(c.annotation, c.key);
-        store.saveIfChanged();
+        ASSERT_TRUE(store.saveIfChanged().ok()) << c.name;
         struct stat now {};
         ::stat(path.c_str(), &now);
         EXPECT_EQ(was.st_ino != now.st_ino, c.changes) << c.name;
