@@ -14,7 +14,8 @@ std::optional<std::string> AXDPlugIn::allowForClient(const AXDRpxClient& client)
     }
     Value required = pluginKey(keys::kHostEntitlement);
     if (!required.isNull()) {
-        // A name that is no string cannot be held: the host is refused.
+        // A name that is no string cannot be held: the host is refused. The text shows the name's
+        // own characters (a value of another type in its notation).
         const std::string* name = required.asString();
         if (!name || !client.hasEntitlement(*name))
             return corvane::log::formatText("the host does not have the \"%@\" entitlement", required);

@@ -3,6 +3,7 @@
 #include "platform/log/Log.h"
 
 namespace log = corvane::log;
+using corvane::Array;
 using corvane::Value;
 
 TEST(LogFormat, EveryDirective) {
@@ -35,12 +36,14 @@ TEST(LogFormat, EveryDirective) {
 }
 
 TEST(LogFormat, PrivateArgumentsAreRedactedUnlessPublic) {
-    const log::Arg args[] = {log::Arg(7), log::Arg("secret"), log::Arg("shown"),
-                             log::Arg(Value("obj")), log::Arg(Value("pub"))};
-    EXPECT_EQ(log::format("%d %s %{public}s %@ %{public}@", args, true),
-              "7 <private> shown <private> \"pub\"");
-    EXPECT_EQ(log::format("%d %s %{public}s %@ %{public}@", args, false),
-              "7 secret shown \"obj\" \"pub\"");
+    // A text Value prints its own characters, as a string does (a quoted "%@" shows them once);
+    // other values print in the notation.
+    const log::Arg args[] = {log::Arg(7), log::Arg("secret"), log::Arg("shown"), log::Arg(Value("obj")),
+                             log::Arg(Value("pub")), log::Arg(Value(Array{Value("x")}))};
+    EXPECT_EQ(log::format("%d %s %{public}s %@ %{public}@ %{public}@", args, true),
+              "7 <private> shown <private> pub [\"x\"]");
+    EXPECT_EQ(log::format("%d %s %{public}s %@ \"%{public}@\" %@", args, false),
+              "7 secret shown obj \"pub\" [\"x\"]");
 }
 
 TEST(LogCapture, RecordsEveryLevelWithItsCategory) {

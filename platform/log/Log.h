@@ -4,7 +4,8 @@
 // (debug, info, default, error) and are written with format texts exactly as the system's texts
 // are written, in the printf family's style plus:
 //   %@            an object's description (strings, Values, UUIDs, errors, anything with a
-//                 description() member, shared pointers to those; null prints "(null)")
+//                 description() member, shared pointers to those; null prints "(null)"); a
+//                 Value that holds a text prints the text itself, unquoted
 //   %{public}@    the same, shown unredacted
 //   %{public}s    a C string shown unredacted
 //   %d %i %u %x %s %c %p %f %g %%, with the length modifiers h, l, ll, z, j, t
@@ -78,7 +79,9 @@ public:
     Arg(const std::string& s) : kind_(Kind::Text), text_(s) {}  // NOLINT(google-explicit-constructor)
     Arg(std::nullptr_t) : kind_(Kind::Null) {}  // NOLINT(google-explicit-constructor)
     Arg(const void* p) : kind_(Kind::Pointer), p_(p) {}  // NOLINT(google-explicit-constructor)
-    Arg(const Value& v) : kind_(Kind::Text), text_(v.description()) {}  // NOLINT
+    // A text prints as its own characters, as a string argument does; any other value as its
+    // description in the text notation.
+    Arg(const Value& v) : kind_(Kind::Text), text_(v.isString() ? *v.asString() : v.description()) {}  // NOLINT
     Arg(const UUID& u) : kind_(Kind::Text), text_(u.string()) {}      // NOLINT
     Arg(const Error& e) : kind_(Kind::Text), text_(e.description()) {}  // NOLINT
     template <class T>

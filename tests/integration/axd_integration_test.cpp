@@ -12,6 +12,7 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
+#include <map>
 #include <sstream>
 #include <thread>
 
@@ -717,4 +718,133 @@ TEST(Axd, CommandLineAndTermination) {
     auto second = axtest::run({axtest::binary("axd")}, {{"CORVANE_LOG_SINK", "stderr"}});
     EXPECT_EQ(second.status, 1);
     EXPECT_NE(second.err.find("unable to construct server"), std::string::npos);
+}
+
+// X 1.0 declares it replaces Y; X 2.0, registered later and declaring nothing, displaces it. Y is
+// marked by the registration that declared the replacement, and X 2.0 carries no mark.
+TEST(Axd, AReplacementDeclaredByADisplacedRegistrationStillMarksItsTarget) {
+    Daemon d;
+    auto key = codesign::generateKey();
+    ASSERT_TRUE(codesign::writeKeyPair(d.root / "key", key).ok());
+    ASSERT_TRUE(codesign::trustKey(d.root / "key.pub").ok());
+    auto application = [&](const char* name, const char* id, const char* version, const Value& ents) {
+        std::string app = axtest::makeBundle(d.root.path(), std::string(name) + ".app",
+                                             axtest::appInfo(std::string("com.example.") + name), "/bin/true");
+        std::string plugIn = axtest::makeBundle(
+            app + "/PlugIns", "P.appex",
+            axtest::plugInInfo(id, dict({{"KSExtensionProtocol", "P"},
+                                         {"KSExtensionAttributes", dict({{"KSExtensionVersion", version}})}})),
+            "/bin/true");
+        if (!ents.isNull()) {
+            EXPECT_TRUE(codesign::sign(plugIn, key, std::nullopt, ents).ok());
+        }
+        EXPECT_EQ(d.axctl({"add", app}).status, 0);
+        return (*vantry::Registry::open(vantry::Registry::defaultPath()))->plugInForPath(plugIn)->uuid().string();
+    };
+    std::string x1 = application("X1", "com.example.x", "1.0", dict({{"com.corvane.developer.replace-plugin", "com.example.y"}}));
+    std::string x2 = application("X2", "com.example.x", "2.0", Value());
+    std::string y = application("Y", "com.example.y", "1.0", Value());
+    Value reply = d.send(request("match"));
+    std::map<std::string, Value> byUuid;
+    for (const Value& f : *reply["matches"].asArray()) byUuid[*f["uuid"].asString()] = f;
+    ASSERT_EQ(byUuid.size(), 2u) << reply.description();
+    ASSERT_TRUE(byUuid.count(x2) && byUuid.count(y)) << reply.description();
+    EXPECT_EQ(byUuid[y]["overrider"], Value(x1));
+    EXPECT_TRUE(byUuid[x2]["overriding"].isNull()) << byUuid[x2].description();
+    EXPECT_TRUE(byUuid[x2]["overrider"].isNull()) << byUuid[x2].description();
+    EXPECT_TRUE(d.axd->waitForErr("plug-in " + x1 + " overrides " + y));
+}
+
+// The election filter is made only from texts that begin with "=" or a letter, mark or number;
+// with any other element there is none, and the exact test alone decides. Y's election 65537
+// reads as "1" to the filter and as itself to the exact test, so the answers show which applied.
+// Explaining changes no answer.
+TEST(Axd, TheElectionFilterAndTheExplanationLeaveTheAnswerAsTheRulesGiveIt) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    UUID one = (*registry)->plugInForPath(app + "/PlugIns/One.appex")->uuid();
+    ASSERT_EQ(d.send(request("annotate", {{"annotations", dict({{"election", 65537}})}, {"uuids", Value(Array{Value(one)})}})),
+              dict({}));
+    struct Case {
+        const char* name;
+        Value election;
+        bool returned;
+    };
+    auto with = [](const char* other) { return Value(Array{Value("65537"), Value(other)}); };
+    const Case cases[] = {
+        {"the text alone: filtered", Value("65537"), false},
+        {"beside a guillemet: no filter", with("\u00ab1"), true},
+        {"beside a dash: no filter", with("\u2014"), true},
+        {"beside a no-break space: no filter", with("\u00a01"), true},
+        {"beside an operator: no filter", with(">0"), true},
+        {"beside a letter: filtered", with("\u00e9"), false},
+        {"beside a combining mark: filtered", with("\u0301a"), false},
+        {"beside an Arabic-Indic digit: filtered", with("\u0663"), false},
+        {"beside a roman numeral: filtered", with("\u216b"), false},
+    };
+    for (const auto& c : cases) {
+        Value rules = dict({{"KSUserElection", c.election}, {"KSExtensionIdentifier", "com.example.One"}});
+        Value plain = d.send(request("match", {{"rules", rules}}));
+        ASSERT_TRUE(plain["matches"].isArray()) << c.name << ": " << plain.description();
+        EXPECT_EQ(plain["matches"].asArray()->size(), c.returned ? 1u : 0u) << c.name;
+        Value explained = d.send(request("match", {{"rules", rules}, {"flags", uint64_t{0x10000}}}));
+        EXPECT_EQ(explained["matches"], plain["matches"]) << c.name;
+        // The explanation says why One was left out, naming the filter when it was the filter.
+        for (const Value& e : *explained["explanations"].asArray()) {
+            if (e["uuid"] != Value(one.string())) continue;
+            const std::string& outcome = *e["outcome"].asString();
+            if (c.returned) {
+                EXPECT_EQ(outcome, "returned") << c.name;
+            } else {
+                EXPECT_EQ(outcome, "left out by the election filter: its election reads as 1") << c.name;
+            }
+        }
+    }
+}
+
+// The reason a host is refused names the entitlement with its own characters, in the reply and in
+// the log.
+TEST(Axd, AHostIsToldWhichEntitlementItLacks) {
+    Daemon d;
+    std::string app = axtest::makeBundle(d.root.path(), "Example.app", axtest::appInfo("com.example.app"), "/bin/true");
+    std::string plugIn = axtest::makeBundle(
+        app + "/PlugIns", "Needy.appex",
+        axtest::plugInInfo("com.example.needy", dict({{"KSExtensionProtocol", "P"},
+                                                      {"KSExtensionHostEntitlement", "com.example.required"},
+                                                      {"KSExtensionAttributes", dict({})}})),
+        "/bin/true");
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    UUID needy = (*vantry::Registry::open(vantry::Registry::defaultPath()))->plugInForPath(plugIn)->uuid();
+    const std::string reason = "the host does not have the \"com.example.required\" entitlement";
+    EXPECT_EQ(d.send(request("ready", {{"uuids", Value(Array{Value(needy)})}})),
+              error(11, "access to plugin com.example.needy denied: " + reason));
+    EXPECT_TRUE(d.axd->waitForErr("(" + needy.string() + "): " + reason));
+    auto refused = d.axctl({"ready", needy.string()});
+    EXPECT_EQ(refused.status, 77);
+    EXPECT_NE(refused.err.find(reason), std::string::npos) << refused.err;
+}
+
+// A change the annotation file cannot take (here its directory does not exist) is refused with the
+// reason and not kept: the daemon's answers keep showing what the file holds, and it goes on
+// serving.
+TEST(Axd, AnAnnotationThatCannotBeSavedIsRefusedAndNotKept) {
+    axtest::TempDir nowhere;
+    Daemon d({"-d", nowhere / "missing/Annotations"});
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    UUID one = (*vantry::Registry::open(vantry::Registry::defaultPath()))->plugInForPath(app + "/PlugIns/One.appex")->uuid();
+    auto annotated = d.axctl({"annotate", "--election", "3", one.string()});
+    EXPECT_NE(annotated.status, 0);
+    EXPECT_NE(annotated.err.find("unable to save annotations: cannot write " + nowhere / "missing/Annotations" +
+                                 ": No such file or directory"),
+              std::string::npos)
+        << annotated.err;
+    EXPECT_TRUE(d.axd->waitForErr("unable to save annotations:"));
+    EXPECT_EQ(d.send(request("bulk-annotate", {{"annotations", dict({{one.string(), dict({{"x", 1}})}})}}))["errorcode"],
+              Value(uint64_t{4}));
+    Value all = d.send(request("match", {{"rules", dict({{"KSExtensionIdentifier", "com.example.One"}})}}));
+    ASSERT_EQ(all["matches"].asArray()->size(), 1u) << all.description();
+    EXPECT_EQ((*all["matches"].asArray())[0]["annotations"], dict({}));
 }
