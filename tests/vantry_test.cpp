@@ -305,3 +305,54 @@ TEST(Vantry, ADamagedDatabaseIsReportedAndRebuilt) {
     EXPECT_EQ(list.status, 0);
     EXPECT_NE(list.out.find("com.example.share"), std::string::npos) << list.out;
 }
+
+// A registration the disk refuses (full: a file-size limit; read-only: a read-only mount of the
+// registry's directory, or its modes for an ordinary user) fails with the reason and leaves the
+// registry as it was; the same registration succeeds once the disk takes writes again.
+TEST(Vantry, ARegistrationTheDiskRefusesChangesNothing) {
+    Fixture f;
+    ASSERT_EQ(f.vantry({"register", f.app}).status, 0);
+    std::string db = Registry::defaultPath();
+    std::string dir = db.substr(0, db.rfind('/'));
+    std::string vantry = axtest::binary("vantry");
+    struct Case {
+        const char* name;
+        std::vector<std::string> command;  // registers the second application under the fault
+        const char* reason;
+    };
+    // 32 KiB (in 512-byte blocks): the registry opens, and its commit does not fit.
+    std::string script = "trap '' XFSZ; ulimit -f 64; exec \"$0\" register \"$1\"";
+    std::vector<std::string> readOnly =
+        ::geteuid() == 0
+            ? std::vector<std::string>{"/usr/bin/unshare", "-m", "/bin/sh", "-c",
+                                       "mount --bind -o ro \"$2\" \"$2\" && exec \"$0\" register \"$1\"", vantry}
+            : std::vector<std::string>{"/bin/sh", "-c",
+                                       "chmod a-w \"$2\" \"$2\"/*; \"$0\" register \"$1\"; s=$?; chmod u+w \"$2\" \"$2\"/*; exit $s",
+                                       vantry};
+    const Case cases[] = {
+        {"a full disk", {"/bin/sh", "-c", script, vantry}, "COMMIT: disk I/O error"},
+        {"a read-only registry", readOnly, "unable to open database file"},
+    };
+    int round = 0;
+    for (const auto& c : cases) {
+        std::string n = std::to_string(++round);
+        std::string other = axtest::makeBundle(f.root.path(), "Other" + n + ".app", axtest::appInfo("com.example.other" + n),
+                                               "/bin/true");
+        axtest::makeBundle(other + "/PlugIns", "P.appex",
+                           axtest::plugInInfo("com.example.other.p" + n,
+                                              dict({{"KSExtensionAttributes", dict({})}})),
+                           "/bin/true");
+        std::string before = f.vantry({"list", "--json"}).out;
+        std::vector<std::string> command = c.command;
+        command.push_back(other);
+        command.push_back(dir);
+        auto refused = axtest::run(command);
+        EXPECT_NE(refused.status, 0) << c.name << ": " << refused.out;
+        EXPECT_EQ(refused.err.find("vantry: registry database " + db + ": "), 0u) << c.name << ": " << refused.err;
+        EXPECT_NE(refused.err.find(c.reason), std::string::npos) << c.name << ": " << refused.err;
+        EXPECT_EQ(f.vantry({"list", "--json"}).out, before) << c.name;
+        auto again = f.vantry({"register", other});
+        EXPECT_EQ(again.status, 0) << c.name << ": " << again.err;
+        EXPECT_NE(f.vantry({"list"}).out.find(other), std::string::npos) << c.name;
+    }
+}

@@ -14,6 +14,8 @@
 #include "platform/plist/Plist.h"
 #include "platform/vantry/Store.h"
 
+#include <cstring>
+
 namespace corvane::vantry {
 
 namespace {
@@ -74,7 +76,11 @@ Store::~Store() {
 
 Error Store::sqlError(const char* what) const {
     int rc = sqlite3_errcode(db_);
-    std::string text = std::string(what) + ": " + sqlite3_errmsg(db_);
+    // Which database, at which step, and for a failed system call its reason (a full disk, a
+    // read-only file system).
+    std::string text = "registry database " + path_ + ": " + what + ": " + sqlite3_errmsg(db_);
+    if (int err = sqlite3_system_errno(db_); err != 0 && (rc & 0xff) != SQLITE_CONSTRAINT)
+        text += std::string(" (") + std::strerror(err) + ")";
     if (rc == SQLITE_CORRUPT || rc == SQLITE_NOTADB)
         text = "registry database " + path_ + " is damaged (" + sqlite3_errmsg(db_) + "); run `vantry rebuild`";
     return Error{kDomain, rc, text};
