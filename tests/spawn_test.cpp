@@ -9,11 +9,13 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <cstring>
 #include <filesystem>
 
 #include "Annexa/AXPlugInRuntime.h"
 #include "Annexa/c/annexa.h"
 #include "platform/codesign/CodeSign.h"
+#include "platform/layout/Layout.h"
 #include "platform/pcx/Pcx.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/spawn/Spawn.h"
@@ -45,9 +47,13 @@ struct TcpListener {
     ~TcpListener() { ::close(fd); }
 };
 
+// Where spawnd keeps the data container of a plug-in, for the platform root of the test.
+std::string containerOf(const std::string& identifier) { return layout::userDataDir() + "/containers/4/" + identifier; }
+
 class Spawnd {
 public:
-    explicit Spawnd(std::vector<std::string> options = {}) {
+    // `launcher` runs spawnd (prlimit, say), with spawnd and its options after it.
+    explicit Spawnd(std::vector<std::string> options = {}, std::vector<std::string> launcher = {}) {
         key_ = codesign::generateKey();
         EXPECT_TRUE(codesign::writeKeyPair(root / "key", key_).ok());
         EXPECT_TRUE(codesign::trustKey(root / "key.pub").ok());
@@ -55,8 +61,22 @@ public:
         fs::create_directories(root / "bin");
         unentitled = root / "bin/unentitled";
         fs::copy_file(axtest::binary("spawn_peer"), unentitled);
+        for (const auto& o : axtest::spawndOptions()) options.push_back(o);
         options.insert(options.begin(), axtest::binary("spawnd"));
-        daemon = std::make_unique<axtest::Process>(options);
+        options.insert(options.begin(), launcher.begin(), launcher.end());
+        options_ = options;
+        start();
+    }
+
+    // Stopped as a service manager stops it, so that it removes what it made (its cgroups).
+    ~Spawnd() {
+        daemon->signal(SIGTERM);
+        daemon->wait(std::chrono::seconds(10));
+    }
+
+    // Starts spawnd (again), with its log on standard error.
+    void start() {
+        daemon = std::make_unique<axtest::Process>(options_, std::map<std::string, std::string>{{"CORVANE_LOG_SINK", "stderr"}, {"CORVANE_LOG", "info"}});
         EXPECT_TRUE(axtest::eventually([] { return axtest::endpointAnswers(rpx::endpointPath(spawn::kEndpoint)); }));
     }
 
@@ -76,17 +96,23 @@ public:
         return bundle + "/Sample";
     }
 
-    // The overlay axd would send: the profile and the environment of a data container.
+    // The overlay axd would send: the profile, the data container by name and the environment.
     Value overlay(const std::string& profile, const std::string& container, Dictionary extra = {}) {
-        Dictionary environment = std::move(extra);
-        if (!container.empty()) {
-            environment["HOME"] = Value(container);
-            environment["TMPDIR"] = Value(container + "/tmp");
-        }
-        return dict({{"RPXService", dict({{"EnvironmentVariables", Value(std::move(environment))},
-                                          {"_SandboxProfile", profile},
-                                          {"_OmitSandboxParameters", true}})},
-                     {"KFBundlePackageType", "RPX!"}});
+        Dictionary service{{"EnvironmentVariables", Value(std::move(extra))},
+                           {"_SandboxProfile", profile},
+                           {"_OmitSandboxParameters", true}};
+        if (!container.empty()) service["_DataContainer"] = Value(container);
+        return dict({{"RPXService", Value(std::move(service))}, {"KFBundlePackageType", "RPX!"}});
+    }
+
+    // A bundle holding a C program of this build, with the library beside it (the sandbox lets a
+    // plug-in read its own bundle, not the build tree); its executable's path.
+    std::string cPlugIn(const std::string& identifier, const std::string& program) {
+        fs::create_directories(root / "apps/C.app/PlugIns");
+        std::string bundle = axtest::makeBundle(root / "apps/C.app/PlugIns", identifier + ".appex",
+                                                axtest::plugInInfo(identifier, dict({}), "program"), axtest::binary(program));
+        fs::copy_file(axtest::binary("../lib/libannexa.so.1"), bundle + "/libannexa.so.1", fs::copy_options::overwrite_existing);
+        return bundle + "/program";
     }
 
     int add(pid_t host, const std::string& executable, const Value& overlay, const std::string& peer = "") {
@@ -109,6 +135,7 @@ public:
     std::string unentitled;
 
 private:
+    std::vector<std::string> options_;
     codesign::KeyPair key_;
 };
 
@@ -131,7 +158,7 @@ struct Session {
 TEST(Spawnd, OnlyAnEntitledRegistrarRegistersAndBadRegistrationsAreRefused) {
     Spawnd d;
     std::string executable = d.plugIn("com.example.sample");
-    Value good = d.overlay("plugin", d.root / "containers/sample");
+    Value good = d.overlay("plugin", "com.example.sample");
     EXPECT_EQ(d.add(::getpid(), executable, good, d.unentitled), EPERM);
     EXPECT_TRUE(d.daemon->waitForErr("no com.corvane.private.rpx.domain-extension.proxy entitlement"));
 
@@ -156,6 +183,9 @@ TEST(Spawnd, OnlyAnEntitledRegistrarRegistersAndBadRegistrationsAreRefused) {
         {"overlay of another package type", ::getpid(), executable, wrongType, EINVAL},
         {"environment of numbers", ::getpid(), executable, badEnvironment, EINVAL},
         {"overlay not a dictionary", ::getpid(), executable, Value("RPX!"), EINVAL},
+        {"a container named by a path", ::getpid(), executable, d.overlay("plugin", "../../home"), EINVAL},
+        {"a memory limit that is no number", ::getpid(), executable,
+         dict({{"RPXService", dict({{"_MemoryLimit", "all"}})}, {"KFBundlePackageType", "RPX!"}}), EINVAL},
         {"no such host", 0x3ffffff0, executable, good, ESRCH},
     };
     for (const Row& row : rows) EXPECT_EQ(d.add(row.host, row.executable, row.overlay), row.expected) << row.what;
@@ -174,8 +204,12 @@ TEST(Spawnd, APlugInRunsConfinedByItsProfile) {
     Spawnd d;
     TcpListener tcp;
     ASSERT_NE(tcp.port, 0);
-    std::string container = d.root / "containers/plugin";
-    ASSERT_EQ(d.add(::getpid(), d.plugIn("com.example.plugin"), d.overlay("plugin", container, {{"GREETING", Value("hi")}})), 0);
+    std::string container = containerOf("com.example.plugin");
+    // The overlay's own HOME and XDG_RUNTIME_DIR are not the instance's: spawnd sets those.
+    ASSERT_EQ(d.add(::getpid(), d.plugIn("com.example.plugin"),
+                    d.overlay("plugin", "com.example.plugin",
+                              {{"GREETING", Value("hi")}, {"HOME", Value("/")}, {"XDG_RUNTIME_DIR", Value("/run")}})),
+              0);
 
     Session session("com.example.plugin");
     ASSERT_TRUE(session.connection) << session.connection.error().description();
@@ -183,9 +217,13 @@ TEST(Spawnd, APlugInRunsConfinedByItsProfile) {
     EXPECT_EQ(hello["greeting"], Value("hello from a sample plug-in"));
     EXPECT_TRUE(hello["sandboxed"].isTrue());
     Value inside = session.send(dict({{"do", "environment"}}));
-    // A clean environment: the overlay's variables and the platform root, nothing of spawnd's.
-    EXPECT_EQ(inside["environment"], dict({{"HOME", container}, {"TMPDIR", container + "/tmp"}, {"GREETING", "hi"},
-                                          {"CORVANE_ROOT", d.root.path()}}));
+    // A clean environment: the overlay's variables, those spawnd makes of the container, the
+    // platform root, and nothing of spawnd's.
+    EXPECT_EQ(inside["environment"],
+              dict({{"HOME", container}, {"KFFIXED_USER_HOME", container}, {"TMPDIR", container + "/tmp"},
+                    {"XDG_CONFIG_HOME", container + "/.config"}, {"XDG_DATA_HOME", container + "/.local/share"},
+                    {"XDG_STATE_HOME", container + "/.local/state"}, {"XDG_CACHE_HOME", container + "/.cache"},
+                    {"GREETING", "hi"}, {"CORVANE_ROOT", d.root.path()}}));
     EXPECT_EQ(inside["directory"], Value(container));
     struct Row {
         const char* what;
@@ -194,10 +232,10 @@ TEST(Spawnd, APlugInRunsConfinedByItsProfile) {
     } rows[] = {
         {"write in its container", dict({{"do", "write"}, {"path", container + "/note"}}), 0},
         {"write in its TMPDIR", dict({{"do", "write"}, {"path", container + "/tmp/note"}}), 0},
-        {"write beside its container", dict({{"do", "write"}, {"path", d.root / "containers/other"}}), EACCES},
+        {"write beside its container", dict({{"do", "write"}, {"path", containerOf("com.example.other")}}), EACCES},
         {"write in /tmp", dict({{"do", "write"}, {"path", "/tmp/annexa-sandbox-escape"}}), EACCES},
         {"write in its own bundle", dict({{"do", "write"}, {"path", d.root / "apps/Host.app/x"}}), EACCES},
-        {"connect over TCP", dict({{"do", "tcp"}, {"port", int64_t{tcp.port}}}), EACCES},
+        {"connect over TCP", dict({{"do", "tcp"}, {"port", int64_t{tcp.port}}}), 0},
         {"make an IPv4 socket", dict({{"do", "inet"}}), 0},
     };
     for (const Row& row : rows) EXPECT_EQ(session.errnoOf(row.message), row.expected) << row.what;
@@ -229,15 +267,15 @@ TEST(Spawnd, EachProfileGrantsWhatItNames) {
         int64_t inetErrno;
         int64_t homeWriteErrno;
     } rows[] = {
-        {"keyboard", EACCES, EACCES, 0},
+        {"keyboard", EAFNOSUPPORT, EAFNOSUPPORT, 0},
         {"network-filter", 0, 0, 0},
-        {"glancerd", EACCES, 0, EACCES},
+        {"glancerd", EAFNOSUPPORT, EAFNOSUPPORT, EACCES},
         {"sandpit-devtools", 0, 0, 0},
     };
     for (const Row& row : rows) {
         std::string identifier = std::string("com.example.") + row.profile;
-        std::string container = d.root / ("containers/" + std::string(row.profile));
-        ASSERT_EQ(d.add(::getpid(), d.plugIn(identifier), d.overlay(row.profile, container)), 0);
+        std::string container = containerOf(identifier);
+        ASSERT_EQ(d.add(::getpid(), d.plugIn(identifier), d.overlay(row.profile, identifier)), 0);
         Session session(identifier);
         ASSERT_TRUE(session.connection) << row.profile << ": " << session.connection.error().description();
         EXPECT_EQ(session.errnoOf(dict({{"do", "tcp"}, {"port", int64_t{tcp.port}}})), row.tcpErrno) << row.profile;
@@ -409,12 +447,7 @@ TEST(Spawnd, HostsTheTokenBrokerAndConsentAndStopsItsInstancesOnSigterm) {
 TEST(Spawnd, APlugInAndAHostWrittenInCTalkThroughTheLibrary) {
     Spawnd d;
     // The plug-in brings its copy of the library in its bundle.
-    fs::create_directories(d.root / "apps/C.app/PlugIns");
-    std::string bundle = axtest::makeBundle(d.root / "apps/C.app/PlugIns", "Echo.appex",
-                                            axtest::plugInInfo("com.example.c-echo", dict({}), "echo"),
-                                            axtest::binary("annexa_c_plugin"));
-    fs::copy_file(axtest::binary("../lib/libannexa.so.1"), bundle + "/libannexa.so.1");
-    ASSERT_EQ(d.add(::getpid(), bundle + "/echo", d.overlay("plugin", "")), 0);
+    ASSERT_EQ(d.add(::getpid(), d.cPlugIn("com.example.c-echo", "annexa_c_plugin"), d.overlay("plugin", "")), 0);
 
     char* error = nullptr;
     annexa_plugin* plugin = annexa_plugin_connect("com.example.c-echo", &error);
@@ -437,4 +470,221 @@ TEST(Spawnd, APlugInAndAHostWrittenInCTalkThroughTheLibrary) {
     EXPECT_EQ(annexa_plugin_connect("com.example.unregistered", &error), nullptr);
     EXPECT_NE(std::string(error).find("no service com.example.unregistered"), std::string::npos) << error;
     annexa_free(error);
+}
+
+namespace {
+
+// The processes whose parent is `parent` and that are zombies.
+int zombiesOf(pid_t parent) {
+    int zombies = 0;
+    for (const auto& entry : fs::directory_iterator("/proc")) {
+        std::string name = entry.path().filename();
+        if (name.find_first_not_of("0123456789") != std::string::npos) continue;
+        std::string stat = axtest::readFile(entry.path() / "stat");
+        size_t close = stat.rfind(')');
+        if (close == std::string::npos || close + 4 > stat.size()) continue;
+        char state = stat[close + 2];
+        pid_t ppid = std::atoi(stat.c_str() + close + 4);
+        if (ppid == parent && state == 'Z') ++zombies;
+    }
+    return zombies;
+}
+
+// A line of /proc/PID/status as a number (hexadecimal for the capability sets); -1 without it.
+int64_t statusField(pid_t pid, const std::string& field, int base) {
+    std::string status = axtest::readFile("/proc/" + std::to_string(pid) + "/status");
+    size_t at = status.find("\n" + field + ":");
+    if (at == std::string::npos) return -1;
+    return std::strtoll(status.c_str() + at + field.size() + 2, nullptr, base);
+}
+
+}  // namespace
+
+// The probe plug-in tries every way out of its sandbox under each profile; each attempt's outcome
+// is what the profile says: 0 where it may, a refusal everywhere else.
+TEST(Spawnd, TheSandboxHoldsUnderEveryProfile) {
+    Spawnd d;
+    TcpListener tcp;
+    ASSERT_NE(tcp.port, 0);
+    axtest::writeFile(d.root / "secret", "the user's own\n", 0644);
+    fs::create_directories(d.root / "outside");
+    fs::create_directories(containerOf("com.example.other"));
+    const std::vector<std::string> profiles = {"plugin", "keyboard", "network-filter", "glancerd", "sandpit-devtools"};
+    constexpr int64_t kRefused = -1;  // any error
+    struct Attempt {
+        const char* name;
+        std::vector<int64_t> expected;  // per profile, in the order above
+    };
+    auto everywhere = [](int64_t value) { return std::vector<int64_t>(5, value); };
+    const std::vector<int64_t> inetOnly = {0, EAFNOSUPPORT, 0, EAFNOSUPPORT, 0};
+    const Attempt attempts[] = {
+        {"write-home", {0, 0, 0, EACCES, 0}},
+        {"write-tmpdir", everywhere(0)},
+        {"write-outside", everywhere(EACCES)},
+        {"read-outside", everywhere(EACCES)},
+        {"write-other-container", everywhere(EACCES)},
+        {"mknod-device", everywhere(kRefused)},
+        {"unix", everywhere(0)},
+        {"tcp-connect", inetOnly},
+        {"tcp-bind", {EACCES, EAFNOSUPPORT, 0, EAFNOSUPPORT, 0}},
+        {"udp", inetOnly},
+        {"mptcp", everywhere(kRefused)},
+        {"raw-icmp", everywhere(kRefused)},
+        {"ping", everywhere(kRefused)},
+        {"packet", everywhere(EAFNOSUPPORT)},
+        {"netlink", everywhere(EAFNOSUPPORT)},
+        {"family-high-bits", everywhere(EAFNOSUPPORT)},
+        {"protocol-high-bits", everywhere(kRefused)},
+        {"socketpair-inet", everywhere(kRefused)},
+        {"x32-socket", everywhere(kRefused)},
+        {"i386-socketcall", everywhere(kRefused)},
+        {"io_uring", everywhere(EPERM)},
+        {"userfaultfd", everywhere(EPERM)},
+        {"perf_event_open", everywhere(EPERM)},
+        {"bpf", everywhere(EPERM)},
+        {"kexec_load", everywhere(EPERM)},
+        {"init_module", everywhere(EPERM)},
+        {"proc-other-environ", everywhere(EACCES)},
+        {"proc-other-cmdline", everywhere(EACCES)},
+        {"proc-other-fd", everywhere(EACCES)},
+        {"proc-self-status", everywhere(0)},
+        {"proc-thread-self", everywhere(0)},
+        {"capabilities-held", everywhere(0)},
+    };
+    for (size_t p = 0; p < profiles.size(); ++p) {
+        const std::string& profile = profiles[p];
+        std::string identifier = "com.example.probe." + profile;
+        // The overlay also tries to give the plug-in another HOME and TMPDIR: spawnd sets those.
+        Dictionary environment{{"PROBE_PORT", Value(std::to_string(tcp.port))},
+                               {"PROBE_OTHER_PID", Value(std::to_string(d.daemon->pid()))},
+                               {"PROBE_OUTSIDE", Value(d.root / "outside/written")},
+                               {"PROBE_SECRET", Value(d.root / "secret")},
+                               {"PROBE_OTHER_CONTAINER", Value(containerOf("com.example.other"))},
+                               {"HOME", Value(d.root.path())},
+                               {"TMPDIR", Value(d.root / "outside")}};
+        ASSERT_EQ(d.add(::getpid(), d.cPlugIn(identifier, "sandbox_probe"), d.overlay(profile, identifier, environment)), 0);
+        Session session(identifier);
+        ASSERT_TRUE(session.connection) << profile << ": " << session.connection.error().description();
+        Value outcomes = session.send(Value("battery"));
+        ASSERT_TRUE(outcomes.isDictionary()) << profile;
+        for (const Attempt& attempt : attempts) {
+            auto got = outcomes[attempt.name].int64Value();
+            ASSERT_TRUE(got) << profile << " " << attempt.name;
+            int64_t expected = attempt.expected[p];
+            if (expected == kRefused) {
+                EXPECT_NE(*got, 0) << profile << ": " << attempt.name << " was not refused";
+            } else {
+                EXPECT_EQ(*got, expected) << profile << ": " << attempt.name << " (" << std::strerror(static_cast<int>(*got)) << ")";
+            }
+        }
+        // Every capability set of the running instance is empty, whoever runs spawnd.
+        pid_t pid = static_cast<pid_t>(outcomes["pid"].int64Value().value_or(0));
+        for (const char* set : {"CapInh", "CapPrm", "CapEff", "CapBnd", "CapAmb"})
+            EXPECT_EQ(statusField(pid, set, 16), 0) << profile << " " << set;
+    }
+    EXPECT_FALSE(fs::exists(d.root / "outside/written"));
+    EXPECT_FALSE(fs::exists(d.root / "probe"));
+}
+
+// What one instance can do to spawnd and to the machine is bounded: its children are reaped, its
+// tasks and memory are limited, its busy reasons are cut, a symbolic link it puts in its container
+// is never followed, and nothing of it outlives a spawnd that is killed.
+TEST(Spawnd, AnInstanceCannotOutgrowItsBoundsOrOutliveSpawnd) {
+    Spawnd d;
+    std::string identifier = "com.example.probe";
+    std::string executable = d.cPlugIn(identifier, "sandbox_probe");
+    std::string container = containerOf(identifier);
+    fs::create_directories(d.root / "outside");
+    auto outsideMode = fs::status(d.root / "outside").permissions();
+    Value overlay = d.overlay("plugin", identifier, {{"PROBE_OUTSIDE_DIR", Value(d.root / "outside")}});
+    ASSERT_EQ(d.add(::getpid(), executable, overlay), 0);
+    bool bounded = d.daemon->waitForErr("instances are bounded to 256 tasks each", std::chrono::seconds(2));
+    {
+        Session session(identifier);
+        ASSERT_TRUE(session.connection) << session.connection.error().description();
+        // Children made with CLONE_PARENT are spawnd's; none stays a zombie.
+        EXPECT_EQ(session.send(Value("clone-parent"))["made"], Value(50));
+        EXPECT_TRUE(axtest::eventually([&] { return zombiesOf(d.daemon->pid()) == 0; }, std::chrono::milliseconds(1500)))
+            << zombiesOf(d.daemon->pid()) << " zombies";
+        // Memory past the limit is refused; tasks past it, where a cgroup bounds them.
+        if (!axtest::kAddressSanitizer) {
+            EXPECT_EQ(session.send(Value("memory"))["errno"], Value(ENOMEM));
+        }
+        int64_t made = session.send(Value("tasks"))["made"].int64Value().value_or(0);
+        if (bounded) {
+            EXPECT_LT(made, 256) << "tasks were not bounded";
+        }
+        // Busy reasons are cut to a kilobyte; spawnd does not grow with them.
+        EXPECT_EQ(session.send(Value("busy-flood"))["taken"], Value(64));
+        EXPECT_TRUE(axtest::eventually([&] {
+            auto busy = spawn::busyExtensionInstances({identifier});
+            return busy && busy->size() == 1 && (*busy)[0]["reason"].asString()->size() == 1024;
+        }));
+        if (!axtest::kAddressSanitizer) {  // whose quarantine keeps what was freed
+            EXPECT_LT(statusField(d.daemon->pid(), "VmRSS", 10), 40 * 1024) << "kB";
+        }
+
+        // A symbolic link where TMPDIR was: the next launch refuses it, naming the path, and nothing
+        // outside the container is touched.
+        EXPECT_EQ(session.send(Value("swap-tmp"))["errno"], Value(0));
+    }
+    ASSERT_EQ(d.remove(identifier), 0);
+    ASSERT_EQ(d.add(::getpid(), executable, overlay), 0);
+    auto refused = spawn::connectToService(identifier);
+    ASSERT_FALSE(refused);
+    EXPECT_NE(refused.error().description().find("a symbolic link is where the directory " + container + "/tmp should be"),
+              std::string::npos)
+        << refused.error().description();
+    EXPECT_TRUE(fs::is_empty(d.root / "outside"));
+    EXPECT_EQ(fs::status(d.root / "outside").permissions(), outsideMode);
+    fs::remove(container + "/tmp");
+    fs::rename(container + "/tmp.aside", container + "/tmp");
+
+    // spawnd killed: the instance dies with it, and what it started ends when spawnd starts again.
+    pid_t instance = 0, lingering = 0;
+    {
+        Session session(identifier);
+        ASSERT_TRUE(session.connection) << session.connection.error().description();
+        instance = static_cast<pid_t>(session.send(Value("battery"))["pid"].int64Value().value_or(0));
+        lingering = static_cast<pid_t>(session.send(Value("linger"))["pid"].int64Value().value_or(0));
+    }
+    ASSERT_GT(instance, 0);
+    ASSERT_GT(lingering, 0);
+    d.daemon->signal(SIGKILL);
+    d.daemon->wait();
+    EXPECT_TRUE(axtest::processGone(instance));
+    d.start();
+    if (bounded) {
+        EXPECT_TRUE(axtest::processGone(lingering)) << "pid " << lingering << " outlived its spawnd";
+    } else {
+        ::kill(lingering, SIGKILL);
+    }
+}
+
+// A host past its share of instances is refused with the reason, and spawnd runs no more instances
+// than its descriptor limit serves beside a reserve, so that vigild and new hosts stay served.
+TEST(Spawnd, ManyInstancesAreRefusedClearlyAndOthersStayServed) {
+    Spawnd d({"--instances-per-host", "3"}, {"/usr/bin/prlimit", "--nofile=300:300"});
+    EXPECT_TRUE(d.daemon->waitForErr("at most 43 instances run: the descriptor limit is 300")) << d.daemon->err();
+    std::vector<Session> sessions;
+    for (int i = 0; i < 4; ++i) {
+        std::string identifier = "com.example.many" + std::to_string(i);
+        ASSERT_EQ(d.add(::getpid(), d.plugIn(identifier), d.overlay("plugin", "")), 0);
+        if (i < 3) {
+            sessions.emplace_back(identifier);
+            ASSERT_TRUE(sessions.back().connection) << i << ": " << sessions.back().connection.error().description();
+            continue;
+        }
+        auto refused = spawn::connectToService(identifier);
+        ASSERT_FALSE(refused);
+        EXPECT_EQ(refused.error().code, EAGAIN);
+        EXPECT_NE(refused.error().description().find("too many instances for host " + std::to_string(::getpid())),
+                  std::string::npos)
+            << refused.error().description();
+    }
+    EXPECT_TRUE(spawn::busyExtensionInstances({"com.example.many0"}));
+    // Another host is served.
+    std::string hostPeer = d.signedPeer("host", dict({{spawn::kDomainExtensionProxyEntitlement, true}}));
+    axtest::Process host({hostPeer, "host", d.plugIn("com.example.other"), "com.example.other", d.overlay("plugin", "").description()});
+    EXPECT_TRUE(host.waitForOut("reply ")) << host.out() << host.err();
 }

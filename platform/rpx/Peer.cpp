@@ -55,6 +55,8 @@ std::shared_ptr<FileDescriptor> peerPidfd(int sock, pid_t pid) {
 
 }  // namespace
 
+uint64_t processStartTime(pid_t pid) { return startTimeOf(pid); }
+
 PeerIdentity internal::identityOfSocket(int sock) {
     struct ucred cred {};
     socklen_t len = sizeof cred;

@@ -68,6 +68,9 @@ struct PeerIdentity {
     AuditToken auditToken;
 };
 
+// A process's start time in clock ticks since boot (/proc/<pid>/stat), 0 when it cannot be read.
+uint64_t processStartTime(pid_t pid);
+
 // Reads the identity of a live process (what a listener does for each peer).
 PeerIdentity identityOfProcess(pid_t pid, uid_t uid, gid_t gid,
                                std::shared_ptr<FileDescriptor> pidfd);

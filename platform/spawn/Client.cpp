@@ -1,5 +1,6 @@
 // The client side of spawnd's endpoints and the plug-in's side of its control connection.
 #include <fcntl.h>
+#include <sys/prctl.h>
 
 #include <atomic>
 #include <cerrno>
@@ -88,6 +89,11 @@ Result<Array> busyExtensionInstances(const std::vector<std::string>& bundleIdent
     return *instances;
 }
 
+bool isReservedVariable(const std::string& name) {
+    return name == "HOME" || name == "TMPDIR" || name == "KFFIXED_USER_HOME" || name.rfind("XDG_", 0) == 0 ||
+           name.rfind("CORVANE_", 0) == 0;
+}
+
 // ---- the instance's side
 
 std::shared_ptr<InstanceControl> InstanceControl::fromEnvironment(dispatch::QueuePtr queue) {
@@ -98,6 +104,9 @@ std::shared_ptr<InstanceControl> InstanceControl::fromEnvironment(dispatch::Queu
     if (*end != '\0' || fd < 0 || fd > 1 << 20 || ::fcntl(static_cast<int>(fd), F_GETFD) < 0) return nullptr;
     auto control = rpx::Connection::adopt(std::make_shared<FileDescriptor>(static_cast<int>(fd)), std::move(queue));
     ::unsetenv(kControlDescriptorVariable);
+    // A plug-in's memory and its /proc entries are its own: other processes of the user, outside
+    // the sandbox, cannot read them or attach to it, and it leaves no core dump.
+    (void)::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
     return std::shared_ptr<InstanceControl>(new InstanceControl(std::move(control)));
 }
 

@@ -1,7 +1,12 @@
 // spawnd: domains of external services, instances and their lifecycle, busy assertions.
 #include "platform/spawn/Daemon.h"
 
+#include <fcntl.h>
+#include <linux/openat2.h>
 #include <signal.h>
+#include <sys/prctl.h>
+#include <sys/resource.h>
+#include <sys/signalfd.h>
 #include <sys/pidfd.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -10,20 +15,25 @@
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <deque>
 #include <map>
 #include <set>
 #include <thread>
 
 #include "platform/bundle/Bundle.h"
+#include "platform/containers/Containers.h"
 #include "platform/codesign/CodeSign.h"
 #include "platform/layout/Layout.h"
 #include "platform/log/Log.h"
 #include "platform/pcx/Pcx.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/spawn/Launch.h"
+#include "platform/spawn/Limits.h"
 #include "platform/spawn/Protocol.h"
 #include "platform/spawn/Spawn.h"
 #include "platform/spawn/Watcher.h"
@@ -72,6 +82,7 @@ struct Instance {
     uint64_t nextWaiting = 1;
     std::map<uint64_t, std::string> busy;
     uint64_t exitWatch = 0, acceptTimer = 0, idleTimer = 0, killTimer = 0;
+    InstanceLimits::Group group;
 
     std::string description() const {
         return registration.identifier + " (pid " + std::to_string(pid) + ", host " + std::to_string(host.pid) + ")";
@@ -108,7 +119,14 @@ bool wellShapedOverlay(const Value& overlay) {
         }
     }
     const Value* profile = service.find(protocol::kSandboxProfile);
-    return !profile || profile->isString();
+    if (profile && !profile->isString()) return false;
+    // A container is named, never given as a path.
+    const Value* container = service.find(protocol::kDataContainer);
+    if (container && (!container->isString() || container->asString()->empty() || container->asString()->front() == '.' ||
+                      container->asString()->find('/') != std::string::npos))
+        return false;
+    const Value* memory = service.find(protocol::kMemoryLimit);
+    return !memory || memory->uint64Value().has_value();
 }
 
 std::string signalName(int signal) {
@@ -126,15 +144,42 @@ std::shared_ptr<FileDescriptor> outputFor(const std::string& identifier) {
     return std::make_shared<FileDescriptor>(::fcntl(2, F_DUPFD_CLOEXEC, 3));
 }
 
+// A busy assertion's reason as it is kept: at most this many bytes, cut at a character's start.
+constexpr size_t kMaxReason = 1024;
+std::string keptReason(const std::string& reason) {
+    if (reason.size() <= kMaxReason) return reason;
+    size_t end = kMaxReason;
+    while (end > 0 && (static_cast<unsigned char>(reason[end]) & 0xc0) == 0x80) --end;
+    return reason.substr(0, end);
+}
+
+// Descriptors one instance holds (its pidfd, its control connection and room for connections being
+// handed over), and those kept free for new connections whatever the instances take.
+constexpr size_t kDescriptorsPerInstance = 4;
+constexpr size_t kDescriptorReserve = 64;
+
+// The soft descriptor limit spawnd was started with, which its instances start with too; spawnd
+// itself raises its own to the hard limit.
+std::atomic<uint64_t> gOriginalDescriptorLimit{0};
+uint64_t originalDescriptorLimit() { return gOriginalDescriptorLimit.load(); }
+
 }  // namespace
 
 // The service manager and the assertion service. Lives on: its queue.
 class Manager : public std::enable_shared_from_this<Manager> {
 public:
-    Manager(const Options& options, dispatch::QueuePtr queue)
-        : options_(options), queue_(std::move(queue)), watcher_(std::make_shared<Watcher>(queue_)) {}
+    Manager(const Options& options, dispatch::QueuePtr queue, size_t maxInstances)
+        : options_(options),
+          queue_(std::move(queue)),
+          watcher_(std::make_shared<Watcher>(queue_)),
+          limits_(options.tasksPerInstance),
+          maxInstances_(maxInstances) {}
 
     Status serve();
+    // Reaps every child that exited: instances (through instanceExited) and whatever an instance's
+    // processes left to spawnd, the subreaper of all of them. `signals` is a signalfd of SIGCHLD,
+    // watched from then on.
+    void reapChildren(std::shared_ptr<FileDescriptor> signals);
     // Ends every instance and waits (up to the grace period and a little) until they are gone.
     void stop();
 
@@ -153,9 +198,28 @@ private:
     void instanceExited(const InstancePtr& instance) REQUIRES(*queue_);
     void hostExited(const HostKey& host) REQUIRES(*queue_);
 
+    void reap() REQUIRES(*queue_);
+    // Reaps once a second while instances run (and once after the last).
+    void sweepWhileInstancesRun() REQUIRES(*queue_);
+    // Soon, on the queue: a child for the next launch, in a cgroup of its own (when there are
+    // cgroups and none is prepared yet).
+    void prepareNext() REQUIRES(*queue_);
+
     const Options options_;
     const dispatch::QueuePtr queue_;
     const std::shared_ptr<Watcher> watcher_;
+    InstanceLimits limits_ GUARDED_BY(*queue_);
+    const size_t maxInstances_;
+    bool sweeping_ GUARDED_BY(*queue_) = false;
+    bool stopping_ GUARDED_BY(*queue_) = false;
+    // Children in the cgroups of the next launches, two of them: the first made after a quiet while
+    // waits a grace period, which the launch after the next should not have to wait for.
+    struct Prepared {
+        std::unique_ptr<PreparedChild> child;
+        InstanceLimits::Group group;
+    };
+    static constexpr size_t kPrepared = 2;
+    std::deque<Prepared> prepared_ GUARDED_BY(*queue_);
     std::vector<std::shared_ptr<rpx::Listener>> listeners_;
     std::map<HostKey, Domain> domains_ GUARDED_BY(*queue_);
     std::set<InstancePtr> live_ GUARDED_BY(*queue_);
@@ -187,6 +251,19 @@ Status Manager::serve() {
         listeners_.push_back(*listener);
     }
     for (auto& listener : listeners_) listener->resume();
+    // This spawnd owns its endpoints now: what an earlier one for this user and runtime directory
+    // left running is ended before anything is launched.
+    queue_->sync([&] {
+        queue_->assertCurrent();
+        limits_.endLeftovers();
+        prepareNext();
+        if (limits_.bounded()) {
+            log::info(spawnLog(), "instances are bounded to %llu tasks each through %{public}@",
+                      static_cast<unsigned long long>(options_.tasksPerInstance), limits_.description());
+        } else {
+            log::notice(spawnLog(), "the tasks of plug-in instances are not bounded: no cgroup is delegated to spawnd");
+        }
+    });
     return {};
 }
 
@@ -286,6 +363,17 @@ void Manager::connect(const rpx::ConnectionPtr& host, uint64_t messageId, const 
         return host->sendReply(messageId, errorReply(ENOENT, "no service " + *identifier + " in the domain of pid " +
                                                                  std::to_string(token.pid)));
     }
+    auto running = domain->second.instances.find(*identifier);
+    bool launching = running == domain->second.instances.end() || !running->second || running->second->ending;
+    if (launching && domain->second.instances.size() >= options_.instancesPerHost) {
+        log::error(spawnLog(), "refused to launch %{public}@ for host %d: too many instances for that host", *identifier, token.pid);
+        return host->sendReply(messageId, errorReply(EAGAIN, "too many instances for host " + std::to_string(token.pid)));
+    }
+    if (launching && live_.size() >= maxInstances_) {
+        log::error(spawnLog(), "refused to launch %{public}@ for host %d: %zu instances run", *identifier, token.pid,
+                   live_.size());
+        return host->sendReply(messageId, errorReply(EAGAIN, "too many instances (" + std::to_string(live_.size()) + ")"));
+    }
     InstancePtr& instance = domain->second.instances[*identifier];
     if (instance && instance->ending) instance = nullptr;
     if (!instance) {
@@ -304,38 +392,115 @@ void Manager::connect(const rpx::ConnectionPtr& host, uint64_t messageId, const 
     handOver(instance, host, messageId);
 }
 
+namespace {
+
+// The bundle, opened as the directory it is (a symbolic link in its place is not followed), and
+// the executable found beneath it without leaving it.
+Result<std::shared_ptr<FileDescriptor>> openBundle(const Registration& registration) {
+    int fd = ::open(registration.bundlePath.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (fd < 0) return Error::posix(errno, "bundle " + registration.bundlePath);
+    auto bundle = std::make_shared<FileDescriptor>(fd);
+    const std::string prefix = registration.bundlePath + "/";
+    if (registration.executable.compare(0, prefix.size(), prefix) != 0)
+        return Error::posix(EACCES, "the executable " + registration.executable + " is not inside its bundle");
+    open_how how{};
+    how.flags = O_PATH | O_CLOEXEC;
+    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
+    std::string relative = registration.executable.substr(prefix.size());
+    long executable = ::syscall(SYS_openat2, bundle->get(), relative.c_str(), &how, sizeof how);
+    if (executable < 0)
+        return Error::posix(errno, "the executable " + registration.executable + " is not inside its bundle");
+    ::close(static_cast<int>(executable));
+    return bundle;
+}
+
+}  // namespace
+
 Result<InstancePtr> Manager::launchInstance(const HostKey& host, const Registration& registration) {
     const Value& service = registration.overlay[protocol::kService];
     std::map<std::string, std::string> environment;
     if (const Dictionary* variables = service[protocol::kEnvironment].asDictionary()) {
-        for (const auto& [name, value] : *variables) environment[name] = *value.asString();
+        // The reserved ones are set below, from the container opened here: no overlay (and no
+        // plug-in's own "EnvironmentVariables" in it) points them elsewhere.
+        for (const auto& [name, value] : *variables)
+            if (!isReservedVariable(name)) environment[name] = *value.asString();
     }
     if (!layout::root().empty()) environment["CORVANE_ROOT"] = layout::root();
     const std::string* profileName = service[protocol::kSandboxProfile].asString();
-    ConfinementPaths paths{registration.bundlePath, environment["HOME"], environment["TMPDIR"]};
-    for (const std::string* dir : {&paths.home, &paths.tmpdir}) {
-        if (dir->empty()) continue;
-        if (auto made = layout::makeDirectories(*dir, 0700); !made.ok()) return made.error();
+    auto bundle = openBundle(registration);
+    if (!bundle) return bundle.error();
+    ConfinementTargets targets{*bundle, nullptr, nullptr};
+    std::string workingDirectory = "/";
+    // The container comes by name and is opened here, beneath the user's containers, without
+    // following a symbolic link the plug-in may have put in it: its paths and the sandbox's rules
+    // are made from what was opened, never from an environment value.
+    if (const std::string* container = service[protocol::kDataContainer].asString()) {
+        auto home = containers::openDataContainer(containers::kPlugInDataClass, *container, true);
+        if (!home) return Error::posix(EACCES, home.error().description());
+        auto tmp = containers::openBeneath(*home, "tmp", true);
+        if (!tmp) return Error::posix(EACCES, tmp.error().description());
+        environment["HOME"] = home->path;
+        environment["KFFIXED_USER_HOME"] = home->path;
+        environment["TMPDIR"] = tmp->path;
+        environment["XDG_CONFIG_HOME"] = home->path + "/.config";
+        environment["XDG_DATA_HOME"] = home->path + "/.local/share";
+        environment["XDG_STATE_HOME"] = home->path + "/.local/state";
+        environment["XDG_CACHE_HOME"] = home->path + "/.cache";
+        targets.home = home->fd;
+        targets.tmpdir = tmp->fd;
+        workingDirectory = home->path;
     }
-    if (paths.home.empty()) environment.erase("HOME");
-    if (paths.tmpdir.empty()) environment.erase("TMPDIR");
-    auto confinement = prepareConfinement(profileName ? *profileName : "plugin", paths);
+    auto confinement = prepareConfinement(profileName ? *profileName : "plugin", targets);
     if (!confinement) return confinement.error();
+    // The extension point's memory, within bounds; the default otherwise.
+    auto asked = service[protocol::kMemoryLimit].uint64Value();
+    uint64_t memory = asked ? std::clamp<uint64_t>(*asked, uint64_t{16} << 20, uint64_t{64} << 30) : options_.memoryPerInstance;
+    uint64_t dataLimit = options_.memoryPerInstance == 0 ? 0 : memory;
+    // Its cgroup, with a child that has joined it already when one was prepared.
+    InstanceLimits::Group group;
+    std::unique_ptr<PreparedChild> prepared;
+    if (limits_.bounded()) {
+        if (!prepared_.empty()) {
+            group = std::move(prepared_.front().group);
+            prepared = std::move(prepared_.front().child);
+            prepared_.pop_front();
+        } else {
+            auto made = limits_.makeGroup();
+            if (!made) return made.error();
+            group = std::move(*made);
+        }
+        if (memory) limits_.setMemory(group, memory);
+    }
 
     int ends[2];
     if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return Error::posix(errno, "socketpair");
     auto ours = std::make_shared<FileDescriptor>(ends[0]);
     auto theirs = std::make_shared<FileDescriptor>(ends[1]);
-    LaunchSettings settings{registration.executable, environment, paths.home.empty() ? "/" : paths.home,
-                            *confinement, theirs, outputFor(registration.identifier)};
-    auto launched = launch(settings);
-    if (!launched) return launched.error();
+    LaunchSettings settings{registration.executable, environment, workingDirectory, *confinement, theirs,
+                            outputFor(registration.identifier), group.joins, dataLimit, originalDescriptorLimit()};
+    auto launched = launch(settings, std::move(prepared));
+    prepareNext();
+    if (!launched) {
+        limits_.endGroup(group);
+        return launched.error();
+    }
 
     auto instance = std::make_shared<Instance>();
     instance->host = host;
     instance->registration = registration;
     instance->pid = launched->pid;
     instance->pidfd = launched->pidfd;
+    instance->group = std::move(group);
+    // Recorded soon after, not on the way to the host's answer: its start time is readable only once
+    // its exec is complete. (Its pid names it until spawnd reaps it.)
+    std::weak_ptr<Instance> recorded = instance;
+    queue_->async([weak = weak_from_this(), recorded] {
+        auto self = weak.lock();
+        auto target = recorded.lock();
+        if (!self || !target) return;
+        self->queue_->assertCurrent();
+        if (!target->exited) self->limits_.record(target->pid, rpx::processStartTime(target->pid));
+    });
     instance->control = rpx::Connection::adopt(ours, queue_);
     std::weak_ptr<Manager> weak = weak_from_this();
     std::weak_ptr<Instance> weakInstance = instance;
@@ -355,6 +520,7 @@ Result<InstancePtr> Manager::launchInstance(const HostKey& host, const Registrat
         }
     });
     live_.insert(instance);
+    sweepWhileInstancesRun();
     log::info(spawnLog(), "launched %{public}@ in pid %d for host %d under the %{public}@ profile",
               registration.identifier, instance->pid, host.pid, confinement->profile);
     return instance;
@@ -424,7 +590,7 @@ void Manager::controlEvent(const InstancePtr& instance, const rpx::Event& ev) {
             log::error(spawnLog(), "%@ holds too many busy assertions; ignoring another", instance->description());
             return;
         }
-        instance->busy[*assertion] = *reason;
+        instance->busy[*assertion] = keptReason(*reason);
     } else if (auto assertion = message[protocol::kUnbusy].uint64Value()) {
         instance->busy.erase(*assertion);
     }
@@ -473,8 +639,10 @@ void Manager::instanceExited(const InstancePtr& instance) {
         // Readable but not reapable: someone else reaped it. Nothing more can be learnt.
         info.si_code = 0;
     }
-    // What it started ends with it.
+    // What it started ends with it: its process group, and its cgroup where it has one.
     ::kill(-instance->pid, SIGKILL);
+    limits_.endGroup(instance->group);
+    limits_.forget(instance->pid);
     instance->exited = true;
     for (uint64_t* timer : {&instance->acceptTimer, &instance->idleTimer, &instance->killTimer}) {
         if (*timer) watcher_->cancel(*timer);
@@ -510,6 +678,80 @@ void Manager::instanceExited(const InstancePtr& instance) {
     instance->waiting.clear();
 }
 
+void Manager::reapChildren(std::shared_ptr<FileDescriptor> signals) {
+    std::weak_ptr<Manager> weak = weak_from_this();
+    watcher_->whenReadable(signals->get(), [weak, signals] {
+        auto self = weak.lock();
+        if (!self) return;
+        self->queue_->assertCurrent();
+        signalfd_siginfo info[16];
+        while (::read(signals->get(), info, sizeof info) > 0) {
+        }
+        self->reap();
+        self->reapChildren(signals);
+    });
+    queue_->async([weak] {
+        if (auto self = weak.lock()) {
+            self->queue_->assertCurrent();
+            self->reap();
+        }
+    });
+}
+
+void Manager::reap() {
+    // __WALL: a child made with another exit signal than SIGCHLD (or none) is reaped too; such a
+    // child signals nothing when it exits, which is why the instances' lifetime has a sweep as well.
+    for (;;) {
+        siginfo_t info{};
+        if (::waitid(P_ALL, 0, &info, WEXITED | WNOHANG | WNOWAIT | __WALL) != 0 || info.si_pid == 0) break;
+        pid_t pid = info.si_pid;
+        auto found = std::find_if(live_.begin(), live_.end(), [&](const InstancePtr& i) { return i->pid == pid; });
+        if (found != live_.end()) {
+            InstancePtr instance = *found;  // instanceExited takes it out of live_
+            instanceExited(instance);       // and reaps it through its pidfd, with its status
+        } else {
+            // A process an instance started that was left to spawnd (re-parented, or made with
+            // CLONE_PARENT): nothing is waiting for it.
+            log::debug(spawnLog(), "reaped pid %d, which an instance left behind", pid);
+        }
+        ::waitpid(pid, nullptr, WNOHANG | __WALL);
+    }
+    limits_.sweep();
+}
+
+void Manager::prepareNext() {
+    std::weak_ptr<Manager> weak = weak_from_this();
+    queue_->async([weak] {
+        auto self = weak.lock();
+        if (!self) return;
+        self->queue_->assertCurrent();
+        if (self->prepared_.size() >= kPrepared || !self->limits_.bounded() || self->stopping_) return;
+        auto group = self->limits_.makeGroup();
+        if (!group) return;  // the next launch makes its group itself, and says why not
+        auto child = PreparedChild::make(group->joins);
+        if (!child) {
+            self->limits_.endGroup(*group);
+            return;
+        }
+        self->prepared_.push_back(Prepared{std::move(*child), std::move(*group)});
+        self->prepareNext();
+    });
+}
+
+void Manager::sweepWhileInstancesRun() {
+    if (sweeping_) return;
+    sweeping_ = true;
+    std::weak_ptr<Manager> weak = weak_from_this();
+    watcher_->after(std::chrono::seconds(1), [weak] {
+        auto self = weak.lock();
+        if (!self) return;
+        self->queue_->assertCurrent();
+        self->sweeping_ = false;
+        self->reap();
+        if (!self->live_.empty()) self->sweepWhileInstancesRun();
+    });
+}
+
 void Manager::hostExited(const HostKey& host) {
     auto domain = domains_.find(host);
     if (domain == domains_.end()) return;
@@ -540,12 +782,20 @@ void Manager::stop() {
     for (auto& listener : listeners_) listener->cancel();
     queue_->sync([&] {
         queue_->assertCurrent();
+        stopping_ = true;
+        for (Prepared& p : prepared_) {
+            p.child.reset();
+            limits_.endGroup(p.group);
+        }
+        prepared_.clear();
         for (const InstancePtr& instance : std::set<InstancePtr>(live_)) terminate(instance, "spawnd is stopping");
     });
     auto deadline = std::chrono::steady_clock::now() + options_.grace + std::chrono::milliseconds(500);
     while (std::chrono::steady_clock::now() < deadline) {
         bool empty = queue_->syncResult([&] {
             queue_->assertCurrent();
+            reap();
+            if (live_.empty()) limits_.removeAll();
             return live_.empty();
         });
         if (empty) return;
@@ -560,9 +810,32 @@ struct Daemon::Parts {
 };
 
 Result<std::unique_ptr<Daemon>> Daemon::start(const Options& options) {
+    // Whatever an instance's processes leave behind is re-parented to spawnd, which reaps it.
+    if (::prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0) != 0) return Error::posix(errno, "child subreaper");
+    sigset_t childSignal;
+    sigemptyset(&childSignal);
+    sigaddset(&childSignal, SIGCHLD);
+    int signals = ::signalfd(-1, &childSignal, SFD_NONBLOCK | SFD_CLOEXEC);
+    if (signals < 0) return Error::posix(errno, "signalfd");
+    auto childSignals = std::make_shared<FileDescriptor>(signals);
+    // Many instances need many descriptors: the soft limit goes up to the hard one, and the
+    // instances that fit beside a reserve are the most that run.
+    rlimit descriptors{};
+    ::getrlimit(RLIMIT_NOFILE, &descriptors);
+    gOriginalDescriptorLimit.store(descriptors.rlim_cur);
+    descriptors.rlim_cur = descriptors.rlim_max;
+    ::setrlimit(RLIMIT_NOFILE, &descriptors);
+    ::getrlimit(RLIMIT_NOFILE, &descriptors);
+    size_t room = descriptors.rlim_cur > kDescriptorReserve * 2 ? (descriptors.rlim_cur - kDescriptorReserve * 2) / kDescriptorsPerInstance : 1;
+    size_t maxInstances = std::min(options.instances, room);
+    if (maxInstances < options.instances)
+        log::notice(spawnLog(), "at most %zu instances run: the descriptor limit is %llu", maxInstances,
+                    static_cast<unsigned long long>(descriptors.rlim_cur));
+
     auto parts = std::make_unique<Parts>();
-    parts->manager = std::make_shared<Manager>(options, dispatch::Queue::create("com.corvane.spawnd"));
+    parts->manager = std::make_shared<Manager>(options, dispatch::Queue::create("com.corvane.spawnd"), maxInstances);
     if (auto served = parts->manager->serve(); !served.ok()) return served.error();
+    parts->manager->reapChildren(std::move(childSignals));
     auto broker = sandbox::Broker::start(dispatch::Queue::create("com.corvane.sandbox.broker"));
     if (!broker) return broker.error();
     parts->broker = std::move(*broker);

@@ -33,6 +33,11 @@ inline constexpr const char* kUnbusy = "unbusy";
 inline constexpr const char* kService = "RPXService";
 inline constexpr const char* kEnvironment = "EnvironmentVariables";
 inline constexpr const char* kSandboxProfile = "_SandboxProfile";
+// The plug-in's data container, by its identifier: spawnd opens it in the user's containers (class
+// 4) itself and makes HOME, TMPDIR and the XDG directories of it.
+inline constexpr const char* kDataContainer = "_DataContainer";
+// The memory the instance may use, in bytes (from the extension point's SDK definition).
+inline constexpr const char* kMemoryLimit = "_MemoryLimit";
 inline constexpr const char* kPackageType = "KFBundlePackageType";
 
 }  // namespace corvane::spawn::protocol

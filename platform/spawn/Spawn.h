@@ -40,6 +40,11 @@ inline constexpr const char* kPidKey = "pid";
 inline constexpr const char* kReasonKey = "reason";
 // Set in a launched instance's environment: the descriptor of its control connection.
 inline constexpr const char* kControlDescriptorVariable = "CORVANE_SPAWN_CONTROL_FD";
+// Whether an environment variable names the instance's container or its sandbox (HOME, TMPDIR,
+// KFFIXED_USER_HOME, XDG_*, CORVANE_*): spawnd sets these itself, last, from the container it
+// opens, and a value in an overlay is dropped.
+bool isReservedVariable(const std::string& name);
+
 // What removeExternalService answers when no domain holds the bundle.
 inline constexpr int kNothingOnRecord = 3;
 

@@ -12,6 +12,23 @@
 
 namespace axtest {
 
+// Whether this build runs under AddressSanitizer, whose programs reserve terabytes of address space
+// at their start (so no data limit fits them).
+#if defined(__has_feature)
+#if __has_feature(address_sanitizer)
+inline constexpr bool kAddressSanitizer = true;
+#else
+inline constexpr bool kAddressSanitizer = false;
+#endif
+#else
+inline constexpr bool kAddressSanitizer = false;
+#endif
+
+// spawnd's options for this build: under the sanitizers its instances get no data limit.
+inline std::vector<std::string> spawndOptions() {
+    return kAddressSanitizer ? std::vector<std::string>{"--memory-mib", "0"} : std::vector<std::string>{};
+}
+
 // A fresh directory under /tmp, removed with everything in it on destruction.
 class TempDir {
 public:
