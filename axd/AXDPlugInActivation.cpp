@@ -1,5 +1,6 @@
 // Getting a plug-in ready for a host: the activation overlay registered with the service manager,
 // and whether any process of the plug-in is busy.
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 
@@ -8,6 +9,8 @@
 #include "axd/AXDPlugIn.h"
 #include "axd/AXDRpxClient.h"
 #include "platform/pcx/Pcx.h"
+#include "platform/sdk/Sdk.h"
+#include "platform/spawn/Protocol.h"
 #include "platform/spawn/Spawn.h"
 
 namespace annexa {
@@ -52,19 +55,11 @@ Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
     const std::string identifier = identifierText(*this);
     const std::string uuid = uuidText(*this);
     const std::string version = versionText(*this);
+    // The environment: the daemon's AXTEST_SDK, then the plug-in's own variables, then, last, those
+    // that name its container, which the plug-in cannot replace (spawnd sets them again from the
+    // container it opens itself).
     Dictionary environment;
-    auto record = vtproxy();
-    if (record && record->dataContainerPath()) {
-        const std::string& container = *record->dataContainerPath();
-        environment["HOME"] = Value(container);
-        environment["KFFIXED_USER_HOME"] = Value(container);
-        environment["TMPDIR"] = Value(container + "/tmp");
-    } else {
-        log::debug(logOps(), "no data container for plug-in %@(%@) %{public}@ at %@", identifier, version, uuid, path());
-    }
-    std::string profile = sandboxProfile();
     if (const char* sdk = std::getenv("AXTEST_SDK")) environment["AXTEST_SDK"] = Value(sdk);
-
     Dictionary service;
     Value raw = infoKey("RPXService");
     if (raw.isDictionary()) {
@@ -74,8 +69,25 @@ Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
         log::info(logOps(), "no RPXService for plug-in; database returned %@", raw);
     }
     if (const Dictionary* own = service["EnvironmentVariables"].asDictionary()) {
-        for (const auto& [name, value] : *own) environment[name] = value;
+        for (const auto& [name, value] : *own)
+            if (!corvane::spawn::isReservedVariable(name)) environment[name] = value;
     }
+    service.erase(corvane::spawn::protocol::kDataContainer);
+    service.erase(corvane::spawn::protocol::kMemoryLimit);
+    auto record = vtproxy();
+    if (record && record->dataContainerPath()) {
+        const std::string& container = *record->dataContainerPath();
+        environment["HOME"] = Value(container);
+        environment["KFFIXED_USER_HOME"] = Value(container);
+        environment["TMPDIR"] = Value(container + "/tmp");
+        service[corvane::spawn::protocol::kDataContainer] = Value(container.substr(container.rfind('/') + 1));
+    } else {
+        log::debug(logOps(), "no data container for plug-in %@(%@) %{public}@ at %@", identifier, version, uuid, path());
+    }
+    // The extension point's memory for its sandboxes (MiB in its SDK definition).
+    if (auto mib = pluginKey(corvane::sdk::kSandboxMemoryLimit).uint64Value(); mib && *mib > 0)
+        service[corvane::spawn::protocol::kMemoryLimit] = Value(std::min<uint64_t>(*mib, uint64_t{1} << 16) << 20);
+    std::string profile = sandboxProfile();
     service["EnvironmentVariables"] = Value(std::move(environment));
     service["_SandboxProfile"] = Value(profile);
     service["_OmitSandboxParameters"] = Value(true);

@@ -34,7 +34,7 @@ std::optional<Value> readDefinition(const std::string& identifier) {
     return std::move(*v);
 }
 
-bool sdkOverridesKey(std::string_view key) { return key == "CleanTimeout"; }
+bool sdkOverridesKey(std::string_view key) { return key == "CleanTimeout" || key == kSandboxMemoryLimit; }
 
 Value mergeSharedResources(const Value& sdkList, const Value& pluginList) {
     Array result = listOf(pluginList);
@@ -84,13 +84,22 @@ Resolved resolve(const Value& info) {
         r.invalidSdkKey = true;
         return r;
     }
+    Value sdkMemoryLimit;
     if (const std::string* id = point.asString()) {
         if (auto definition = readDefinition(*id)) {
             r.info = mergeDictionary(*definition, info);
             r.plugin = r.info["KSExtension"];
+            sdkMemoryLimit = (*definition)["KSExtension"][kSandboxMemoryLimit];
         }
     }
     r.plugin = canonicalPlugInDictionary(r.plugin, r.info);
+    // A sandbox's memory is the extension point's to set, never the plug-in's: a value the plug-in
+    // wrote itself is dropped.
+    if (sdkMemoryLimit.isNull() && r.plugin.has(kSandboxMemoryLimit)) {
+        Dictionary plugin = *r.plugin.asDictionary();
+        plugin.erase(kSandboxMemoryLimit);
+        r.plugin = Value(std::move(plugin));
+    }
     return r;
 }
 

@@ -20,6 +20,10 @@ namespace corvane::sdk {
 // <shared data>/sdk under the platform root.
 std::string sdkDirectory();
 
+// The memory (MiB) a sandboxed plug-in of the extension point may use; only an SDK definition sets
+// it (it replaces the plug-in's own value, and a plug-in's own is dropped without one).
+inline constexpr const char* kSandboxMemoryLimit = "SandboxMemoryLimit";
+
 // The definition of an extension point, or nullopt when none is registered, it cannot be read, or
 // it is not a dictionary. Identifiers that could name another file (empty, containing '/', or
 // starting with '.') are never looked up.

@@ -10,6 +10,7 @@
 
 #include "Annexa/AXDaemonClient.h"
 #include "platform/codesign/CodeSign.h"
+#include "platform/layout/Layout.h"
 #include "platform/pcx/Pcx.h"
 #include "platform/rpx/Rpx.h"
 #include "platform/spawn/Spawn.h"
@@ -75,7 +76,12 @@ struct Platform {
         for (const Made& m : made) {
             Value info = axtest::plugInInfo(m.identifier, m.plugin, "Sample");
             Dictionary withService = *info.asDictionary();
-            withService["RPXService"] = dict({{"EnvironmentVariables", dict({{"GREETING", "hello"}})}, {"JoinExistingSession", true}});
+            // The plug-in's own variables; those that name its container are not its to set.
+            withService["RPXService"] = dict({{"EnvironmentVariables", dict({{"GREETING", "hello"},
+                                                                             {"HOME", Value(root.path())},
+                                                                             {"TMPDIR", "/tmp"},
+                                                                             {"XDG_DATA_HOME", Value(root.path())}})},
+                                              {"JoinExistingSession", true}});
             axtest::makeBundle(app + "/PlugIns", std::string(m.identifier) + ".appex", Value(std::move(withService)), sample);
         }
         auto added = axctl({"add", app});
@@ -90,10 +96,16 @@ struct Platform {
     ~Platform() {
         axd->signal(SIGTERM);
         axd->wait(5s);
+        if (spawnd) {
+            spawnd->signal(SIGTERM);
+            spawnd->wait(5s);
+        }
     }
 
     void startSpawnd() {
-        spawnd = std::make_unique<axtest::Process>(std::vector<std::string>{axtest::binary("spawnd"), "--grace-ms", "300"}, kDebugLog);
+        std::vector<std::string> args{axtest::binary("spawnd"), "--grace-ms", "300"};
+        for (const auto& o : axtest::spawndOptions()) args.push_back(o);
+        spawnd = std::make_unique<axtest::Process>(args, kDebugLog);
         EXPECT_TRUE(axtest::eventually([] { return axtest::endpointAnswers(rpx::endpointPath(spawn::kEndpoint)); }));
     }
 
@@ -123,11 +135,14 @@ TEST(Activation, AHostRunsAPlugInUnderTheProfileOfItsExtensionPoint) {
     Platform p;
     Value inside = p.run("com.example.greeter", dict({{"do", "environment"}}));
     const Value& environment = inside["environment"];
-    // The data container, the daemon's test SDK and the plug-in's own variables.
+    // The data container, the daemon's test SDK and the plug-in's own variables, but for those that
+    // name its container: those are the platform's.
     const std::string* home = environment["HOME"].asString();
     ASSERT_TRUE(home) << inside.description();
+    EXPECT_EQ(*home, layout::userDataDir() + "/containers/4/com.example.greeter");
     EXPECT_EQ(environment["KFFIXED_USER_HOME"], Value(*home));
     EXPECT_EQ(environment["TMPDIR"], Value(*home + "/tmp"));
+    EXPECT_EQ(environment["XDG_DATA_HOME"], Value(*home + "/.local/share"));
     EXPECT_EQ(environment["AXTEST_SDK"], Value("sdk-under-test"));
     EXPECT_EQ(environment["GREETING"], Value("hello"));
     EXPECT_EQ(inside["directory"], Value(*home));
@@ -138,6 +153,7 @@ TEST(Activation, AHostRunsAPlugInUnderTheProfileOfItsExtensionPoint) {
                                                  dict({{"AXTEST_SDK", "sdk-under-test"}, {"GREETING", "hello"}, {"HOME", *home},
                                                        {"KFFIXED_USER_HOME", *home}, {"TMPDIR", *home + "/tmp"}})},
                                                 {"JoinExistingSession", true},
+                                                {"_DataContainer", "com.example.greeter"},
                                                 {"_OmitSandboxParameters", true},
                                                 {"_SandboxProfile", "plugin"}})},
                            {"KFBundlePackageType", "RPX!"}});
@@ -151,9 +167,9 @@ TEST(Activation, AHostRunsAPlugInUnderTheProfileOfItsExtensionPoint) {
         const char* profile;
         int64_t inetErrno;
     } rows[] = {
-        {"com.example.keys", "keyboard", EACCES},
+        {"com.example.keys", "keyboard", EAFNOSUPPORT},
         {"com.example.filter", "network-filter", 0},
-        {"com.example.preview", "glancerd", 0},
+        {"com.example.preview", "glancerd", EAFNOSUPPORT},
     };
     for (const Row& row : rows) {
         EXPECT_EQ(p.run(row.identifier, dict({{"do", "inet"}}))["errno"], Value(row.inetErrno)) << row.identifier;
