@@ -1,6 +1,5 @@
 // The client side of spawnd's endpoints and the plug-in's side of its control connection.
 #include <fcntl.h>
-#include <sys/prctl.h>
 
 #include <atomic>
 #include <cerrno>
@@ -104,9 +103,6 @@ std::shared_ptr<InstanceControl> InstanceControl::fromEnvironment(dispatch::Queu
     if (*end != '\0' || fd < 0 || fd > 1 << 20 || ::fcntl(static_cast<int>(fd), F_GETFD) < 0) return nullptr;
     auto control = rpx::Connection::adopt(std::make_shared<FileDescriptor>(static_cast<int>(fd)), std::move(queue));
     ::unsetenv(kControlDescriptorVariable);
-    // A plug-in's memory and its /proc entries are its own: other processes of the user, outside
-    // the sandbox, cannot read them or attach to it, and it leaves no core dump.
-    (void)::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
     return std::shared_ptr<InstanceControl>(new InstanceControl(std::move(control)));
 }
 
