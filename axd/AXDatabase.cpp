@@ -88,17 +88,17 @@ std::vector<AXDPlugInPtr> AXDatabase::plugInsForUUIDs(const std::vector<UUID>& u
     return result;
 }
 
-AXDPlugInPtr AXDatabase::findPlugInAtPath(const std::string& path) {
-    auto record = workspace_->plugInForPath(path);
+AXDPlugInPtr AXDatabase::findPlugInAtPath(const std::string& canonicalPath) {
+    auto record = workspace_->plugInAtCanonicalPath(canonicalPath);
     if (!record) {
-        log::info(logOps(), "Vantry cannot find plug-in at path:%@", path);
+        log::info(logOps(), "Vantry cannot find plug-in at path:%@", canonicalPath);
         return nullptr;
     }
     return findPlugIn(record->uuid());
 }
 
-std::optional<std::vector<AXDPlugInPtr>> AXDatabase::plugInsWithinApplication(const std::string& path) {
-    auto app = workspace_->applicationForPath(path);
+std::optional<std::vector<AXDPlugInPtr>> AXDatabase::plugInsWithinApplication(const std::string& canonicalPath) {
+    auto app = workspace_->applicationAtCanonicalPath(canonicalPath);
     auto records = app ? app->plugIns() : std::vector<PlugInRecordPtr>{};
     if (records.empty()) return std::nullopt;
     std::vector<AXDPlugInPtr> result;

@@ -55,7 +55,8 @@ public:
     // The same for many UUIDs in one visit to the database queue, in order; the lookups stop at the
     // first UUID that names no plug-in (null there and after it), as a walk over them stops there.
     std::vector<AXDPlugInPtr> plugInsForUUIDs(const std::vector<UUID>& uuids);
-    AXDPlugInPtr findPlugInAtPath(const std::string& path);
+    // `canonicalPath` as layout::canonicalPath gives it (requests resolve their paths once).
+    AXDPlugInPtr findPlugInAtPath(const std::string& canonicalPath);
     // `findPlugIns:`: the candidates for a host's pattern dictionary (null or empty: every
     // installed plug-in), in the registry's order, each once; the registry drops plug-ins whose
     // election the query's "KSUserElection" excludes before any record is built. Called on the
@@ -68,8 +69,8 @@ public:
     static std::string electionText(const Value& annotation, const Value& autoElect);
     std::string electionText(const AXDPlugIn& plugIn);
 
-    // Null (not empty) when the application has no plug-ins or is not known.
-    std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& path);
+    // Null (not empty) when the application has no plug-ins or is not known; a canonical path.
+    std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& canonicalPath);
     Status addPlugIn(const std::string& path);
     Status removePlugIn(const std::string& path);
 

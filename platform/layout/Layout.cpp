@@ -1,10 +1,12 @@
 #include "platform/layout/Layout.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <climits>
+#include <cstdio>
 #include <cstdlib>
 
 namespace corvane::layout {
@@ -82,7 +84,20 @@ Status makeDirectories(const std::string& path, mode_t mode) {
 }
 
 std::optional<std::string> canonicalPath(const std::string& path) {
+    // The kernel resolves the whole path once and names what it found: three system calls where
+    // realpath(3) reads every component's link. O_PATH opens nothing (a FIFO or device is not
+    // touched). Where /proc cannot say (not mounted, or the file went away), realpath decides.
+    int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
+    if (fd < 0) return std::nullopt;
+    char link[32];
+    std::snprintf(link, sizeof link, "/proc/self/fd/%d", fd);
     char buf[PATH_MAX];
+    ssize_t n = ::readlink(link, buf, sizeof buf);
+    struct stat st {};
+    bool named = n > 0 && static_cast<size_t>(n) < sizeof buf && buf[0] == '/' && ::fstat(fd, &st) == 0 &&
+                 st.st_nlink > 0;
+    ::close(fd);
+    if (named) return std::string(buf, static_cast<size_t>(n));
     if (!realpath(path.c_str(), buf)) return std::nullopt;
     return std::string(buf);
 }

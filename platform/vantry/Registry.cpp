@@ -24,12 +24,20 @@ const std::string& Registry::path() const { return store_->path(); }
 PlugInRecordPtr Registry::plugInForUUID(const UUID& uuid) { return store_->plugInForUUID(uuid); }
 
 PlugInRecordPtr Registry::plugInForPath(const std::string& bundlePath) {
-    auto found = store_->selectPlugIns("WHERE path = ?", {layout::canonicalPath(bundlePath).value_or(bundlePath)});
-    return found.empty() ? nullptr : found.front();
+    return plugInAtCanonicalPath(layout::canonicalPath(bundlePath).value_or(bundlePath));
 }
 
 ApplicationRecordPtr Registry::applicationForPath(const std::string& bundlePath) {
-    return store_->applicationForPath(layout::canonicalPath(bundlePath).value_or(bundlePath));
+    return applicationAtCanonicalPath(layout::canonicalPath(bundlePath).value_or(bundlePath));
+}
+
+PlugInRecordPtr Registry::plugInAtCanonicalPath(const std::string& canonicalPath) {
+    auto found = store_->selectPlugIns("WHERE path = ?", {canonicalPath});
+    return found.empty() ? nullptr : found.front();
+}
+
+ApplicationRecordPtr Registry::applicationAtCanonicalPath(const std::string& canonicalPath) {
+    return store_->applicationForPath(canonicalPath);
 }
 
 std::vector<PlugInRecordPtr> Registry::installedPlugIns() { return store_->selectPlugIns("ORDER BY path", {}); }

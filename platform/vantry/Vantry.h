@@ -142,6 +142,9 @@ public:
     PlugInRecordPtr plugInForUUID(const UUID& uuid);
     PlugInRecordPtr plugInForPath(const std::string& bundlePath);
     ApplicationRecordPtr applicationForPath(const std::string& bundlePath);
+    // The same for a path already in canonical form (layout::canonicalPath), not resolved again.
+    PlugInRecordPtr plugInAtCanonicalPath(const std::string& canonicalPath);
+    ApplicationRecordPtr applicationAtCanonicalPath(const std::string& canonicalPath);
     std::vector<PlugInRecordPtr> installedPlugIns();
     // Every registered application, with or without plug-ins, ordered by bundle path.
     std::vector<ApplicationRecordPtr> installedApplications();
