@@ -146,8 +146,13 @@ void Transaction::fetchReceipt() {
         }
     }
     if (!receipt) return failMessage(AXErrorCode::ReceiptUnavailable, "unable to locate receipt location");
-    auto bytes = corvane::plist::readWholeFile(*receipt);
-    if (!bytes) return failMessage(AXErrorCode::ReceiptUnavailable, "cannot locate containing receipt");
+    // The application's file, which may have been swapped for a FIFO, a device or a huge file since
+    // it was registered: read without blocking and only up to its limit.
+    auto bytes = corvane::bundle::readFileOfBundle(*receipt, corvane::bundle::kMaxReceiptSize);
+    if (!bytes) {
+        log::error(logOps(), "cannot read the receipt for client %d: %{public}@", client_->pid(), bytes.error());
+        return failMessage(AXErrorCode::ReceiptUnavailable, "cannot locate containing receipt");
+    }
     reply_[message::kData] = Value::data(bytes->data(), bytes->size());
     done();
 }

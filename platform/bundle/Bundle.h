@@ -57,7 +57,29 @@ private:
     mutable std::optional<Value> info_ GUARDED_BY(mutex_);
 };
 
-// Reads the Info.plist of the bundle directory `path` without caching anything.
+// Reads the Info.plist of the bundle directory `path` without caching anything (null when it
+// cannot be read; readPropertyListOfBundle says why).
 Value readInfoPlist(const std::string& path);
+
+// ---- reading what a bundle holds, or a file a client named: the one way every daemon does it
+
+// The most a property list of a bundle (Info.plist, Names/*.plist, Signature.plist, an SDK
+// definition) and a receipt may weigh; larger ones are refused, never read.
+inline constexpr size_t kMaxPropertyListSize = size_t{1} << 20;
+inline constexpr size_t kMaxReceiptSize = size_t{1} << 20;
+// The most an executable may weigh to be hashed for its signature.
+inline constexpr uint64_t kMaxExecutableSize = uint64_t{512} << 20;
+
+// Opens the file for reading without blocking (a FIFO is refused, never waited on), without
+// following a symbolic link in its last component unless `followLinks` (kernel links such as
+// /proc/<pid>/exe need it), and only when it is a regular file. The descriptor (close-on-exec), or an
+// error that names the path and the reason; a missing file is Error::file's kFileNoSuchFile.
+Result<std::shared_ptr<FileDescriptor>> openFileOfBundle(const std::string& path, bool followLinks = false);
+// The whole file when it is at most `limit` bytes; a larger one is an error.
+Result<std::string> readFileOfBundle(const std::string& path, size_t limit, bool followLinks = false);
+// The same for a file openFileOfBundle opened (`path` names it in errors).
+Result<std::string> readOpenedFile(int fd, const std::string& path, size_t limit);
+// The property list in the file (at most kMaxPropertyListSize bytes).
+Result<Value> readPropertyListOfBundle(const std::string& path, bool followLinks = false);
 
 }  // namespace corvane::bundle

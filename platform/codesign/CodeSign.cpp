@@ -83,6 +83,9 @@ Bytes signedMessage(const std::string& identifier, SignatureFile::Covers covers,
 }
 
 std::optional<Bytes> hashFd(int fd) {
+    // A file too large to be a program is not hashed (it would hold whoever asks for seconds).
+    struct stat st {};
+    if (::fstat(fd, &st) != 0 || static_cast<uint64_t>(st.st_size) > bundle::kMaxExecutableSize) return std::nullopt;
     crypto_hash_sha256_state state;
     crypto_hash_sha256_init(&state);
     unsigned char buf[65536];
@@ -143,10 +146,9 @@ std::optional<Bytes> contentsHash(const std::string& bundlePath) {
             if (n < 0) return std::nullopt;
             feed('L', rel + '\0' + std::string(target, static_cast<size_t>(n)));
         } else if (S_ISREG(st.st_mode)) {
-            int fd = ::open(full.c_str(), O_RDONLY | O_CLOEXEC);
-            if (fd < 0) return std::nullopt;
-            auto fileHash = hashFd(fd);
-            ::close(fd);
+            auto file = bundle::openFileOfBundle(full);  // what it is now, not what lstat saw
+            if (!file) return std::nullopt;
+            auto fileHash = hashFd((*file)->get());
             if (!fileHash) return std::nullopt;
             feed('F', rel + '\0' + hex(*fileHash));
         }
@@ -219,24 +221,23 @@ Verification verifyOpened(int exeFd, const std::string& path) {
     struct stat exeStat {};
     if (fstat(exeFd, &exeStat) != 0 || !S_ISREG(exeStat.st_mode)) return invalid(path, "not a file");
     std::string sigPath = signaturePath(path);
-    int sigFd = ::open(sigPath.c_str(), O_RDONLY | O_CLOEXEC);
-    if (sigFd < 0) return unsignedFile(exeStat, path);
+    auto sig = bundle::openFileOfBundle(sigPath);
+    if (!sig) {
+        const Error& e = sig.error();
+        if (e.domain == kFileErrorDomain && e.code == kFileNoSuchFile) return unsignedFile(exeStat, path);
+        return invalid(path, "signature unreadable: " + e.description());
+    }
     struct stat sigStat {};
-    fstat(sigFd, &sigStat);
+    fstat((*sig)->get(), &sigStat);
     auto key = std::make_pair(idOf(exeStat), idOf(sigStat));
     {
         MutexLock lock(gCacheMutex);
         auto it = cache().find(key);
-        if (it != cache().end()) {
-            ::close(sigFd);
-            return it->second;
-        }
+        if (it != cache().end()) return it->second;
     }
-    std::string bytes;
-    char buf[65536];
-    ssize_t n;
-    while ((n = read(sigFd, buf, sizeof buf)) > 0 && bytes.size() < (1u << 20)) bytes.append(buf, static_cast<size_t>(n));
-    ::close(sigFd);
+    auto read = bundle::readOpenedFile((*sig)->get(), sigPath, bundle::kMaxPropertyListSize);
+    if (!read) return invalid(path, "signature unreadable: " + read.error().description());
+    const std::string& bytes = *read;
 
     Verification v;
     auto file = parseSignature(bytes);
@@ -272,7 +273,7 @@ Verification verifyOpened(int exeFd, const std::string& path) {
 // bundle may change; such bundles are small.
 Verification verifyContents(const std::string& bundlePath) {
     if (!sodiumReady()) return invalid(bundlePath, "no crypto library");
-    auto bytes = plist::readWholeFile(bundlePath + "/" + bundle::kSignatureFileName);
+    auto bytes = bundle::readFileOfBundle(bundlePath + "/" + bundle::kSignatureFileName, bundle::kMaxPropertyListSize);
     if (!bytes) {
         struct stat st {};
         std::string info = bundlePath + "/Info.plist";
@@ -308,11 +309,9 @@ std::string signaturePath(const std::string& path) {
 }
 
 Verification verifyExecutable(const std::string& path) {
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return invalid(path, std::string("cannot open: ") + std::strerror(errno));
-    Verification v = verifyOpened(fd, path);
-    ::close(fd);
-    return v;
+    auto file = bundle::openFileOfBundle(path, true);
+    if (!file) return invalid(path, "cannot open: " + file.error().description());
+    return verifyOpened((*file)->get(), path);
 }
 
 Verification verifyBundle(const std::string& bundlePath) {

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+#include "platform/bundle/Bundle.h"
 #include "platform/layout/Layout.h"
 #include "platform/plist/Plist.h"
 
@@ -29,7 +30,8 @@ std::optional<Value> readDefinition(const std::string& identifier) {
     if (identifier.empty() || identifier[0] == '.' || identifier.find('/') != std::string::npos ||
         identifier.find('\0') != std::string::npos)
         return std::nullopt;
-    auto v = plist::readFile(sdkDirectory() + "/" + identifier + ".plist");
+    // A system file, which may be a link the distribution made; bounded and never blocking all the same.
+    auto v = bundle::readPropertyListOfBundle(sdkDirectory() + "/" + identifier + ".plist", true);
     if (!v || !v->isDictionary()) return std::nullopt;
     return std::move(*v);
 }

@@ -10,6 +10,7 @@
 
 #include "platform/codesign/CodeSign.h"
 #include "platform/containers/Containers.h"
+#include "platform/bundle/Bundle.h"
 #include "platform/layout/Layout.h"
 #include "platform/plist/Plist.h"
 #include "platform/sdk/Sdk.h"
@@ -62,7 +63,7 @@ std::vector<std::string> languages() {
 LocalizedNames localizedNames(const std::string& bundle, const Value& info) {
     Value table;
     for (const auto& lang : languages()) {
-        auto t = plist::readFile(bundle + "/Names/" + lang + ".plist");
+        auto t = bundle::readPropertyListOfBundle(bundle + "/Names/" + lang + ".plist");
         if (t && t->isDictionary()) {
             table = *t;
             break;
@@ -77,9 +78,22 @@ LocalizedNames localizedNames(const std::string& bundle, const Value& info) {
     return {display ? display : shortName, shortName};
 }
 
+Result<Value> readInfoDictionary(const std::string& bundlePath) {
+    std::string file = bundlePath + "/Info.plist";
+    auto info = bundle::readPropertyListOfBundle(file);
+    if (!info) {
+        const Error& e = info.error();
+        if (e.domain == kFileErrorDomain && e.code == kFileNoSuchFile) return refusal("missing Info.plist in " + bundlePath);
+        if (e.domain == kFileErrorDomain) return refusal("unreadable Info.plist: " + e.description());
+        return refusal("malformed Info.plist: " + e.description());
+    }
+    if (!info->isDictionary()) return refusal("malformed Info.plist: " + file + " holds no dictionary");
+    return info;
+}
+
 Result<Value> readPlugInInfo(const std::string& path) {
-    auto info = plist::readFile(path + "/Info.plist");
-    if (!info || !info->isDictionary()) return refusal("malformed or missing Info.plist in " + path);
+    auto info = readInfoDictionary(path);
+    if (!info) return info.error();
     if (!(*info)["KSExtension"].isDictionary()) return refusal("no plug-in dictionary (KSExtension) in " + path);
     auto extId = stringAt((*info)["KSExtension"], "KSExtensionIdentifier");
     if (!extId && stringAt(*info, "KFBundleIdentifier").value_or("").empty())
@@ -115,8 +129,8 @@ Status checkBundle(const std::string& given) {
     auto path = layout::canonicalPath(given);
     struct stat st {};
     if (!path || ::stat(path->c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return refusal("not a bundle: " + given);
-    auto info = plist::readFile(*path + "/Info.plist");
-    if (!info || !info->isDictionary()) return refusal("malformed or missing Info.plist in " + *path);
+    auto info = readInfoDictionary(*path);
+    if (!info) return info.error();
     if ((*info)["KSExtension"].isDictionary()) return readPlugInInfo(*path).status();
     if (!stringAt(*info, "KFBundleIdentifier"))
         return refusal("application without identifier (KFBundleIdentifier): " + *path);

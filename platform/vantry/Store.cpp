@@ -375,8 +375,8 @@ Status Store::registerBundle(const std::string& given, bool placeholder) {
     auto path = layout::canonicalPath(given);
     struct stat st {};
     if (!path || ::stat(path->c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return refusal("not a bundle: " + given);
-    auto info = plist::readFile(*path + "/Info.plist");
-    if (!info || !info->isDictionary()) return refusal("malformed or missing Info.plist in " + *path);
+    auto info = readInfoDictionary(*path);
+    if (!info) return info.error();
     if ((*info)["KSExtension"].isDictionary()) return registerPlugIn(*path);
     return registerApplication(*path, *info, placeholder);
 }

@@ -99,6 +99,9 @@ struct LocalizedNames {
 
 // A plug-in bundle's Info.plist, refused when it cannot be read, is no plug-in or has no identifier.
 Result<Value> readPlugInInfo(const std::string& path);
+// The bundle's Info.plist as a dictionary, or a refusal that says what is wrong and where: missing,
+// unreadable (a FIFO, a link, too large), malformed (with the parser's place), or no dictionary.
+Result<Value> readInfoDictionary(const std::string& bundlePath);
 // Reads one plug-in bundle. Refused when it cannot be read or has no identifier.
 Result<ScannedPlugIn> scanPlugIn(const std::string& path);
 // The plug-in bundles under an application's PlugIns/, canonical and in order; refused on a link

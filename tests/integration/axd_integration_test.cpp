@@ -848,3 +848,69 @@ TEST(Axd, AnAnnotationThatCannotBeSavedIsRefusedAndNotKept) {
     ASSERT_EQ(all["matches"].asArray()->size(), 1u) << all.description();
     EXPECT_EQ((*all["matches"].asArray())[0]["annotations"], dict({}));
 }
+
+// Files a bundle holds are read without blocking and only up to their size: a FIFO, a huge file
+// or a link to a device as Info.plist or Receipt is that request's error, at once, and another
+// client is served meanwhile.
+TEST(Axd, ABundleFileThatIsAFifoAHugeFileOrADeviceIsAnErrorAtOnce) {
+    Daemon d;
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    // A plug-in whose executable is a copy of axctl, so that axctl run from it asks as that plug-in.
+    std::string app = axtest::makeBundle(d.root.path(), "Host.app", axtest::appInfo("com.example.host"), "/bin/true");
+    std::string plugIn = axtest::makeBundle(
+        app + "/PlugIns", "Asker.appex",
+        axtest::plugInInfo("com.example.asker", dict({{"KSExtensionAttributes", dict({})}}), "asker"),
+        axtest::binary("axctl"));
+    axtest::writeFile(app + "/Receipt", "the receipt");
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto askForReceipt = [&] { return axtest::run({plugIn + "/asker", "send"}, {}, "{\"request\": \"receipt\", \"version\": 3u}"); };
+    auto served = askForReceipt();
+    ASSERT_EQ(served.out, "{\"data\": <7468652072656365697074>}\n") << served.err;
+
+    auto fifo = [](const std::string& path) { ASSERT_EQ(::mkfifo(path.c_str(), 0644), 0) << path; };
+    auto huge = [](const std::string& path) {
+        int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        ASSERT_GE(fd, 0);
+        ASSERT_EQ(::ftruncate(fd, off_t{200} << 20), 0);
+        ::close(fd);
+    };
+    auto device = [](const std::string& path) { ASSERT_EQ(::symlink("/dev/zero", path.c_str()), 0); };
+    struct Case {
+        const char* name;
+        std::function<void(const std::string&)> make;
+    };
+    const Case cases[] = {{"a FIFO", fifo}, {"a 200 MiB file", huge}, {"a link to /dev/zero", device}};
+    auto residentKiB = [&] {
+        std::string status = axtest::readFile("/proc/" + std::to_string(d.axd->pid()) + "/status");
+        return std::atol(status.c_str() + status.find("VmRSS:") + 6);
+    };
+    const long residentBefore = residentKiB();
+    auto good = d.connect();
+    int round = 0;
+    for (const auto& c : cases) {
+        // Info.plist of a bundle being added.
+        std::string bundle = d.root / ("Bad" + std::to_string(++round) + ".app");
+        fs::create_directories(bundle);
+        c.make(bundle + "/Info.plist");
+        auto started = std::chrono::steady_clock::now();
+        Value reply = d.send(request("add", {{"paths", Value(Array{Value(bundle)})}}));
+        EXPECT_EQ(reply["errorcode"], Value(uint64_t{2})) << c.name << ": " << reply.description();
+        EXPECT_LT(std::chrono::steady_clock::now() - started, 2s) << c.name;
+        EXPECT_TRUE(good->sendWithReplySync(request("match")).ok()) << c.name;
+
+        // The Receipt, swapped after registration.
+        fs::remove(app + "/Receipt");
+        c.make(app + "/Receipt");
+        started = std::chrono::steady_clock::now();
+        auto refused = askForReceipt();
+        EXPECT_NE(refused.out.find("\"errorcode\": 15u"), std::string::npos) << c.name << ": " << refused.out;
+        EXPECT_LT(std::chrono::steady_clock::now() - started, 2s) << c.name;
+        EXPECT_TRUE(good->sendWithReplySync(request("match")).ok()) << c.name;
+    }
+    EXPECT_TRUE(d.axd->waitForErr("Info.plist: a FIFO, not a regular file"));
+    EXPECT_TRUE(d.axd->waitForErr("Info.plist: 200 MiB, larger than the 1 MiB it may be"));
+    EXPECT_TRUE(d.axd->waitForErr("Info.plist: a symbolic link, which is not followed"));
+    EXPECT_TRUE(d.axd->waitForErr("Receipt: 200 MiB, larger than the 1 MiB it may be"));
+    // Still serving, and its memory did not grow by the huge file.
+    EXPECT_LT(residentKiB() - residentBefore, 32 * 1024);
+}
