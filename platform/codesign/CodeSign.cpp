@@ -3,17 +3,22 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sodium.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <climits>
+#include <cstdio>
 #include <csignal>
 #include <cstring>
-#include <algorithm>
 #include <map>
 #include <mutex>
 #include <tuple>
+#include <vector>
 
 #include "platform/bundle/Bundle.h"
 #include "platform/layout/Layout.h"
@@ -324,6 +329,181 @@ Verification verifyBundle(const std::string& bundlePath) {
 Value entitlementsOfExecutable(const std::string& path) { return verifyExecutable(path).entitlements; }
 Value entitlementsOfBundle(const std::string& bundlePath) { return verifyBundle(bundlePath).entitlements; }
 
+namespace {
+
+// Whether a mapped file is code this machine's administrator put in place: owned by root, in a
+// directory owned by root, neither writable by anyone else.
+bool installedByRoot(const std::string& path, const struct stat& file) {
+    if (file.st_uid != 0 || (file.st_mode & (S_IWGRP | S_IWOTH))) return false;
+    std::string dir = path.substr(0, path.rfind('/'));
+    struct stat st {};
+    if (::stat(dir.empty() ? "/" : dir.c_str(), &st) != 0) return false;
+    return st.st_uid == 0 && !(st.st_mode & (S_IWGRP | S_IWOTH));
+}
+
+// A small file of /proc, whole (empty when it cannot be read).
+std::string readProcFile(const std::string& path) {
+    std::string text;
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return text;
+    char buf[16384];
+    for (;;) {
+        ssize_t n = ::read(fd, buf, sizeof buf);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) break;
+        text.append(buf, static_cast<size_t>(n));
+    }
+    ::close(fd);
+    return text;
+}
+
+// The code found installed by root, by path and the file it was then: a later look at the same
+// path and file needs no stat. Only root can change what such a path names or who owns it, and a
+// file at another path is never taken for it.
+Mutex gInstalledMutex;
+std::map<std::string, std::pair<dev_t, ino_t>>& installedCode() REQUIRES(gInstalledMutex) {
+    static auto* known = new std::map<std::string, std::pair<dev_t, ino_t>>;
+    return *known;
+}
+
+bool knownInstalled(const std::string& path, dev_t device, ino_t inode) {
+    MutexLock lock(gInstalledMutex);
+    auto it = installedCode().find(path);
+    return it != installedCode().end() && it->second == std::make_pair(device, inode);
+}
+
+void rememberInstalled(const std::string& path, dev_t device, ino_t inode) {
+    MutexLock lock(gInstalledMutex);
+    if (installedCode().size() >= 4096) installedCode().clear();
+    installedCode()[path] = {device, inode};
+}
+
+// One executable mapping of a process: its start address, what it maps (a path, "[vdso]" and the
+// like, or "" when it is anonymous) and the file's identity.
+struct ExecutableMapping {
+    unsigned long long start = 0;
+    std::string path;
+    dev_t device = 0;
+    ino_t inode = 0;
+};
+
+// The kernel's query of one mapping at a time (Linux 6.11): only the executable ones are asked
+// for, which costs a few microseconds where reading /proc/<pid>/maps costs some eighty.
+struct ProcmapQuery {
+    uint64_t size;
+    uint64_t queryFlags;
+    uint64_t queryAddress;
+    uint64_t start;
+    uint64_t end;
+    uint64_t flags;
+    uint64_t pageSize;
+    uint64_t offset;
+    uint64_t inode;
+    uint32_t deviceMajor;
+    uint32_t deviceMinor;
+    uint32_t nameSize;
+    uint32_t buildIdSize;
+    uint64_t nameAddress;
+    uint64_t buildIdAddress;
+};
+static_assert(sizeof(ProcmapQuery) == 104);
+constexpr unsigned long kProcmapQuery = _IOWR('f', 17, ProcmapQuery);
+constexpr uint64_t kQueryExecutable = 0x04;
+constexpr uint64_t kQueryCoveringOrNext = 0x10;
+
+// The executable mappings, through the query; nullopt when the kernel has none.
+std::optional<std::vector<ExecutableMapping>> queryExecutableMappings(int maps) {
+    std::vector<ExecutableMapping> found;
+    char name[PATH_MAX];
+    for (uint64_t address = 0;;) {
+        ProcmapQuery q{};
+        q.size = sizeof q;
+        q.queryFlags = kQueryExecutable | kQueryCoveringOrNext;
+        q.queryAddress = address;
+        q.nameSize = sizeof name;
+        q.nameAddress = reinterpret_cast<uint64_t>(name);
+        if (::ioctl(maps, kProcmapQuery, &q) != 0) {
+            if (errno == ENOENT) return found;
+            if (errno == ENOTTY || errno == EINVAL) return std::nullopt;
+            return found.empty() ? std::nullopt : std::optional(std::move(found));
+        }
+        found.push_back(ExecutableMapping{q.start, q.nameSize > 0 ? std::string(name, strnlen(name, q.nameSize)) : "",
+                                          makedev(q.deviceMajor, q.deviceMinor), static_cast<ino_t>(q.inode)});
+        if (q.end <= address) break;
+        address = q.end;
+    }
+    return found;
+}
+
+// The same from the text of /proc/<pid>/maps.
+std::vector<ExecutableMapping> parseExecutableMappings(const std::string& maps) {
+    std::vector<ExecutableMapping> found;
+    size_t at = 0;
+    while (at < maps.size()) {
+        size_t newline = maps.find('\n', at);
+        std::string line = maps.substr(at, newline == std::string::npos ? std::string::npos : newline - at);
+        at = newline == std::string::npos ? maps.size() : newline + 1;
+        // address perms offset major:minor inode [path]
+        char perms[5] = {};
+        unsigned long long start = 0, inode = 0;
+        unsigned major = 0, minor = 0;
+        int pathAt = 0;
+        if (std::sscanf(line.c_str(), "%llx-%*x %4s %*s %x:%x %llu %n", &start, perms, &major, &minor, &inode, &pathAt) < 5)
+            continue;
+        if (perms[2] != 'x') continue;
+        found.push_back(ExecutableMapping{start, line.substr(static_cast<size_t>(pathAt)), makedev(major, minor),
+                                          static_cast<ino_t>(inode)});
+    }
+    return found;
+}
+
+}  // namespace
+
+std::optional<std::string> untrustedCodeIn(pid_t pid, const struct stat& exe) {
+    std::string proc = "/proc/" + std::to_string(pid);
+    std::string environment = readProcFile(proc + "/environ");
+    for (size_t at = 0; at < environment.size();) {
+        size_t end = environment.find('\0', at);
+        std::string_view entry(environment.data() + at, (end == std::string::npos ? environment.size() : end) - at);
+        for (std::string_view prefix : {"LD_PRELOAD=", "LD_LIBRARY_PATH=", "LD_AUDIT="}) {
+            if (entry.size() > prefix.size() && entry.substr(0, prefix.size()) == prefix)
+                return "it was started with " + std::string(prefix.substr(0, prefix.size() - 1));
+        }
+        at = end == std::string::npos ? environment.size() : end + 1;
+    }
+    int maps = ::open((proc + "/maps").c_str(), O_RDONLY | O_CLOEXEC);
+    if (maps < 0) return std::string("its mappings cannot be read");
+    auto queried = queryExecutableMappings(maps);
+    ::close(maps);
+    std::vector<ExecutableMapping> mappings = queried ? std::move(*queried) : parseExecutableMappings(readProcFile(proc + "/maps"));
+    if (mappings.empty()) return std::string("its mappings cannot be read");
+    std::string previous;
+    for (const ExecutableMapping& m : mappings) {
+        const std::string& path = m.path;
+        if (path == "[vdso]" || path == "[vsyscall]" || path == "[uprobes]") continue;
+        if (path.empty() || path[0] != '/') {
+            char address[32];
+            std::snprintf(address, sizeof address, "%llx", m.start);
+            return std::string("an anonymous executable mapping at ") + address;
+        }
+        if (path == previous) continue;
+        previous = path;
+        if (path.size() > 10 && path.compare(path.size() - 10, 10, " (deleted)") == 0) return "it maps " + path;
+        if (m.device == exe.st_dev && m.inode == exe.st_ino) continue;  // the signed executable itself
+        if (knownInstalled(path, m.device, m.inode)) continue;
+        struct stat st {};
+        if (::stat(path.c_str(), &st) != 0 || st.st_dev != m.device || st.st_ino != m.inode)
+            return "it maps " + path + ", which changed since";
+        if (installedByRoot(path, st)) {
+            rememberInstalled(path, m.device, m.inode);
+            continue;
+        }
+        if (verifyExecutable(path).valid) continue;
+        return "it maps " + path + ", which is neither installed by root nor signed";
+    }
+    return std::nullopt;
+}
+
 std::shared_ptr<Handle> Handle::fromAuditToken(const rpx::AuditToken& token) {
     std::string proc = "/proc/" + std::to_string(token.pid);
     auto refuse = [&](const std::string& why) {
@@ -332,18 +512,26 @@ std::shared_ptr<Handle> Handle::fromAuditToken(const rpx::AuditToken& token) {
     // The pid must still name the process the token was taken from.
     if (token.pidfd && syscall(SYS_pidfd_send_signal, token.pidfd->get(), 0, nullptr, 0) != 0)
         return refuse("the process is gone");
-    int fd = ::open((proc + "/exe").c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return refuse(errno == EMFILE || errno == ENFILE ? "out of file descriptors" : "the process is gone");
+    auto exe = bundle::openFileOfBundle(proc + "/exe", true);
+    if (!exe) {
+        int err = errno;  // of the open that failed, when that was the failure
+        return refuse(err == EMFILE || err == ENFILE ? "out of file descriptors" : "the process is gone");
+    }
+    int fd = (*exe)->get();
     struct stat st {};
     fstat(fd, &st);
     rpx::PeerIdentity now = rpx::identityOfProcess(token.pid, token.uid, token.gid, nullptr);
     if (now.auditToken.startTime != token.startTime || st.st_dev != token.exeDevice ||
         st.st_ino != token.exeInode) {
-        ::close(fd);
         return refuse("the process is not the one that connected");
     }
-    Verification v = verifyOpened(fd, now.executablePath.empty() ? proc + "/exe" : now.executablePath);
-    ::close(fd);
+    std::string path = now.executablePath.empty() ? proc + "/exe" : now.executablePath;
+    Verification v = verifyOpened(fd, path);
+    // A signature speaks for the code it covers: a process that runs other code as well (a library
+    // preloaded into a signed program, say) has none of its entitlements.
+    if (v.valid) {
+        if (auto untrusted = untrustedCodeIn(token.pid, st)) v = invalid(path + " (pid " + std::to_string(token.pid) + ")", *untrusted);
+    }
     return std::shared_ptr<Handle>(new Handle(std::move(v)));
 }
 

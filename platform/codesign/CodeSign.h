@@ -15,6 +15,9 @@
 // Thread-safety: every function and class here is safe to use from any thread.
 #pragma once
 
+#include <sys/stat.h>
+#include <sys/types.h>
+
 #include <memory>
 #include <optional>
 #include <string>
@@ -42,9 +45,17 @@ Verification verifyBundle(const std::string& bundlePath);
 Value entitlementsOfExecutable(const std::string& path);
 Value entitlementsOfBundle(const std::string& bundlePath);
 
+// Why code its signature does not cover may run in the process `pid` (whose executable is the file
+// `exe`), or nothing: it was started with LD_PRELOAD, LD_LIBRARY_PATH or LD_AUDIT, or it has an
+// executable mapping that is anonymous, deleted, or a file that is neither the executable itself,
+// nor owned by root in a directory owned by root (neither writable by anyone else), nor signed by a
+// trusted key.
+std::optional<std::string> untrustedCodeIn(pid_t pid, const struct stat& exe);
+
 // The code-signing identity of a process, made from the audit token of a connection. The process
-// must still be the one the token names (its pidfd, start time and executable file), or it has no
-// entitlements.
+// must still be the one the token names (its pidfd, start time and executable file), and run no code
+// but what its signature covers and what root installed (untrustedCodeIn), or it has no
+// entitlements; the log says which mapping. Made once per connection.
 class Handle {
 public:
     static std::shared_ptr<Handle> fromAuditToken(const rpx::AuditToken& token);

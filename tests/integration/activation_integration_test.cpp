@@ -307,3 +307,48 @@ TEST(Activation, AnUnsignedDaemonServesDiscoveryButSaysWhyItCannotActivate) {
     auto list = Value::parse(tokens.out);
     EXPECT_TRUE(list && list->asArray() && list->asArray()->size() == 3) << tokens.out;
 }
+
+// A signature speaks for the code it covers. A library preloaded into a signed program (into axd,
+// into a signed axctl) leaves it without its entitlements, whether the environment still shows how
+// it came in or the library wiped that: its mapping gives it away.
+TEST(Activation, ASignedProgramRunningCodeItsSignatureDoesNotCoverHasNoEntitlements) {
+    Platform p;
+    std::string writable = p.root / "writable";
+    fs::create_directories(writable);
+    fs::permissions(writable, fs::perms::all);
+    std::string library = writable + "/libpreload.so";
+    fs::copy_file(axtest::binary("../lib/libpreload_library.so"), library);
+    std::map<std::string, std::string> preloaded = kDebugLog;
+    preloaded["LD_PRELOAD"] = library;
+    preloaded["ASAN_OPTIONS"] = "verify_asan_link_order=0";
+    // axd with the library in it: spawnd refuses its registrations, and says which mapping.
+    p.axd->signal(SIGTERM);
+    p.axd->wait(5s);
+    p.axd = std::make_unique<axtest::Process>(std::vector<std::string>{p.root / "bin/axd"}, preloaded);
+    ASSERT_TRUE(axtest::eventually([] { return axtest::endpointAnswers(rpx::endpointPath("com.corvane.annexa.axd")); }));
+    auto refused = p.axctl({"ready", p.uuids.at("com.example.greeter").string()});
+    EXPECT_NE(refused.status, 0);
+    EXPECT_TRUE(p.spawnd->waitForErr("it maps " + library + ", which is neither installed by root nor signed"))
+        << p.spawnd->err();
+
+    // A signed axctl with the manager entitlement, so started: refused what needs the entitlement.
+    std::string manager = p.root / "bin/manager";
+    fs::copy_file(axtest::binary("axctl"), manager);
+    ASSERT_TRUE(codesign::sign(manager, p.key, std::nullopt, dict({{"com.corvane.private.annexa.manager", true}})).ok());
+    struct Case {
+        const char* name;
+        std::map<std::string, std::string> environment;
+    };
+    const Case cases[] = {
+        {"a preloaded library", {{"LD_PRELOAD", library}, {"ASAN_OPTIONS", "verify_asan_link_order=0"}}},
+        {"a library path", {{"LD_LIBRARY_PATH", writable}}},
+        {"an audit library", {{"LD_AUDIT", library}}},
+    };
+    for (const auto& c : cases) {
+        auto ran = axtest::run({manager, "remove", p.app}, c.environment);
+        EXPECT_EQ(ran.status, 77) << c.name << ": " << ran.err;
+    }
+    // Without any of that, the same program is entitled.
+    auto removed = p.axctl({"remove", p.app}, manager);
+    EXPECT_EQ(removed.status, 0) << removed.err;
+}
