@@ -2,11 +2,14 @@
 #include <pthread.h>
 
 #include <atomic>
+#include <future>
+#include <string>
 #include <mutex>
 #include <thread>
 #include <vector>
 
 #include "platform/dispatch/Dispatch.h"
+#include "tests/support/TestSupport.h"
 
 using corvane::dispatch::QoS;
 using corvane::dispatch::Queue;
@@ -114,4 +117,73 @@ TEST(Dispatch, LastOwnerReleasedFromItsOwnTask) {
     });
     for (int i = 0; i < 1000 && !done; ++i) usleep(1000);
     EXPECT_TRUE(done);
+}
+
+// Parties take turns: a party that queued many tasks first delays the others' by one task each
+// round, each party's tasks keep their order, and a task that queues its party's next one (work in
+// slices) goes to the back of the round.
+TEST(Dispatch, TurnsServeEveryPartyInRotation) {
+    auto queue = corvane::dispatch::Queue::create("test.turns");
+    corvane::dispatch::Turns turns(queue);
+    std::vector<std::string> ran;
+    std::mutex mutex;
+    auto note = [&](std::string what) {
+        std::lock_guard lock(mutex);
+        ran.push_back(std::move(what));
+    };
+    std::promise<void> release;
+    auto gate = release.get_future().share();
+    queue->async([gate] { gate.wait(); });  // holds the queue while the rest is queued
+    for (int i = 1; i <= 4; ++i) turns.async(1, [&, i] { note("a" + std::to_string(i)); });
+    turns.async(2, [&] {
+        note("b1");
+        turns.async(2, [&] { note("b1 again"); });
+    });
+    turns.async(2, [&] { note("b2"); });
+    turns.async(3, [&] { note("c1"); });
+    release.set_value();
+    EXPECT_TRUE(axtest::eventually([&] {
+        std::lock_guard lock(mutex);
+        return ran.size() == 8;
+    }));
+    std::lock_guard lock(mutex);
+    EXPECT_EQ(ran, (std::vector<std::string>{"a1", "b1", "c1", "a2", "b2", "a3", "b1 again", "a4"}));
+}
+
+// While another party is served, a party that runs long waits for later windows even when the
+// queue has nothing else to do; alone, it is never held back.
+TEST(Dispatch, TurnsHoldAPartyPastItsShareWhileOthersAreServed) {
+    using Clock = std::chrono::steady_clock;
+    constexpr auto kTask = std::chrono::milliseconds(2);
+    constexpr int kTasks = 20;  // 40 ms of work
+    auto timeHeavyParty = [&](bool withOther) {
+        auto queue = corvane::dispatch::Queue::create("test.shares");
+        corvane::dispatch::Turns turns(queue);
+        std::atomic<int> left{kTasks};
+        std::promise<void> finished, lightStopped;
+        std::function<void()> light = [&] {
+            if (left > 0) {
+                turns.async(2, light);  // always waiting, never long
+            } else {
+                lightStopped.set_value();
+            }
+        };
+        auto start = Clock::now();
+        for (int i = 0; i < kTasks; ++i) {
+            turns.async(1, [&] {
+                std::this_thread::sleep_for(kTask);
+                if (--left == 0) finished.set_value();
+            });
+        }
+        if (withOther) turns.async(2, light);
+        finished.get_future().wait();
+        auto took = Clock::now() - start;
+        if (withOther) lightStopped.get_future().wait();
+        return took;
+    };
+    // Two parties: the heavy one gets half of each 10 ms window and one task more (6 ms), so
+    // 40 ms of work spans more than six windows.
+    EXPECT_GE(timeHeavyParty(true), std::chrono::milliseconds(60));
+    // Alone it runs back to back.
+    EXPECT_LT(timeHeavyParty(false), std::chrono::milliseconds(55)) << "held back while alone";
 }

@@ -6,13 +6,17 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
-#include <algorithm>
+#include <chrono>
 #include <deque>
-#include <vector>
+#include <map>
 #include <mutex>
 #include <optional>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
 
 namespace corvane::dispatch {
 
@@ -23,6 +27,8 @@ struct Queue::State {
     Mutex mutex;
     ConditionVariable wake;
     std::deque<std::function<void()>> tasks GUARDED_BY(mutex);
+    // Tasks queued with asyncAfter, by the time they join `tasks`.
+    std::multimap<std::chrono::steady_clock::time_point, std::function<void()>> timed GUARDED_BY(mutex);
     bool stopping GUARDED_BY(mutex) = false;
     // A task is running, on the queue's thread or on a caller's (see sync): the queue runs one
     // task at a time wherever it runs.
@@ -47,8 +53,11 @@ int niceFor(QoS qos) {
         case QoS::Background: return 10;
         case QoS::Utility: return 5;
         case QoS::Default: return 0;
-        case QoS::UserInitiated: return -5;
-        case QoS::UserInteractive: return -10;
+        // Never above the process's own priority: that would take a privilege an ordinary user
+        // lacks, so a daemon run by root would schedule its threads unlike the same daemon run by
+        // the user (a request thread above the I/O thread it waits on). Short slices instead.
+        case QoS::UserInitiated: return 0;
+        case QoS::UserInteractive: return 0;
     }
     return 0;
 }
@@ -58,6 +67,9 @@ int niceFor(QoS qos) {
     std::fflush(stderr);
     std::abort();
 }
+
+// How long a queue runs tasks back to back before it lets other threads on its processor run.
+constexpr std::chrono::microseconds kYieldAfter{200};
 
 template <class State>
 void drain(const std::shared_ptr<State>& state) {
@@ -70,12 +82,26 @@ void drain(const std::shared_ptr<State>& state) {
     }
     if (state->qos >= QoS::UserInitiated) requestShortSlices();
     Entered entered(state.get());
+    auto busySince = std::chrono::steady_clock::now();
     for (;;) {
         std::function<void()> task;
         {
             MutexLock lock(state->mutex);
-            while (!(state->stopping && state->tasks.empty()) && (state->busy || state->tasks.empty()))
-                state->wake.wait(lock);
+            for (;;) {
+                auto now = std::chrono::steady_clock::now();
+                while (!state->timed.empty() && state->timed.begin()->first <= now) {
+                    state->tasks.push_back(std::move(state->timed.begin()->second));
+                    state->timed.erase(state->timed.begin());
+                }
+                if (state->stopping && state->tasks.empty()) break;
+                if (!state->busy && !state->tasks.empty()) break;
+                if (state->timed.empty() || state->stopping) {
+                    state->wake.wait(lock);
+                } else {
+                    state->wake.waitUntil(lock, state->timed.begin()->first);
+                }
+                busySince = std::chrono::steady_clock::now();
+            }
             if (state->tasks.empty()) break;
             task = std::move(state->tasks.front());
             state->tasks.pop_front();
@@ -83,6 +109,15 @@ void drain(const std::shared_ptr<State>& state) {
         }
         task();
         task = nullptr;  // what it captured goes before the next task runs
+        // A queue that runs task after task would keep its processor until the scheduler takes it
+        // away, however short its slices: a thread woken on the same processor meanwhile (a client
+        // waiting for its reply, the I/O thread with a new request) would wait milliseconds. It
+        // gives the processor up between tasks instead, a few times a millisecond; with nothing
+        // else to run, that costs one system call.
+        if (auto now = std::chrono::steady_clock::now(); now - busySince > kYieldAfter) {
+            sched_yield();
+            busySince = now;
+        }
         MutexLock lock(state->mutex);
         state->busy = false;
     }
@@ -166,6 +201,14 @@ void Queue::async(std::function<void()> task) {
     state_->wake.notify_one();
 }
 
+void Queue::asyncAfter(std::chrono::nanoseconds delay, std::function<void()> task) {
+    {
+        MutexLock lock(state_->mutex);
+        state_->timed.emplace(std::chrono::steady_clock::now() + delay, std::move(task));
+    }
+    state_->wake.notify_one();
+}
+
 void Queue::sync(const std::function<void()>& task) {
     if (isCurrent()) fail("sync onto the current queue would deadlock", state_->label);
     if (runHereIfIdle(*state_, task)) return;
@@ -198,6 +241,117 @@ void Queue::assertCurrent() const {
 
 void Queue::assertNotCurrent() const {
     if (isCurrent()) fail("must not run on this queue", state_->label);
+}
+
+// ---- turns
+
+struct Turns::State : std::enable_shared_from_this<Turns::State> {
+    using Clock = std::chrono::steady_clock;
+    explicit State(const QueuePtr& q) : queue(q) {}
+
+    const std::weak_ptr<Queue> queue;
+    Mutex mutex;
+    std::unordered_map<uint64_t, std::deque<std::function<void()>>> waiting GUARDED_BY(mutex);
+    std::deque<uint64_t> rotation GUARDED_BY(mutex);    // waiting parties that may go now, next first
+    std::unordered_set<uint64_t> held GUARDED_BY(mutex);  // waiting parties past their share
+    // The current window: when it ends, and how long each party served in it ran.
+    Clock::time_point windowEnd GUARDED_BY(mutex);
+    std::unordered_map<uint64_t, Clock::duration> used GUARDED_BY(mutex);
+    bool running GUARDED_BY(mutex) = false;     // a run is queued or running
+    bool timerSet GUARDED_BY(mutex) = false;    // a run is queued for the window's end
+
+    // A new window when the current one is over: every share starts again.
+    void roll(Clock::time_point now) REQUIRES(mutex) {
+        if (now < windowEnd) return;
+        windowEnd = now + kWindow;
+        used.clear();
+        for (uint64_t party : held) rotation.push_back(party);
+        held.clear();
+    }
+
+    bool pastShare(uint64_t party) REQUIRES(mutex) {
+        auto ran = used.find(party);
+        if (ran == used.end()) return false;
+        size_t parties = used.size();
+        for (const auto& entry : waiting) parties += used.count(entry.first) ? 0 : 1;
+        // A share is never less than a tenth of the window: a party that asks for little (a host's
+        // few lookups) is never held back, however many parties there are.
+        return parties > 1 && ran->second > std::max<Clock::duration>(kWindow / parties, kWindow / 10);
+    }
+
+    void hold(uint64_t party) REQUIRES(mutex) {
+        held.insert(party);
+        if (timerSet) return;
+        auto q = queue.lock();
+        if (!q) return;
+        timerSet = true;
+        q->asyncAfter(windowEnd - Clock::now(), [self = shared_from_this()] {
+            MutexLock lock(self->mutex);
+            self->timerSet = false;
+            self->roll(Clock::now());
+            self->startRunning();
+        });
+    }
+
+    void startRunning() REQUIRES(mutex) {
+        if (running || rotation.empty()) return;
+        auto q = queue.lock();
+        if (!q) return;
+        running = true;
+        q->async([self = shared_from_this()] { self->runNext(); });
+    }
+
+    void runNext() {
+        uint64_t party;
+        std::function<void()> task;
+        {
+            MutexLock lock(mutex);
+            roll(Clock::now());
+            if (rotation.empty()) {
+                running = false;
+                return;
+            }
+            party = rotation.front();
+            rotation.pop_front();
+            auto tasks = waiting.find(party);
+            task = std::move(tasks->second.front());
+            tasks->second.pop_front();
+            if (tasks->second.empty()) {
+                waiting.erase(tasks);
+            } else {
+                rotation.push_back(party);
+            }
+        }
+        auto started = Clock::now();
+        task();
+        task = nullptr;
+        MutexLock lock(mutex);
+        used[party] += Clock::now() - started;
+        if (waiting.count(party) && pastShare(party)) {
+            std::erase(rotation, party);
+            hold(party);
+        }
+        running = false;
+        startRunning();
+    }
+};
+
+Turns::Turns(const QueuePtr& queue) : state_(std::make_shared<State>(queue)) {}
+
+void Turns::async(uint64_t party, std::function<void()> task) {
+    MutexLock lock(state_->mutex);
+    state_->roll(State::Clock::now());
+    auto& tasks = state_->waiting[party];
+    bool first = tasks.empty();
+    tasks.push_back(std::move(task));
+    if (first) {
+        if (state_->pastShare(party)) {
+            state_->hold(party);
+        } else {
+            state_->rotation.push_back(party);
+        }
+    }
+    state_->startRunning();
 }
 
 }  // namespace corvane::dispatch

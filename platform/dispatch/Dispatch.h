@@ -13,6 +13,8 @@
 // Thread-safety: every member is safe to call from any thread.
 #pragma once
 
+#include <chrono>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -25,10 +27,10 @@
 
 namespace corvane::dispatch {
 
-// Priority classes. Linux applies them as a nice value of the queue's thread where the process is
-// allowed to (raising priority needs CAP_SYS_NICE, so user-initiated work usually runs at the
-// process's own nice value); the class is stored either way. User-initiated and user-interactive
-// queues also ask for short time slices (see requestShortSlices), which needs no privilege.
+// Priority classes. Background and utility queues run their thread at a higher nice value (lower
+// priority); no class raises a thread above the process's own priority, which would need
+// CAP_SYS_NICE and so differ between root and the user. User-initiated and user-interactive queues
+// ask for short time slices instead (see requestShortSlices), which needs no privilege.
 enum class QoS { Background, Utility, Default, UserInitiated, UserInteractive };
 
 // Asks the scheduler to run the calling thread in short slices (0.1 ms instead of the default of
@@ -46,6 +48,9 @@ public:
     Queue& operator=(const Queue&) = delete;
 
     void async(std::function<void()> task);
+    // Queues the task once `delay` has passed (behind what is queued by then). A queue that is
+    // destroyed first never runs it.
+    void asyncAfter(std::chrono::nanoseconds delay, std::function<void()> task);
     // Runs the task on the queue and waits until it has run.
     void sync(const std::function<void()>& task);
     // Runs the task at once on the caller's thread, as the queue's one running task, when the queue
@@ -85,6 +90,28 @@ private:
 };
 
 using QueuePtr = std::shared_ptr<Queue>;
+
+// Tasks of many parties on one queue, taken in turns. Each party's tasks run in the order it gave
+// them, and the parties with tasks waiting take one task each in rotation: a party with a thousand
+// tasks waiting delays another party's next task by at most one of its own. And while several
+// parties are served, none takes more than its share of the queue's time: in each window
+// (kWindow), a party whose tasks ran longer than the window divided by the parties served or
+// waiting in it (and than a tenth of the window) waits for the next window, even when nothing else
+// waits, so that a party that floods the queue leaves the processors to the others too. A party
+// alone is never held back.
+//
+// One task of the Turns is queued on the queue at a time; other tasks of the queue run between.
+class Turns {
+public:
+    static constexpr std::chrono::milliseconds kWindow{10};
+
+    explicit Turns(const QueuePtr& queue);
+    void async(uint64_t party, std::function<void()> task);
+
+private:
+    struct State;
+    std::shared_ptr<State> state_;  // shared with the queued run, which may outlive this object
+};
 
 // Starts an operation that reports once through a callback, and blocks the calling thread until it
 // has: `start` receives the callback and may call it from any thread. Returns what was reported.

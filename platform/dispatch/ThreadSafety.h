@@ -8,6 +8,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
@@ -94,6 +95,15 @@ public:
     template <class Predicate>
     void wait(MutexLock& lock, Predicate ready) {
         while (!ready()) wait(lock);
+    }
+    // Waits until notified or until `deadline` (or spuriously), whichever comes first.
+    void waitUntil(MutexLock& lock, std::chrono::steady_clock::time_point deadline) NO_THREAD_SAFETY_ANALYSIS {
+        Mutex& mutex = lock.mutex_;
+        std::unique_lock<std::mutex> held(mutex.mutex_, std::adopt_lock);
+        mutex.owner_.store(std::thread::id(), std::memory_order_relaxed);
+        cv_.wait_until(held, deadline);
+        mutex.owner_.store(std::this_thread::get_id(), std::memory_order_relaxed);
+        held.release();
     }
 
 private:
