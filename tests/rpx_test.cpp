@@ -360,16 +360,22 @@ TEST(RpxWire, EncodingsPutTogetherFromPartsDecodeToTheirValue) {
     ASSERT_TRUE(wire::appendEntry(entries, "b", dict({{"x", Value(Array{Value(1)})}})));
     ASSERT_TRUE(wire::appendEntry(entries, "a", "text"));
     std::string whole;
-    wire::appendArrayHeader(whole, 1);
+    wire::appendArrayHeader(whole, 2);
     wire::appendDictionaryHeader(whole, 3);
     ASSERT_TRUE(wire::appendEntry(whole, "c", Value(false)));
     whole += entries;
     EXPECT_FALSE(wire::appendEntry(whole, "fd", Value(std::make_shared<FileDescriptor>(dup(0)))));
-    Value expected = Value(Array{dict({{"a", "text"}, {"b", dict({{"x", Value(Array{Value(1)})}})}, {"c", false}})});
+    ASSERT_TRUE(wire::appendElement(whole, "tail"));
+    EXPECT_FALSE(wire::appendElement(whole, Value(std::make_shared<FileDescriptor>(dup(0)))));
+    Value expected = Value(Array{dict({{"a", "text"}, {"b", dict({{"x", Value(Array{Value(1)})}})}, {"c", false}}), "tail"});
     EXPECT_EQ(wire::nestingOf(expected), 4u);
     Value made = wire::encodedContainer(std::make_shared<std::string>(whole), wire::nestingOf(expected),
                                         expected.kindsInside());
     EXPECT_EQ(made, expected);
+    // Counted from the encoding, and from a decoded array alike.
+    EXPECT_EQ(rpx::arrayCount(made), 2u);
+    EXPECT_EQ(rpx::arrayCount(expected), 2u);
+    EXPECT_EQ(rpx::arrayCount(Value("not an array")), 0u);
     Value body = dict({{"matches", made}});
     wire::Frame f = readFrame(frameBytes(wire::FrameKind::Reply, 1, body));
     EXPECT_EQ(f.body, dict({{"matches", expected}}));

@@ -54,9 +54,13 @@ Drained drainEvents(int fd, const std::string& name) {
 Status post(const std::string& name) {
     if (!validName(name)) return badName(name);
     std::string dir = directory();
-    if (Status made = layout::makeDirectories(dir, 0700); !made.ok()) return made;
     std::string path = dir + "/" + name;
+    // The directory is made the first time only: a post is one open where it exists.
     int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    if (fd < 0 && errno == ENOENT) {
+        if (Status made = layout::makeDirectories(dir, 0700); !made.ok()) return made;
+        fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    }
     if (fd < 0) return Error::posix(errno, path);
     // The lock makes read-increment-write one step across processes.
     while (flock(fd, LOCK_EX) != 0) {

@@ -236,6 +236,9 @@ void closeUnclaimedSockets();
 // making a value per element: a request that names thousands of plug-ins costs a copy of their
 // UUIDs.
 std::vector<UUID> leadingUuids(const Value& array, bool& all);
+// The number of elements of an array, read from its encoding when it is still encoded (nothing is
+// decoded); 0 for anything else.
+size_t arrayCount(const Value& array);
 
 // The socket path of an endpoint under the current platform root.
 std::string endpointPath(const std::string& name);

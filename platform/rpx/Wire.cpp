@@ -487,6 +487,17 @@ bool appendEntry(std::string& out, std::string_view key, const Value& value) {
     return true;
 }
 
+bool appendElement(std::string& out, const Value& value) {
+    if (value.kindsInside() & bit(Value::Kind::Fd)) return false;
+    size_t before = out.size();
+    std::vector<int> fds;
+    if (!encode(out, value, fds, 0, SIZE_MAX)) {
+        out.resize(before);
+        return false;
+    }
+    return true;
+}
+
 size_t nestingOf(const Value& value) {
     if (const Value::Encoding* e = value.encoding()) return e->nesting;
     size_t deepest = 0;
@@ -646,6 +657,14 @@ void FrameReader::clear() {
 }  // namespace corvane::rpx::wire
 
 namespace corvane::rpx {
+
+size_t arrayCount(const Value& array) {
+    const Value::Encoding* encoding = array.encoding();
+    if (encoding && encoding->kind == Value::Kind::Array && !encoding->pieces)
+        return static_cast<size_t>(wire::get(encoding->bytes, 1, 4));
+    const Array* elements = array.asArray();
+    return elements ? elements->size() : 0;
+}
 
 std::vector<UUID> leadingUuids(const Value& array, bool& all) {
     std::vector<UUID> uuids;

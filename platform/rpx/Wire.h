@@ -63,6 +63,8 @@ void appendDictionaryHeader(std::string& out, uint32_t count);
 // Appends one dictionary entry, its key and value; false (and nothing appended) for a value that
 // holds a descriptor.
 bool appendEntry(std::string& out, std::string_view key, const Value& value);
+// Appends one array element; false (and nothing appended) for a value that holds a descriptor.
+bool appendElement(std::string& out, const Value& value);
 // How deep values nest inside `value`: 0 for a scalar or an empty container, 1 for a container of
 // scalars, and so on.
 size_t nestingOf(const Value& value);
