@@ -187,3 +187,34 @@ TEST(Dispatch, TurnsHoldAPartyPastItsShareWhileOthersAreServed) {
     // Alone it runs back to back.
     EXPECT_LT(timeHeavyParty(false), std::chrono::milliseconds(55)) << "held back while alone";
 }
+
+// A task run in place counts in its party's share like a queued one: past the share, the party's
+// next task is refused in place (and queued by the caller) while another party's still runs there.
+TEST(Dispatch, TurnsRunATaskInPlaceOnlyWithinItsPartysShare) {
+    auto queue = corvane::dispatch::Queue::create("test.inplace");
+    corvane::dispatch::Turns turns(queue);
+    auto start = std::chrono::steady_clock::now();
+    bool ran = false;
+    EXPECT_TRUE(turns.runIfIdle(1, [&] { std::this_thread::sleep_for(std::chrono::milliseconds(6)); }));
+    EXPECT_TRUE(turns.runIfIdle(2, [&] { ran = true; }));
+    EXPECT_TRUE(ran);
+    bool heavyAgain = turns.runIfIdle(1, [] {});
+    bool lightAgain = turns.runIfIdle(2, [] {});
+    // Within the window both parties are served in it, and the heavy one ran more than half of it.
+    if (std::chrono::steady_clock::now() - start < std::chrono::milliseconds(9)) {
+        EXPECT_FALSE(heavyAgain);
+        EXPECT_TRUE(lightAgain);
+    }
+    // A queue that is busy runs nothing in place.
+    std::promise<void> release;
+    std::shared_future<void> released = release.get_future().share();
+    std::promise<void> running;
+    queue->async([&running, released] {
+        running.set_value();
+        released.wait();
+    });
+    running.get_future().wait();
+    EXPECT_FALSE(turns.runIfIdle(3, [] {}));
+    release.set_value();
+    queue->sync([] {});
+}

@@ -354,4 +354,19 @@ void Turns::async(uint64_t party, std::function<void()> task) {
     state_->startRunning();
 }
 
+bool Turns::runIfIdle(uint64_t party, const std::function<void()>& task) {
+    {
+        MutexLock lock(state_->mutex);
+        state_->roll(State::Clock::now());
+        if (state_->waiting.count(party) || state_->pastShare(party)) return false;
+    }
+    auto queue = state_->queue.lock();
+    if (!queue) return false;
+    auto started = State::Clock::now();
+    if (!queue->runIfIdle(task)) return false;
+    MutexLock lock(state_->mutex);
+    state_->used[party] += State::Clock::now() - started;
+    return true;
+}
+
 }  // namespace corvane::dispatch

@@ -107,6 +107,10 @@ public:
 
     explicit Turns(const QueuePtr& queue);
     void async(uint64_t party, std::function<void()> task);
+    // Runs the task at once on the caller's thread (Queue::runIfIdle), its time counted in the
+    // party's share, when the queue is idle and the party has no task waiting and is within its
+    // share; false, and nothing run, otherwise.
+    bool runIfIdle(uint64_t party, const std::function<void()>& task);
 
 private:
     struct State;
