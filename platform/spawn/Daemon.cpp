@@ -834,14 +834,16 @@ Result<std::unique_ptr<Daemon>> Daemon::start(const Options& options) {
 
     auto parts = std::make_unique<Parts>();
     parts->manager = std::make_shared<Manager>(options, dispatch::Queue::create("com.corvane.spawnd"), maxInstances);
-    if (auto served = parts->manager->serve(); !served.ok()) return served.error();
-    parts->manager->reapChildren(std::move(childSignals));
+    // The token broker and consent first: once spawnd's own endpoint answers (what a service
+    // manager and the tests wait for), every endpoint it hosts does.
     auto broker = sandbox::Broker::start(dispatch::Queue::create("com.corvane.sandbox.broker"));
     if (!broker) return broker.error();
     parts->broker = std::move(*broker);
     auto consent = pcx::Service::start(dispatch::Queue::create("com.corvane.pcx"));
     if (!consent) return consent.error();
     parts->consent = std::move(*consent);
+    if (auto served = parts->manager->serve(); !served.ok()) return served.error();
+    parts->manager->reapChildren(std::move(childSignals));
     return std::unique_ptr<Daemon>(new Daemon(std::move(parts)));
 }
 
