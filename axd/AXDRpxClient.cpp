@@ -60,11 +60,40 @@ void AXDRpxClient::handleEvent(const corvane::rpx::Event& event) {
         if (count % 1000 == 0) log::debug(logOps(), "client %d used %u requests so far", client.pid(), count);
         transaction->dispatch();
     };
-    if (transaction->onlyReads()) {
-        server_->submitReadingWork(work);
-    } else {
-        server_->submitWork(std::move(work));
+    Waiting request{std::move(work), transaction->onlyReads()};
+    {
+        corvane::MutexLock lock(sequenceMutex_);
+        if (serving_) {
+            waiting_.push_back(std::move(request));
+            return;
+        }
+        serving_ = true;
     }
+    start(std::move(request));
+}
+
+void AXDRpxClient::start(Waiting request) {
+    if (request.reading) {
+        server_->submitReadingWork(pid_, request.work);
+    } else {
+        server_->submitWork(pid_, std::move(request.work));
+    }
+}
+
+void AXDRpxClient::requestEnded() {
+    Waiting next;
+    {
+        corvane::MutexLock lock(sequenceMutex_);
+        if (waiting_.empty()) {
+            serving_ = false;
+            return;
+        }
+        next = std::move(waiting_.front());
+        waiting_.pop_front();
+    }
+    // Queued, never run here: this runs as a request ends, and a chain of requests run where they
+    // end would nest one in the other.
+    server_->submitWork(pid_, std::move(next.work));
 }
 
 int AXDRpxClient::pid() const { return connection_.expired() ? 0 : pid_; }

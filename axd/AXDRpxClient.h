@@ -4,6 +4,8 @@
 #pragma once
 
 #include <atomic>
+#include <deque>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -43,6 +45,17 @@ public:
     void dead();
     std::string description() const;
 
+    // A request of this client has ended (its Transaction is gone): the next one it sent, if any,
+    // goes to the service queue now. A client's requests are served one after another, so that one
+    // served in slices lets other clients' requests run between its slices but never this client's
+    // own next one, and a client that sends thousands at once has one of them queued at a time.
+    void requestEnded();
+
+    // Its holds have been released as it went (set by the server, on its hold queue): it makes no
+    // more.
+    bool holdsReleased() const { return holdsReleased_.load(); }
+    void setHoldsReleased() { holdsReleased_.store(true); }
+
 private:
     AXDRpxClient(const corvane::rpx::ConnectionPtr& connection, AXDServer* server);
     void handleEvent(const corvane::rpx::Event& event);
@@ -59,6 +72,7 @@ private:
     void logUnexpected(const corvane::rpx::Event& event);
 
     std::atomic<bool> acceptWork_{true};
+    std::atomic<bool> holdsReleased_{false};
     std::weak_ptr<corvane::rpx::Connection> connection_;
     AXDServer* const server_;
     const int pid_;
@@ -67,6 +81,15 @@ private:
     mutable std::once_flag identityOnce_;
     mutable Identity identity_;  // written once, under identityOnce_
     uint32_t requestCount_ = 0;  // on the service queue
+    // Requests that wait for the one being served.
+    struct Waiting {
+        std::function<void()> work;
+        bool reading;
+    };
+    void start(Waiting request);
+    corvane::Mutex sequenceMutex_;
+    bool serving_ GUARDED_BY(sequenceMutex_) = false;
+    std::deque<Waiting> waiting_ GUARDED_BY(sequenceMutex_);
     // On the connection's delivery, one event at a time.
     int64_t unexpectedSecond_ = 0;
     uint32_t unexpectedInSecond_ = 0;

@@ -1,6 +1,7 @@
 #include "axd/AXDServer.h"
 
 #include <systemd/sd-daemon.h>
+#include <malloc.h>
 #include <unistd.h>
 
 #include "axd/AXDRpxClient.h"
@@ -18,22 +19,32 @@ std::shared_ptr<AXDServer> gServer;  // set once during construction, never clea
 
 // ---- holds
 
+namespace {
+std::atomic<uint64_t> gHoldSerials{0};
+}  // namespace
+
 AXDPlugInHold::AXDPlugInHold(const std::vector<AXDPlugInPtr>& plugIns, const std::shared_ptr<AXDRpxClient>& client)
-    : uuid_(UUID::random()), client_(client), clientIdentity_(client.get()), created_(Date::now()) {
-    Array summaries;
+    : uuid_(UUID::random()),
+      serial_(++gHoldSerials),
+      holderPid_(client ? client->pid() : 0),
+      client_(client.get()),
+      created_(Date::now()) {
+    std::unordered_set<UUID, corvane::UUIDHash> seen;
     for (const auto& p : plugIns) {
-        blocked_.insert(*p->uuid());
-        summaries.push_back(AXDWatchers::summary(*p));
+        if (seen.insert(*p->uuid()).second) plugIns_.push_back(p);
     }
-    plugIns_ = Value(std::move(summaries));
+    plugIns_.shrink_to_fit();
     corvane::rpx::beginWork();
 }
 
+Value AXDPlugInHold::summaries() const {
+    Array summaries;
+    summaries.reserve(plugIns_.size());
+    for (const auto& p : plugIns_) summaries.push_back(AXDWatchers::summary(*p));
+    return Value(std::move(summaries));
+}
+
 AXDPlugInHold::~AXDPlugInHold() { corvane::rpx::endWork(); }
-
-bool AXDPlugInHold::blocks(const AXDPlugIn& plugIn) const { return blocked_.count(*plugIn.uuid()) > 0; }
-
-bool AXDPlugInHold::heldBy(const AXDRpxClient* client) const { return clientIdentity_ == client && !client_.expired(); }
 
 // ---- server
 
@@ -41,7 +52,9 @@ AXDServer::AXDServer(const char* database, std::shared_ptr<corvane::vantry::Regi
     : AXDatabase(database, std::move(registry)),
       rpxQueue_(Queue::create("rpx")),
       mainQueue_(Queue::create("service", corvane::dispatch::QoS::UserInitiated)),
-      syncQueue_(Queue::create("serverSync")) {}
+      turns_(mainQueue_),
+      syncQueue_(Queue::create("serverSync")),
+      releaseQueue_(Queue::create("holdRelease", corvane::dispatch::QoS::Background)) {}
 
 std::shared_ptr<AXDServer> AXDServer::initForService(const std::string& serviceName, const char* database,
                                                      std::shared_ptr<corvane::vantry::Registry> registry) {
@@ -79,78 +92,131 @@ void AXDServer::run() {
     for (;;) pause();
 }
 
-void AXDServer::submitWork(std::function<void()> work) { mainQueue_->async(std::move(work)); }
-
-void AXDServer::submitReadingWork(const std::function<void()>& work) {
-    if (!mainQueue_->runIfIdle(work)) mainQueue_->async(work);
+void AXDServer::submitWork(pid_t client, std::function<void()> work) {
+    turns_.async(static_cast<uint64_t>(client), std::move(work));
 }
 
-void AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
-    Value event = corvane::dict({{"event", "hold"}, {"token", hold->uuid()}, {"plugins", hold->plugIns()}});
-    syncQueue_->sync([&] {
-        syncQueue_->assertCurrent();
-        holds_.push_back(std::move(hold));
-        ++holdsChanges_;
-    });
-    (void)corvane::notify::post(kAnnotationChangeNotification);
-    watchers().publish(event);
+void AXDServer::submitReadingWork(pid_t client, const std::function<void()>& work) {
+    if (!turns_.runIfIdle(static_cast<uint64_t>(client), work)) turns_.async(static_cast<uint64_t>(client), work);
 }
 
 namespace {
 
-Value releaseEvent(const AXDPlugInHold& hold) {
-    return corvane::dict({{"event", "release"}, {"token", hold.uuid()}, {"plugins", hold.plugIns()}});
+// What watchers learn of a hold: who holds it and what, never its token.
+Value holdEvent(const char* kind, const AXDPlugInHold& hold) {
+    return corvane::dict({{"event", kind}, {"hold", hold.serial()}, {"pid", int64_t{hold.holderPid()}}, {"plugins", hold.summaries()}});
 }
 
+Value releaseEvent(const AXDPlugInHold& hold) { return holdEvent("release", hold); }
+
 }  // namespace
+
+bool AXDServer::addHold(std::shared_ptr<AXDPlugInHold> hold) {
+    Value event = holdEvent("hold", *hold);
+    bool added = syncQueue_->syncResult([&] {
+        syncQueue_->assertCurrent();
+        const AXDRpxClient* client = hold->client();
+        // A client already gone (its holds were released as it went) keeps nothing.
+        if (client && client->holdsReleased()) return false;
+        auto& tokens = holdsByClient_[client];
+        if (tokens.size() >= kMaxHoldsPerClient) return false;
+        tokens.push_back(hold->uuid());
+        for (const auto& plugIn : hold->plugIns()) ++heldCounts_[*plugIn->uuid()];
+        holds_.emplace(hold->uuid(), std::move(hold));
+        ++holdsChanges_;
+        return true;
+    });
+    if (!added) return false;
+    (void)corvane::notify::post(kAnnotationChangeNotification);
+    watchers().publish(event);
+    return true;
+}
+
+std::shared_ptr<AXDPlugInHold> AXDServer::forgetHold(const UUID& token) {
+    auto it = holds_.find(token);
+    if (it == holds_.end()) return nullptr;
+    std::shared_ptr<AXDPlugInHold> hold = std::move(it->second);
+    holds_.erase(it);
+    for (const auto& plugIn : hold->plugIns()) {
+        auto count = heldCounts_.find(*plugIn->uuid());
+        if (count != heldCounts_.end() && --count->second == 0) heldCounts_.erase(count);
+    }
+    ++holdsChanges_;
+    return hold;
+}
 
 void AXDServer::unholdToken(const UUID& token) {
     std::shared_ptr<AXDPlugInHold> released;
     syncQueue_->sync([&] {
         syncQueue_->assertCurrent();
-        for (auto it = holds_.begin(); it != holds_.end(); ++it) {
-            if ((*it)->uuid() != token) continue;
-            log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token);
-            released = *it;
-            holds_.erase(it);
-            ++holdsChanges_;
-            (void)corvane::notify::post(kAnnotationChangeNotification);
-            return;
+        released = forgetHold(token);
+        if (!released) return;
+        auto tokens = holdsByClient_.find(released->client());
+        if (tokens != holdsByClient_.end()) {
+            std::erase(tokens->second, token);
+            if (tokens->second.empty()) holdsByClient_.erase(tokens);
         }
     });
-    if (released) watchers().publish(releaseEvent(*released));
+    if (!released) return;
+    log::debug(logOps(), "releasing plug-in hold %{public}@ at client's request", token);
+    (void)corvane::notify::post(kAnnotationChangeNotification);
+    watchers().publish(releaseEvent(*released));
 }
 
-void AXDServer::unholdClient(const AXDRpxClient* client) {
-    std::vector<std::shared_ptr<AXDPlugInHold>> released;
+void AXDServer::unholdClient(AXDRpxClient* client) {
+    auto released = std::make_shared<std::vector<std::shared_ptr<AXDPlugInHold>>>();
     syncQueue_->sync([&] {
         syncQueue_->assertCurrent();
-        for (;;) {
-            auto it = std::find_if(holds_.begin(), holds_.end(),
-                                   [&](const auto& h) { return h->heldBy(client); });
-            if (it == holds_.end()) break;
-            log::debug(logOps(), "releasing plug-in hold %{public}@ for dead client pid %d", (*it)->uuid().string(),
-                       client->pid());
-            released.push_back(*it);
-            holds_.erase(it);
-            ++holdsChanges_;
-            (void)corvane::notify::post(kAnnotationChangeNotification);
+        client->setHoldsReleased();
+        auto tokens = holdsByClient_.find(client);
+        if (tokens == holdsByClient_.end()) return;
+        released->reserve(tokens->second.size());
+        for (const UUID& token : tokens->second) {
+            if (auto hold = forgetHold(token)) released->push_back(std::move(hold));
+        }
+        holdsByClient_.erase(tokens);
+    });
+    if (released->empty()) return;
+    // Matches see the holds gone from here on; one notification says so for all of them.
+    (void)corvane::notify::post(kAnnotationChangeNotification);
+    // The events and the freeing cost what the client held, up to a thousand holds: they are done
+    // on a queue of their own so that the connection's thread and the requests of others go on.
+    ++releasesQueued_;
+    releaseQueue_->async([this, released, pid = client->pid()] {
+        for (const auto& hold : *released) {
+            log::debug(logOps(), "releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(), pid);
+            watchers().publish(releaseEvent(*hold));
+        }
+        // Many holds gone leave their memory spread through the heap: it goes back once the
+        // releases queued together are done (many clients with many holds go at once).
+        holdsFreedSinceTrim_ += released->size();
+        released->clear();
+        if (--releasesQueued_ == 0 && holdsFreedSinceTrim_ >= 256) {
+            holdsFreedSinceTrim_ = 0;
+            malloc_trim(0);
         }
     });
-    for (const auto& hold : released) watchers().publish(releaseEvent(*hold));
 }
 
 bool AXDServer::holdOnPlugIn(const AXDPlugIn& plugIn) {
     return syncQueue_->syncResult([&] {
         syncQueue_->assertCurrent();
-        return std::any_of(holds_.begin(), holds_.end(), [&](const auto& h) { return h->blocks(plugIn); });
+        return heldCounts_.count(*plugIn.uuid()) > 0;
     });
 }
 
-std::vector<std::shared_ptr<const AXDPlugInHold>> AXDServer::currentHolds() {
+std::shared_ptr<const HeldPlugIns> AXDServer::heldPlugIns() {
     return syncQueue_->syncResult([&] {
         syncQueue_->assertCurrent();
-        return std::vector<std::shared_ptr<const AXDPlugInHold>>(holds_.begin(), holds_.end());
+        uint64_t changes = holdsChanges_.load();
+        if (!heldSnapshot_ || heldSnapshotChanges_ != changes) {
+            auto held = std::make_shared<HeldPlugIns>();
+            held->reserve(heldCounts_.size());
+            for (const auto& [uuid, count] : heldCounts_) held->insert(uuid);
+            heldSnapshot_ = std::move(held);
+            heldSnapshotChanges_ = changes;
+        }
+        return heldSnapshot_;
     });
 }
 

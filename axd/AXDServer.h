@@ -5,6 +5,8 @@
 #include <atomic>
 #include <memory>
 #include <set>
+#include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 #include "axd/AXDUserPrefs.h"
@@ -26,21 +28,29 @@ public:
     AXDPlugInHold& operator=(const AXDPlugInHold&) = delete;
 
     const UUID& uuid() const { return uuid_; }
-    bool blocks(const AXDPlugIn& plugIn) const;
-    const AXDRpxClient* client() const { return client_.lock().get(); }
-    bool heldBy(const AXDRpxClient* client) const;
+    // A number that names the hold in events: the token itself is never shown to anyone but the
+    // client that holds it (whoever knows it may release the hold).
+    uint64_t serial() const { return serial_; }
+    pid_t holderPid() const { return holderPid_; }
+    const AXDRpxClient* client() const { return client_; }
+    // The plug-ins it holds, each once.
+    const std::vector<AXDPlugInPtr>& plugIns() const { return plugIns_; }
     Date created() const { return created_; }
-    // The held plug-ins as events show them.
-    const Value& plugIns() const { return plugIns_; }
+    // The held plug-ins as events show them; made when an event is sent, so that a hold costs
+    // little more than its pointers (a client may keep a thousand).
+    Value summaries() const;
 
 private:
     const UUID uuid_;
-    std::set<UUID> blocked_;
-    std::weak_ptr<AXDRpxClient> client_;
-    const AXDRpxClient* clientIdentity_;
+    const uint64_t serial_;
+    const pid_t holderPid_;
+    std::vector<AXDPlugInPtr> plugIns_;
+    const AXDRpxClient* const client_;  // an identity only: its holds are released before it goes
     const Date created_;
-    Value plugIns_;
 };
+
+// The plug-ins some hold blocks, as a match reads them.
+using HeldPlugIns = std::unordered_set<UUID, corvane::UUIDHash>;
 
 // The database part lives on its queue; the holds on "serverSync"; requests run on "service".
 class AXDServer : public AXDatabase, public AXDatabaseDelegate {
@@ -53,19 +63,28 @@ public:
 
     // Resumes the listener and serves for the life of the process.
     [[noreturn]] void run();
-    void submitWork(std::function<void()> work);
+    // Work for a client process goes to the service queue in turns: the processes with work
+    // waiting take one task each in rotation, so that a process with many connections, or one
+    // served in slices, delays another's requests by at most one task of its own.
+    void submitWork(pid_t client, std::function<void()> work);
     // For work that only reads what the daemon keeps in memory and waits on no other process: it
     // runs at once on the calling thread (the listener's I/O thread) when the service queue is
     // idle, saving the hand-over to the queue's thread, and is queued otherwise.
-    void submitReadingWork(const std::function<void()>& work);
+    void submitReadingWork(pid_t client, const std::function<void()>& work);
 
-    void addHold(std::shared_ptr<AXDPlugInHold> hold);
+    // The most holds one connection may keep.
+    static constexpr size_t kMaxHoldsPerClient = 1024;
+    // False (and the hold dropped) when its client keeps kMaxHoldsPerClient holds already, or has
+    // gone meanwhile.
+    bool addHold(std::shared_ptr<AXDPlugInHold> hold);
     void unholdToken(const UUID& token);
-    void unholdClient(const AXDRpxClient* client);
+    // Releases every hold of the client, in the order they were made; from then on the client can
+    // make no more.
+    void unholdClient(AXDRpxClient* client);
     bool holdOnPlugIn(const AXDPlugIn& plugIn);
-    // The holds as they are now, for a request that tests many plug-ins against them at once.
-    // A hold's set of blocked plug-ins never changes.
-    std::vector<std::shared_ptr<const AXDPlugInHold>> currentHolds();
+    // The plug-ins held now, for a request that tests many plug-ins against them at once; made
+    // again only after the holds changed.
+    std::shared_ptr<const HeldPlugIns> heldPlugIns();
     size_t holdCount();
     // Changes whenever a hold is added or released.
     uint64_t holdsChangeCount() const { return holdsChanges_.load(); }
@@ -86,11 +105,24 @@ private:
     uint32_t verbose_ = 0;
     corvane::dispatch::QueuePtr rpxQueue_;
     corvane::dispatch::QueuePtr mainQueue_;
+    corvane::dispatch::Turns turns_;  // on mainQueue_
     std::shared_ptr<corvane::rpx::Listener> service_;
     std::unique_ptr<AXDUserPrefs> userPrefs_;
     const corvane::dispatch::QueuePtr syncQueue_;
-    std::vector<std::shared_ptr<AXDPlugInHold>> holds_ GUARDED_BY(*syncQueue_);
+    // Where released holds are announced and freed, away from the I/O thread and the service queue.
+    const corvane::dispatch::QueuePtr releaseQueue_;
+    std::atomic<size_t> releasesQueued_{0};
+    size_t holdsFreedSinceTrim_ = 0;  // on releaseQueue_
+    // The holds by token; the tokens of each client, in the order they were made; how many holds
+    // block each plug-in. Each release costs what the hold holds, never what others hold.
+    std::unordered_map<UUID, std::shared_ptr<AXDPlugInHold>, corvane::UUIDHash> holds_ GUARDED_BY(*syncQueue_);
+    std::unordered_map<const AXDRpxClient*, std::vector<UUID>> holdsByClient_ GUARDED_BY(*syncQueue_);
+    std::unordered_map<UUID, uint32_t, corvane::UUIDHash> heldCounts_ GUARDED_BY(*syncQueue_);
+    std::shared_ptr<const HeldPlugIns> heldSnapshot_ GUARDED_BY(*syncQueue_);
+    uint64_t heldSnapshotChanges_ GUARDED_BY(*syncQueue_) = 0;
     std::atomic<uint64_t> holdsChanges_{0};
+    // Removes one hold from the indexes (not from holdsByClient_).
+    std::shared_ptr<AXDPlugInHold> forgetHold(const UUID& token) REQUIRES(*syncQueue_);
 };
 
 }  // namespace annexa

@@ -8,9 +8,19 @@ namespace annexa {
 
 namespace log = corvane::log;
 
-void AXDWatchers::add(const corvane::rpx::ConnectionPtr& connection) {
+bool AXDWatchers::add(const corvane::rpx::ConnectionPtr& connection) {
     corvane::MutexLock lock(mutex_);
+    size_t ofProcess = 0;
+    auto end = std::remove_if(watchers_.begin(), watchers_.end(), [&](const auto& weak) {
+        auto watcher = weak.lock();
+        if (!watcher || !watcher->isValid()) return true;
+        if (watcher->pid() == connection->pid()) ++ofProcess;
+        return false;
+    });
+    watchers_.erase(end, watchers_.end());
+    if (ofProcess >= kPerProcess || watchers_.size() >= kInAll) return false;
     watchers_.push_back(connection);
+    return true;
 }
 
 bool AXDWatchers::empty() {

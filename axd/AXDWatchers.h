@@ -23,7 +23,12 @@ public:
     // daemon's memory.
     static constexpr size_t kBacklogBytes = 1u << 20;
 
-    void add(const corvane::rpx::ConnectionPtr& connection);
+    // Watchers one process may have, and all together: each event is sent to each of them.
+    static constexpr size_t kPerProcess = 8;
+    static constexpr size_t kInAll = 256;
+
+    // False when the connection's process has kPerProcess watchers already, or kInAll watch.
+    bool add(const corvane::rpx::ConnectionPtr& connection);
     // Sends an event to every watcher still connected; drops the ones that fell behind.
     void publish(const Value& event);
     bool empty();

@@ -9,6 +9,7 @@
 #include "axd/Transaction.h"
 #include "platform/bundle/Bundle.h"
 #include "platform/plist/Plist.h"
+#include "platform/rpx/Wire.h"
 #include "platform/trace/Trace.h"
 
 namespace annexa {
@@ -25,10 +26,19 @@ std::string uuidText(const AXDPlugIn& plugIn) { return plugIn.uuid() ? plugIn.uu
 }  // namespace
 
 void Transaction::readyPlugIns() {
-    // Once each, and only after every plug-in passed the checks.
-    std::vector<AXDPlugInPtr> enable;
-    std::set<UUID> chosen;
-    bool walked = processUuidList([&](const AXDPlugInPtr& plugIn) {
+    auto list = resolveUuidList();
+    if (!list) return;
+    // Checked first, each once, and enabled only after every plug-in passed the checks; both walks
+    // in slices, so that a host readying thousands of plug-ins holds no other client up.
+    struct Ready {
+        UuidList list;
+        std::vector<AXDPlugInPtr> enable;
+        std::set<UUID> chosen;
+        std::optional<Error> first;
+    };
+    auto ready = std::make_shared<Ready>(Ready{std::move(*list), {}, {}, {}});
+    auto check = [this, ready](size_t i) {
+        const AXDPlugInPtr& plugIn = ready->list.plugIns[i];
         std::string uuid = uuidText(*plugIn);
         AXD_TRACE(plugin__ready, uuid.c_str());
         std::optional<std::string> refusal;
@@ -46,39 +56,65 @@ void Transaction::readyPlugIns() {
                         log::formatText("access to plugin %@ denied: %@", plugIn->identifier(), *refusal));
             return Walk::Stop;
         }
-        if (chosen.insert(*plugIn->uuid()).second) enable.push_back(plugIn);
+        if (ready->chosen.insert(*plugIn->uuid()).second) ready->enable.push_back(plugIn);
         return Walk::Continue;
+    };
+    auto enable = [this, ready](size_t i) {
+        Status enabled = ready->enable[i]->enableForClient(*client_);
+        if (!enabled.ok() && !ready->first) ready->first = enabled.error();
+        return Walk::Continue;  // every plug-in is tried, also after a failure
+    };
+    inSlices(ready->list.plugIns.size(), check, [this, ready, enable](bool checked) {
+        if (!checked) return;
+        if (ready->list.end) return failMessage(ready->list.end->first, ready->list.end->second);
+        inSlices(ready->enable.size(), enable, [this, ready](bool) {
+            giveBackMemoryAfter(ready->list.plugIns.size());
+            if (ready->first) return failError(static_cast<AXErrorCode>(ready->first->code), *ready->first);
+            done();
+        });
     });
-    if (!walked) return;
-    std::optional<Error> first;
-    for (const AXDPlugInPtr& plugIn : enable) {
-        Status enabled = plugIn->enableForClient(*client_);
-        if (!enabled.ok() && !first) first = enabled.error();
-    }
-    if (first) return failError(static_cast<AXErrorCode>(first->code), *first);
-    done();
 }
 
 void Transaction::accessPlugIns() {
-    Array tokens;
-    bool walked = processUuidList([&](const AXDPlugInPtr& plugIn) {
+    auto list = resolveUuidList();
+    if (!list) return;
+    // The tokens are encoded for the reply as they are issued, slice by slice: thousands of them
+    // make a reply of hundreds of kilobytes, which would otherwise be built in one go at the end.
+    struct Access {
+        UuidList list;
+        std::shared_ptr<std::string> tokens = std::make_shared<std::string>();
+    };
+    auto access = std::make_shared<Access>(Access{std::move(*list)});
+    corvane::rpx::wire::appendArrayHeader(*access->tokens, static_cast<uint32_t>(access->list.plugIns.size()));
+    auto issue = [this, access](size_t i) {
+        const AXDPlugInPtr& plugIn = access->list.plugIns[i];
         auto token = issueReadExtensionForURL(plugIn->url());
         if (!token) {
             failMessage(AXErrorCode::InvalidRequest,
                         log::formatText("cannot create extension to %@: %d", plugIn->url(), token.error().code));
             return Walk::Stop;
         }
-        tokens.emplace_back(*token);
+        (void)corvane::rpx::wire::appendElement(*access->tokens, Value(std::move(*token)));
         return Walk::Continue;
+    };
+    inSlices(access->list.plugIns.size(), issue, [this, access](bool issued) {
+        if (!issued) return;
+        if (access->list.end) return failMessage(access->list.end->first, access->list.end->second);
+        static const uint32_t kTextArray = Value(Array{Value("")}).kindsInside();
+        reply_[message::kExtensions] =
+            convertValueToMessage(corvane::rpx::wire::encodedContainer(std::move(access->tokens), 1, kTextArray));
+        done();
+        giveBackMemoryAfter(access->list.plugIns.size());
     });
-    if (!walked) return;
-    reply_[message::kExtensions] = convertValueToMessage(Value(std::move(tokens)));
-    done();
 }
 
 void Transaction::lockDownPlugIns() {
-    if (const Array* tokens = request()[message::kUuids].asArray()) {
-        for (const Value& token : *tokens) {
+    if (const Value& list = request()[message::kUuids]; list.isArray()) {
+        if (corvane::rpx::arrayCount(list) > kMaxListElements) {
+            return failMessage(AXErrorCode::InvalidRequest,
+                               log::formatText("invalid request format (more than %u uuids)", static_cast<unsigned>(kMaxListElements)));
+        }
+        for (const Value& token : *list.asArray()) {
             // An element that is no UUID names no hold: passed over like an unknown token.
             if (const UUID* uuid = token.asUUID()) server().unholdToken(*uuid);
         }
@@ -126,7 +162,10 @@ void Transaction::lockDownPlugIns() {
     }
     auto hold = std::make_shared<AXDPlugInHold>(plugIns, client_);
     UUID token = hold->uuid();
-    server().addHold(std::move(hold));
+    if (!server().addHold(std::move(hold))) {
+        return failMessage(AXErrorCode::InvalidRequest,
+                           log::formatText("too many holds (%u on this connection)", static_cast<unsigned>(AXDServer::kMaxHoldsPerClient)));
+    }
     reply_[message::kUuids] = Value(token);
     log::debug(logOps(), "hold request granted uuid:%{public}@", token);
     done();

@@ -4,7 +4,6 @@
 // own, the reply also says for every installed plug-in the step that left it out.
 #include <algorithm>
 #include <deque>
-#include <malloc.h>
 #include <map>
 #include <unordered_set>
 
@@ -72,8 +71,49 @@ Value encodeMatches(const std::vector<AXDMatchResults::EntryPtr>& list, const st
 
 }  // namespace
 
-// A walk over at least this many candidates gives the freed memory back to the system.
-constexpr size_t kTrimAfterCandidates = 1000;
+// How large the rules of one "match" may be, since every rule is tested against every candidate:
+// keys, strings in one array pattern, items a host offers (an offer is a dictionary pattern), and
+// the bytes of one string.
+constexpr size_t kMaxRuleKeys = 64;
+constexpr size_t kMaxPatternElements = 256;
+constexpr size_t kMaxOfferedItems = 1024;
+constexpr size_t kMaxPatternBytes = 4096;
+// And the encoded rules as a whole, looked at before anything in them is decoded: rules within the
+// bounds above, written as a host writes them, take a few kilobytes.
+constexpr size_t kMaxRulesBytes = 256 * 1024;
+
+namespace {
+
+// What makes rules too large to be served, or nothing.
+std::optional<std::string> rulesBeyondBounds(const Value& rules) {
+    const Dictionary* tests = rules.asDictionary();
+    if (!tests) return std::nullopt;
+    if (tests->size() > kMaxRuleKeys) return "at most " + std::to_string(kMaxRuleKeys) + " keys";
+    auto longText = [](const Value& v) { return v.isString() && v.asString()->size() > kMaxPatternBytes; };
+    for (const auto& [key, pattern] : *tests) {
+        if (key.size() > kMaxPatternBytes || longText(pattern)) return "a key or pattern longer than 4096 bytes";
+        if (const Array* many = pattern.asArray()) {
+            if (many->size() > kMaxPatternElements) return "at most " + std::to_string(kMaxPatternElements) + " patterns under " + key;
+            for (const Value& e : *many)
+                if (longText(e)) return "a pattern longer than 4096 bytes under " + key;
+        } else if (const Dictionary* offer = pattern.asDictionary()) {
+            if (offer->size() > 16) return "an offer under " + key + " with more than 16 keys";
+            for (const auto& [name, items] : *offer) {
+                const Array* list = items.asArray();
+                if (list && list->size() > kMaxOfferedItems)
+                    return "at most " + std::to_string(kMaxOfferedItems) + " offered items under " + key;
+                if (longText(items)) return "an offered type longer than 4096 bytes under " + key;
+                if (list) {
+                    for (const Value& e : *list)
+                        if (longText(e) || e.isArray() || e.isDictionary()) return "an offered item that is no type under " + key;
+                }
+            }
+        }
+    }
+    return std::nullopt;
+}
+
+}  // namespace
 
 // What a "match" depends on besides the host, its rules and its flags. The request reads them once,
 // at its start, and its walk uses what it read.
@@ -177,7 +217,7 @@ KeptAnswers& keptAnswers() {
 
 std::optional<std::string> Transaction::matchRefusal(
     const AXDPlugIn& p, const Value& rules, uint64_t flags, const std::vector<Value>& exclusions,
-    const MatchHolds& holds, std::vector<std::string>& logged) {
+    const MatchHolds& holds, std::vector<std::string>& logged, bool worded) {
     using namespace discovery;
     if (!(flags & kAll)) {
         if (!p.onSystemVolume()) {
@@ -189,17 +229,17 @@ std::optional<std::string> Transaction::matchRefusal(
             auto plugIns = bundle ? bundle->plugInsPath() : std::nullopt;
             if (!plugIns || p.path().rfind(*plugIns, 0) != 0) return std::string("dedicated to another application");
         }
-        if (std::any_of(holds.begin(), holds.end(), [&](const auto& h) { return h->blocks(p); }))
-            return std::string("held");
+        if (holds && holds->count(*p.uuid())) return std::string("held");
     }
     if (const Dictionary* tests = rules.asDictionary()) {
         for (const auto& [key, pattern] : *tests)
-            if (!p.matchKeyPattern(key, pattern)) return "rule " + key + " does not match: " + pattern.description();
+            if (!p.matchKeyPattern(key, pattern))
+                return worded ? "rule " + key + " does not match: " + pattern.description() : std::string("rule");
     }
     for (const Value& exclusion : exclusions) {
         if (!p.match(exclusion)) continue;
         logged.push_back(log::formatText("client %d plugin %@ globally excluded", client_->pid(), p.uuid()));
-        return "excluded by the user: " + exclusion.description();
+        return worded ? "excluded by the user: " + exclusion.description() : std::string("excluded");
     }
     if (!(flags & kAll)) {
         if (auto reason = p.allowForClient(*client_)) {
@@ -222,7 +262,7 @@ std::shared_ptr<const MatchAnswer> Transaction::walkForMatch(const Value& rules,
     AXDMatchResults::Outcomes* outcome = explain ? &outcomes : nullptr;
     AXDMatchResults results(flags, candidates.size());
     for (const auto& p : candidates) {
-        if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, holds, answer->logged)) {
+        if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, holds, answer->logged, explain)) {
             if (outcome) outcomes[p.get()] = *refusal;
             continue;
         }
@@ -253,9 +293,12 @@ std::shared_ptr<const MatchAnswer> Transaction::walkForMatch(const Value& rules,
 
 Value Transaction::explainAll(const std::vector<AXDPlugInPtr>& candidates, AXDMatchResults::Outcomes& outcomes,
                               const Value& rules, uint64_t flags, const MatchInputs& inputs, const MatchHolds& holds) {
-    // Every installed plug-in is explained, in the registry's order. One the registry's query did
-    // not give (only its election filter drops what the rules would take) says why: the step that
-    // refuses it, else the election filter.
+    // Every installed plug-in is explained, in the registry's order, to a client with the manager
+    // entitlement; to any other, only the plug-ins it could be returned (those its visibility and
+    // authorization let it see), so that an explanation names nothing the host may not see. One the
+    // registry's query did not give (only its election filter drops what the rules would take) says
+    // why: the step that refuses it, else the election filter.
+    bool everything = client_->hasEntitlement(keys::kManagerEntitlement);
     std::vector<AXDPlugInPtr> installed = server().findPlugIns(Value());
     std::unordered_set<const AXDPlugIn*> given;
     for (const auto& p : candidates) given.insert(p.get());
@@ -263,10 +306,12 @@ Value Transaction::explainAll(const std::vector<AXDPlugInPtr>& candidates, AXDMa
     Array explanations;
     explanations.reserve(installed.size());
     for (const auto& p : installed) {
+        // (What the host may see, whatever it asked for: system only or not.)
+        if (!everything && matchRefusal(*p, Value(), flags & ~discovery::kSystemOnly, {}, holds, unlogged, false)) continue;
         std::string outcome;
         if (given.count(p.get())) {
             outcome = outcomes[p.get()];
-        } else if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, holds, unlogged)) {
+        } else if (auto refusal = matchRefusal(*p, rules, flags, inputs.exclusions, holds, unlogged, true)) {
             outcome = *refusal;
         } else {
             outcome = "left out by the election filter: its election reads as " + server().electionText(*p);
@@ -286,7 +331,16 @@ void Transaction::matchPlugIns() {
         failMessage(AXErrorCode::InvalidRequest, "invalid request format (bad rules dictionary)");
         return;
     }
+    if (const auto* encoded = rulesEntry.encoding(); encoded && encoded->bytes.size() > kMaxRulesBytes) {
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (rules: more than " +
+                                                     std::to_string(kMaxRulesBytes / 1024) + " KiB)");
+        return;
+    }
     Value rules = rulesEntry.isNull() ? Value() : convertMessageToValue(rulesEntry);
+    if (auto beyond = rulesBeyondBounds(rules)) {
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (rules: " + *beyond + ")");
+        return;
+    }
     uint64_t flags = flagsArgument();
     if ((flags & kAll) && (!client_->hasEntitlement(keys::kManagerEntitlement) || corvane::sandbox::isSandboxed(client_->pid()))) {
         failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (AXDiscoverAll)");
@@ -308,10 +362,8 @@ void Transaction::matchPlugIns() {
     KeptAnswers::Key key{client_, rules, flags, version()};
     auto answer = keepable ? keptAnswers().find(key, inputs) : nullptr;
     if (!answer) {
-        answer = walkForMatch(rules, flags, explain, inputs, server().currentHolds());
-        // A walk over many plug-ins leaves megabytes of freed lists and maps in the heap, spread
-        // between what stays; they go back to the system (about half a millisecond at 10,000).
-        if (answer->raw >= kTrimAfterCandidates) malloc_trim(0);
+        answer = walkForMatch(rules, flags, explain, inputs, server().heldPlugIns());
+        giveBackMemoryAfter(answer->raw);
         if (keepable) keptAnswers().keep(std::move(key), inputs, answer);
     } else {
         AXD_TRACE(discover__raw, answer->raw);

@@ -1,5 +1,8 @@
 #include "axd/Transaction.h"
 
+#include <malloc.h>
+
+#include <chrono>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -41,11 +44,13 @@ Transaction::Transaction(corvane::rpx::Event request, std::shared_ptr<AXDRpxClie
     : client_(std::move(client)), request_(std::move(request)) {}
 
 Transaction::~Transaction() {
-    if (answered_ || !request_.wantsReply) return;
-    const std::string* name = request()[message::kRequest].asString();
-    log::error(logOps(), "request %{public}s of client %d ended without a reply; answering with an internal error",
-               name ? name->c_str() : "(none)", client_->pid());
-    failMessage(AXErrorCode::InvalidRequest, "internal error: the request ended without a reply");
+    if (!answered_ && request_.wantsReply) {
+        const std::string* name = request()[message::kRequest].asString();
+        log::error(logOps(), "request %{public}s of client %d ended without a reply; answering with an internal error",
+                   name ? name->c_str() : "(none)", client_->pid());
+        failMessage(AXErrorCode::InvalidRequest, "internal error: the request ended without a reply");
+    }
+    client_->requestEnded();
 }
 
 AXDServer& Transaction::server() const { return *client_->server(); }
@@ -129,6 +134,11 @@ bool Transaction::marshalPaths(const std::function<Walk(const std::string&, bool
         failMessage(AXErrorCode::InvalidRequest, "invalid request format");
         return false;
     }
+    if (corvane::rpx::arrayCount(*paths) > kMaxListElements) {
+        failMessage(AXErrorCode::InvalidRequest,
+                    log::formatText("invalid request format (more than %u paths)", static_cast<unsigned>(kMaxListElements)));
+        return false;
+    }
     for (const Value& element : *paths->asArray()) {
         const std::string* path = element.asString();
         if (!path) {
@@ -150,11 +160,16 @@ void Transaction::processPaths(const std::function<Walk(const std::string&, bool
     if (marshalPaths(handler)) done();
 }
 
-bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>& handler) {
+std::optional<Transaction::UuidList> Transaction::resolveUuidList() {
     const Value* uuids = rpx_dictionary_get_array(request(), message::kUuids);
     if (!uuids) {
         failMessage(AXErrorCode::InvalidRequest, "invalid request format (uuid)");
-        return false;
+        return std::nullopt;
+    }
+    if (corvane::rpx::arrayCount(*uuids) > kMaxListElements) {
+        failMessage(AXErrorCode::InvalidRequest,
+                    log::formatText("invalid request format (more than %u uuids)", static_cast<unsigned>(kMaxListElements)));
+        return std::nullopt;
     }
     // The plug-ins are looked up in one visit to the database, up to the first element that is no
     // UUID, and a run of one UUID repeated only once; the walk then answers for the elements in
@@ -171,21 +186,71 @@ bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>
         distinct.push_back(parsed[i]);
         runs.push_back(1);
     }
+    UuidList list;
+    list.plugIns.reserve(parsed.size());
     std::vector<AXDPlugInPtr> plugIns = server().plugInsForUUIDs(distinct);
     for (size_t r = 0; r < plugIns.size(); ++r) {
         if (!plugIns[r]) {
-            failMessage(AXErrorCode::InvalidRequest, "no such plugin (uuid not found)");
-            return false;
+            list.end = std::make_pair(AXErrorCode::InvalidRequest, std::string("no such plugin (uuid not found)"));
+            return list;
         }
-        for (size_t k = 0; k < runs[r]; ++k) {
-            if (handler(plugIns[r]) == Walk::Stop) return false;
-        }
+        list.plugIns.insert(list.plugIns.end(), runs[r], plugIns[r]);
     }
-    if (!allUuids) {
-        failMessage(AXErrorCode::InvalidRequest, "invalid request (bad uuid array)");
+    if (!allUuids) list.end = std::make_pair(AXErrorCode::InvalidRequest, std::string("invalid request (bad uuid array)"));
+    return list;
+}
+
+bool Transaction::processUuidList(const std::function<Walk(const AXDPlugInPtr&)>& handler) {
+    auto list = resolveUuidList();
+    if (!list) return false;
+    for (const AXDPlugInPtr& plugIn : list->plugIns) {
+        if (handler(plugIn) == Walk::Stop) return false;
+    }
+    if (list->end) {
+        failMessage(list->end->first, list->end->second);
         return false;
     }
     return true;
+}
+
+void Transaction::giveBackMemoryAfter(size_t plugIns) {
+    if (plugIns >= kTrimAfterPlugIns) malloc_trim(0);
+}
+
+void Transaction::inSlices(size_t count, std::function<Walk(size_t)> step, std::function<void(bool)> finish) {
+    struct Walking {
+        size_t next = 0;
+        size_t count;
+        std::function<Walk(size_t)> step;
+        std::function<void(bool)> finish;
+    };
+    auto walking = std::make_shared<Walking>(Walking{0, count, std::move(step), std::move(finish)});
+    auto slice = std::make_shared<std::function<void()>>();
+    // The slice holds the transaction (and so its client's next request) until the walk ends.
+    *slice = [self = shared_from_this(), walking, weakSlice = std::weak_ptr<std::function<void()>>(slice)] {
+        // A client that went away meanwhile waits for nothing: the rest of its walk is dropped.
+        if (walking->next > 0) {
+            auto conn = self->connection();
+            if (!conn || !conn->isValid()) {
+                self->answered_ = true;  // there is nobody to answer
+                giveBackMemoryAfter(walking->count);
+                return;
+            }
+        }
+        auto started = std::chrono::steady_clock::now();
+        while (walking->next < walking->count) {
+            if (walking->step(walking->next++) == Walk::Stop) return walking->finish(false);
+            if (walking->next < walking->count && std::chrono::steady_clock::now() - started > kSlice) {
+                // The rest is the client's next turn: every other client with work waiting is
+                // served once before it.
+                if (auto again = weakSlice.lock()) self->server().submitWork(self->client_->pid(), [again] { (*again)(); });
+                return;
+            }
+        }
+        walking->finish(true);
+    };
+    // The first slice runs now; a queued one keeps `slice` alive through its own capture.
+    (*slice)();
 }
 
 // ---- registration

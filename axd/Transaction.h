@@ -2,11 +2,13 @@
 // request name, the common walks over paths and UUIDs, the handlers, and the one reply.
 #pragma once
 
+#include <chrono>
 #include <functional>
 #include <map>
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "Annexa/AXUtilities.h"
@@ -16,16 +18,27 @@
 namespace annexa {
 
 class AXDRpxClient;
-class AXDPlugInHold;
 class AXDServer;
-using MatchHolds = std::vector<std::shared_ptr<const AXDPlugInHold>>;
+// The plug-ins held when a match began (AXDServer::heldPlugIns).
+using MatchHolds = std::shared_ptr<const std::unordered_set<UUID, corvane::UUIDHash>>;
 struct MatchAnswer;
 struct MatchInputs;
 
-// Lives on: the service queue, for the length of its handler.
-class Transaction {
+// Lives on: the service queue, for the length of its handler (and of its slices, for a handler
+// that walks many plug-ins).
+class Transaction : public std::enable_shared_from_this<Transaction> {
 public:
     enum class Walk { Continue, Stop };
+    // The most elements a "uuids" or "paths" list may have.
+    static constexpr size_t kMaxListElements = 4096;
+    // How long one slice of a long walk holds the service queue before the rest waits for the
+    // client's next turn.
+    static constexpr std::chrono::microseconds kSlice{100};
+    // A request over at least this many plug-ins leaves megabytes of freed lists and maps in the
+    // heap, spread between what stays: they go back to the system when it ends (about half a
+    // millisecond at 10,000; giveBackMemoryAfter).
+    static constexpr size_t kTrimAfterPlugIns = 1000;
+    static void giveBackMemoryAfter(size_t plugIns);
 
     Transaction(corvane::rpx::Event request, std::shared_ptr<AXDRpxClient> client);
     // A request must be answered once. One that a handler left unanswered is answered here, with
@@ -52,6 +65,19 @@ public:
     void processPaths(const std::function<Walk(const std::string& path, bool resolved)>& handler);
     // Walks "uuids", looking each plug-in up. False when the walk stopped (the reply was sent).
     bool processUuidList(const std::function<Walk(const AXDPlugInPtr& plugIn)>& handler);
+    // "uuids" looked up: the plug-ins of its elements in order, up to the first that names none
+    // (or is no UUID), and the error the walk ends with then. Nothing when the list itself is
+    // malformed or too long (answered).
+    struct UuidList {
+        std::vector<AXDPlugInPtr> plugIns;
+        std::optional<std::pair<AXErrorCode, std::string>> end;
+    };
+    std::optional<UuidList> resolveUuidList();
+    // Runs step(0) .. step(count - 1) on the service queue a slice at a time (kSlice): the rest of
+    // a walk waits for the client's next turn (AXDServer::submitWork), and the transaction, with its
+    // client's next request, waits until `finish` has run: finish(true) after the last step,
+    // finish(false) when a step answered Walk::Stop.
+    void inSlices(size_t count, std::function<Walk(size_t)> step, std::function<void(bool)> finish);
 
     // The request handlers.
     void addPlugIns();
@@ -76,10 +102,12 @@ public:
 private:
     // Why "match" leaves the plug-in out before export (visibility, the holds taken at the
     // request's start, rules, exclusions, authorization), or nothing.
-    // Refusals that the log shows (exclusions, authorization) add their line to `logged`.
+    // Refusals that the log shows (exclusions, authorization) add their line to `logged`. Only a
+    // `worded` reason quotes the rule or exclusion (an explanation's); otherwise it is a word, since
+    // a host's rules may be long and most candidates fail one.
     std::optional<std::string> matchRefusal(const AXDPlugIn& plugIn, const Value& rules, uint64_t flags,
                                             const std::vector<Value>& exclusions, const MatchHolds& holds,
-                                            std::vector<std::string>& logged);
+                                            std::vector<std::string>& logged, bool worded);
     // The walk of "match" over the registry's candidates, with what the request read at its start.
     std::shared_ptr<const MatchAnswer> walkForMatch(const Value& rules, uint64_t flags, bool explain,
                                                     const MatchInputs& inputs, const MatchHolds& holds);

@@ -6,7 +6,13 @@ namespace annexa {
 
 void Transaction::watchRegistry() {
     // The reply says the connection is subscribed; events follow on it until it ends.
-    if (auto conn = connection()) server().watchers().add(conn);
+    auto conn = connection();
+    if (conn && !server().watchers().add(conn)) {
+        return failMessage(AXErrorCode::InvalidRequest,
+                           corvane::log::formatText("too many watchers (%u a process, %u in all)",
+                                                    static_cast<unsigned>(AXDWatchers::kPerProcess),
+                                                    static_cast<unsigned>(AXDWatchers::kInAll)));
+    }
     done();
 }
 

@@ -374,8 +374,7 @@ std::string describeEvent(const Value& event) {
     if (what == "annotation") {
         return what + " " + plugIn(event["plugin"]) + ": " + event["old"].description() + " -> " + event["new"].description();
     }
-    const corvane::UUID* token = event["token"].asUUID();
-    std::string line = what + " " + (token ? token->string() : "");
+    std::string line = what + " " + event["hold"].description() + " by pid " + event["pid"].description();
     if (const corvane::Array* plugIns = event["plugins"].asArray()) {
         for (const Value& p : *plugIns) line += "\n    " + plugIn(p);
     }

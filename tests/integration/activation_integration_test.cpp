@@ -352,3 +352,43 @@ TEST(Activation, ASignedProgramRunningCodeItsSignatureDoesNotCoverHasNoEntitleme
     auto removed = p.axctl({"remove", p.app}, manager);
     EXPECT_EQ(removed.status, 0) << removed.err;
 }
+
+// A plug-in may ask axd what any host may ask, but not what only an unconfined manager may: its
+// sandbox is known from the kernel, whatever its signature says.
+TEST(Activation, ASandboxedPlugInIsRefusedWhatOnlyAnUnconfinedManagerMay) {
+    Platform p;
+    // The greeter signed as a manager; the keyboard plug-in not signed at all.
+    ASSERT_TRUE(codesign::sign(p.plugInPath("com.example.greeter") + "/Sample", p.key, std::nullopt,
+                               dict({{"com.corvane.private.annexa.manager", true}})).ok());
+    UUID keys = p.uuids.at("com.example.keys");
+    Value annotateKeys = request("annotate", {{"uuids", Value(Array{Value(keys)})}, {"annotations", dict({{"election", 1}})}});
+    struct Case {
+        const char* name;
+        const char* plugIn;
+        Value request;
+        Value reply;  // null: any reply without an error
+    };
+    const Case cases[] = {
+        {"every plug-in", "com.example.greeter", request("match", {{"flags", uint64_t{0x200}}}),
+         dict({{"errorcode", uint64_t{11}}, {"error", "unauthorized discovery flag (AXDiscoverAll)"}})},
+        {"the explanation", "com.example.greeter", request("match", {{"flags", uint64_t{0x10000}}}),
+         dict({{"errorcode", uint64_t{11}}, {"error", "unauthorized discovery flag (explain)"}})},
+        {"every plug-in, unsigned", "com.example.keys", request("match", {{"flags", uint64_t{0x200}}}),
+         dict({{"errorcode", uint64_t{11}}, {"error", "unauthorized discovery flag (AXDiscoverAll)"}})},
+        {"a removal, unsigned", "com.example.keys", request("remove", {{"paths", Value(Array{Value(p.app)})}}),
+         dict({{"errorcode", uint64_t{11}}, {"error", "caller lacks entitlement for this operation"}})},
+        {"a match", "com.example.greeter", request("match"), Value()},
+        {"an annotation", "com.example.keys", annotateKeys, Value()},
+        {"a token", "com.example.keys", request("access", {{"uuids", Value(Array{Value(keys)})}}), Value()},
+    };
+    for (const auto& c : cases) {
+        Value reply = p.run(c.plugIn, dict({{"do", "axd"}, {"request", c.request}}));
+        if (c.reply.isNull()) {
+            EXPECT_TRUE(reply.isDictionary() && reply["errorcode"].isNull()) << c.name << ": " << reply.description();
+        } else {
+            EXPECT_EQ(reply, c.reply) << c.name;
+        }
+    }
+    // Still registered: the refused removal removed nothing.
+    EXPECT_EQ(p.axctl({"ready", keys.string()}).status, 0);
+}

@@ -547,14 +547,17 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("rule KSExtensionIdentifier does not match"), std::string::npos)
         << explained.out;
     EXPECT_NE(line(other + "/PlugIns/Replacer.appex").find("excluded by the user"), std::string::npos) << explained.out;
-    EXPECT_NE(line(dedicated).find("dedicated to another application"), std::string::npos) << explained.out;
     explained = d.axctl({"match", "--explain", "--system-only"});
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("not on the system volume"), std::string::npos) << explained.out;
+    // A host explains only what it may see: the plug-in dedicated to another application is not
+    // named to it, nor one its entitlement does not allow; the manager's explanation names them all.
+    EXPECT_EQ(line(dedicated), "") << explained.out;
     explained = d.axctl({"match", "--explain"}, {}, restricted);
-    EXPECT_NE(line(other + "/PlugIns/New.appex").find("not allowed: the host's plug-in entitlement does not allow this plug-in"),
-              std::string::npos)
-        << explained.out;
+    EXPECT_EQ(line(other + "/PlugIns/New.appex"), "") << explained.out;
     EXPECT_NE(line(app + "/PlugIns/Two.appex").find("returned"), std::string::npos) << explained.out;
+    explained = d.axctl({"match", "--explain"}, {}, manager);
+    EXPECT_NE(line(dedicated).find("dedicated to another application"), std::string::npos) << explained.out;
+    EXPECT_NE(line(other + "/PlugIns/New.appex").find("returned"), std::string::npos) << explained.out;
 }
 
 // A host that asks again on its connection gets its last answer again only while nothing it
@@ -913,4 +916,96 @@ TEST(Axd, ABundleFileThatIsAFifoAHugeFileOrADeviceIsAnErrorAtOnce) {
     EXPECT_TRUE(d.axd->waitForErr("Receipt: 200 MiB, larger than the 1 MiB it may be"));
     // Still serving, and its memory did not grow by the huge file.
     EXPECT_LT(residentKiB() - residentBefore, 32 * 1024);
+}
+
+// What one client may ask at once is bounded, and past a bound it gets an error reply while the
+// daemon serves on; within the bounds, a long request is answered in its turn, after the client's
+// earlier requests and before its later ones.
+TEST(Axd, EveryBoundOfARequestIsThatClientsErrorAndOrderIsKept) {
+    Daemon d;
+    std::string app = makeApp(d.root.path());
+    ASSERT_EQ(d.axctl({"add", app}).status, 0);
+    auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
+    ASSERT_TRUE(registry.ok());
+    UUID one = (*registry)->plugInForPath(app + "/PlugIns/One.appex")->uuid();
+    UUID two = (*registry)->plugInForPath(app + "/PlugIns/Two.appex")->uuid();
+    auto uuids = [&](size_t n) {
+        Array list;
+        for (size_t i = 0; i < n; ++i) list.push_back(Value(i % 2 ? two : one));
+        return Value(std::move(list));
+    };
+    auto paths = [&](size_t n) { return Value(Array(n, Value(app + "/PlugIns/One.appex"))); };
+    auto rulesWith = [](Dictionary rules) { return request("match", {{"rules", Value(std::move(rules))}}); };
+    Dictionary manyKeys;
+    for (int i = 0; i < 65; ++i) manyKeys["key" + std::to_string(i)] = Value("x");
+    Array manyPatterns(257, Value("p"));
+    Array manyItems(1025, Value("public.text"));
+
+    struct Case {
+        const char* name;
+        Value message;
+        Value reply;
+    };
+    const Case cases[] = {
+        {"4097 uuids", request("access", {{"uuids", uuids(4097)}}), error(4, "invalid request format (more than 4096 uuids)")},
+        {"4097 uuids to ready", request("ready", {{"uuids", uuids(4097)}}), error(4, "invalid request format (more than 4096 uuids)")},
+        {"4097 paths", request("remove", {{"paths", paths(4097)}}), error(4, "invalid request format (more than 4096 paths)")},
+        {"65 rule keys", rulesWith(manyKeys), error(4, "invalid request format (rules: at most 64 keys)")},
+        {"257 patterns", rulesWith({{"KSExtensionIdentifier", Value(manyPatterns)}}),
+         error(4, "invalid request format (rules: at most 256 patterns under KSExtensionIdentifier)")},
+        {"1025 offered items", rulesWith({{"Types", dict({{"offered", Value(manyItems)}})}}),
+         error(4, "invalid request format (rules: at most 1024 offered items under Types)")},
+        {"a 5000-byte pattern", rulesWith({{"KSExtensionIdentifier", Value(std::string(5000, 'x'))}}),
+         error(4, "invalid request format (rules: a key or pattern longer than 4096 bytes)")},
+        {"300 KiB of rules", rulesWith({{"a", Value(std::string(150 << 10, 'x'))}, {"b", Value(std::string(150 << 10, 'y'))}}),
+         error(4, "invalid request format (rules: more than 256 KiB)")},
+    };
+    for (const auto& c : cases) EXPECT_EQ(d.send(c.message), c.reply) << c.name;
+
+    // 4096 is served, in slices, and one connection's replies come in the order it asked.
+    auto c = d.connect();
+    std::vector<std::string> order;
+    Mutex orderMutex;
+    std::atomic<int> answered{0};
+    auto record = [&](const char* name, Value* kept = nullptr) {
+        return [&, name, kept](const rpx::Reply& r) {
+            {
+                MutexLock lock(orderMutex);
+                order.push_back(name);
+                if (kept) *kept = r.value;
+            }
+            ++answered;
+        };
+    };
+    Value accessed;
+    c->sendWithReply(request("access", {{"uuids", uuids(4096)}}), d.queue, record("access", &accessed));
+    c->sendWithReply(request("bulk"), d.queue, record("bulk"));
+    c->sendWithReply(request("match"), d.queue, record("match"));
+    ASSERT_TRUE(axtest::eventually([&] { return answered.load() == 3; }));
+    {
+        MutexLock lock(orderMutex);
+        EXPECT_EQ(order, (std::vector<std::string>{"access", "bulk", "match"}));
+        const Array* tokens = accessed["extensions"].asArray();
+        ASSERT_TRUE(tokens) << accessed.description();
+        EXPECT_EQ(tokens->size(), 4096u);
+    }
+
+    // Holds: 1024 on one connection, then that connection's error; another connection still holds.
+    Value hold = request("lock", {{"paths", paths(1)}, {"flags", uint64_t{2}}});
+    auto holder = d.connect();
+    for (int i = 0; i < 1024; ++i) ASSERT_TRUE(holder->sendWithReplySync(hold).value["uuids"].isUUID()) << i;
+    EXPECT_EQ(holder->sendWithReplySync(hold).value, error(4, "too many holds (1024 on this connection)"));
+    EXPECT_TRUE(d.connect()->sendWithReplySync(hold).value["uuids"].isUUID());
+
+    // Watchers: eight for one process, the ninth is refused.
+    std::vector<std::shared_ptr<rpx::Connection>> watchers;
+    for (int i = 0; i < 8; ++i) {
+        watchers.push_back(d.connect());
+        EXPECT_EQ(watchers.back()->sendWithReplySync(request("watch")).value, dict({})) << i;
+    }
+    EXPECT_EQ(d.connect()->sendWithReplySync(request("watch")).value, error(4, "too many watchers (8 a process, 256 in all)"));
+    watchers.back()->cancel();
+    watchers.pop_back();
+    EXPECT_TRUE(axtest::eventually([&] { return d.connect()->sendWithReplySync(request("watch")).value == dict({}); }));
+    EXPECT_EQ(d.send(request("bulk")), dict({}));
 }

@@ -7,8 +7,11 @@
 #include <functional>
 #include <map>
 #include <optional>
+#include <ostream>
 #include <string>
 #include <vector>
+
+#include "platform/value/Value.h"
 
 namespace axtest {
 
@@ -117,3 +120,8 @@ RunResult run(std::vector<std::string> argv, std::map<std::string, std::string> 
               const std::string& input = {});
 
 }  // namespace axtest
+
+namespace corvane {
+// A failed expectation on values shows them in the text notation.
+inline void PrintTo(const Value& value, std::ostream* out) { *out << value.description(); }
+}  // namespace corvane

@@ -12,6 +12,7 @@
 //                                   "ptrace": errno, "setsid": errno}
 //   {"do": "environment"}           {"environment": {...}, "directory": working directory}
 //   {"do": "receipt"}               ask axd for its application's receipt: the daemon's reply
+//   {"do": "axd", "request": R}     send the request R to axd: the daemon's reply
 //   {"do": "exit", "status": N}     exit at once, without a reply
 // SAMPLE_AT_START in its environment ("crash", "hang" or "exit") makes it fail before serving.
 #include <arpa/inet.h>
@@ -33,6 +34,7 @@
 
 #include "Annexa/AXDaemonClient.h"
 #include "Annexa/AXPlugInRuntime.h"
+#include "platform/rpx/Rpx.h"
 #include "platform/sandbox/Sandbox.h"
 
 extern char** environ;
@@ -129,6 +131,15 @@ Value answer(const Value& message) {
     if (*action == "receipt") {
         annexa::AXDaemonClient client;
         auto reply = client.wait([&](auto done) { client.copyReceipt(done); });
+        return reply.ok() ? reply.value : dict({{"error", reply.description()}});
+    }
+    if (*action == "axd") {
+        auto queue = corvane::dispatch::Queue::create("sample.axd");
+        auto connection = corvane::rpx::Connection::connect("com.corvane.annexa.axd", queue);
+        connection->setEventHandler([](const corvane::rpx::Event&) {});
+        connection->resume();
+        auto reply = connection->sendWithReplySync(message["request"]);
+        connection->cancel();
         return reply.ok() ? reply.value : dict({{"error", reply.description()}});
     }
     if (*action == "exit") ::_exit(static_cast<int>(message["status"].int64Value().value_or(0)));
