@@ -257,6 +257,7 @@ struct Turns::State : std::enable_shared_from_this<Turns::State> {
     // The current window: when it ends, and how long each party served in it ran.
     Clock::time_point windowEnd GUARDED_BY(mutex);
     std::unordered_map<uint64_t, Clock::duration> used GUARDED_BY(mutex);
+    uint64_t holds GUARDED_BY(mutex) = 0;       // times a party was held
     bool running GUARDED_BY(mutex) = false;     // a run is queued or running
     bool timerSet GUARDED_BY(mutex) = false;    // a run is queued for the window's end
 
@@ -281,6 +282,7 @@ struct Turns::State : std::enable_shared_from_this<Turns::State> {
 
     void hold(uint64_t party) REQUIRES(mutex) {
         held.insert(party);
+        ++holds;
         if (timerSet) return;
         auto q = queue.lock();
         if (!q) return;
@@ -352,6 +354,11 @@ void Turns::async(uint64_t party, std::function<void()> task) {
         }
     }
     state_->startRunning();
+}
+
+uint64_t Turns::holdCount() const {
+    MutexLock lock(state_->mutex);
+    return state_->holds;
 }
 
 bool Turns::runIfIdle(uint64_t party, const std::function<void()>& task) {

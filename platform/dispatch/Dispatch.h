@@ -111,6 +111,8 @@ public:
     // party's share, when the queue is idle and the party has no task waiting and is within its
     // share; false, and nothing run, otherwise.
     bool runIfIdle(uint64_t party, const std::function<void()>& task);
+    // How many times a party has been held past its share so far.
+    uint64_t holdCount() const;
 
 private:
     struct State;
