@@ -9,6 +9,7 @@
 #include "axd/AXDPlugIn.h"
 #include "axd/AXDRpxClient.h"
 #include "platform/pcx/Pcx.h"
+#include "platform/rpx/Rpx.h"
 #include "platform/sdk/Sdk.h"
 #include "platform/spawn/Protocol.h"
 #include "platform/spawn/Spawn.h"
@@ -114,7 +115,8 @@ Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
             log::error(logOps(), "spawnd refused: this axd's signature lacks the %{public}s entitlement",
                        corvane::spawn::kDomainExtensionProxyEntitlement);
         } else if (result == EHOSTUNREACH) {
-            log::error(logOps(), "spawnd cannot be reached on %{public}s", corvane::spawn::kEndpoint);
+            log::error(logOps(), "spawnd cannot be reached on %{public}s: %{public}s", corvane::spawn::kEndpoint,
+                       corvane::rpx::unreachableText(corvane::spawn::kEndpoint, "spawnd.socket"));
         }
         return makeErrorWithFormat(AXErrorCode::InvalidRequest, "unable to enable plug-in %@(%@)", identifier, uuid);
     }

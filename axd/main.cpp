@@ -5,9 +5,11 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <string>
 
 #include "axd/AXDServer.h"
+#include "platform/layout/Layout.h"
 
 namespace log = corvane::log;
 
@@ -17,6 +19,14 @@ namespace {
     std::fputs("Usage: axd [-S servicename] [-v]\n", stderr);
     std::exit(2);
 }
+
+constexpr const char* kHelp =
+    "Usage: axd [-c LIMIT] [-d DATABASE] [-S SERVICENAME] [-v]\n"
+    "The per-user daemon of the plug-in registry; a service manager starts it (axd.socket).\n"
+    "  -c LIMIT        the most plug-in records kept in memory (default 1000000)\n"
+    "  -d DATABASE     the annotation file (default: in the daemon's data container)\n"
+    "  -S SERVICENAME  the endpoint to serve (default com.corvane.annexa.axd)\n"
+    "  -v              ineffective: logging is configured with CORVANE_LOG (see axd(8))\n";
 
 }  // namespace
 
@@ -34,6 +44,12 @@ int main(int argc, char** argv) {
     uint32_t cacheLimit = 1000000;
     const char* database = nullptr;
     uint32_t verbose = 0;
+    for (int i = 1; i < argc; ++i) {
+        if (std::strcmp(argv[i], "--help") == 0) {
+            std::fputs(kHelp, stdout);
+            return 0;
+        }
+    }
     int opt;
     while ((opt = getopt(argc, argv, "c:d:S:v")) != -1) {
         switch (opt) {
@@ -51,6 +67,10 @@ int main(int argc, char** argv) {
         }
     }
     if (optind < argc) usage();
+    if (corvane::Status places = corvane::layout::checkPlaces(); !places.ok()) {
+        log::error(annexa::logOps(), "%{public}s", places.error().description());
+        return 78;
+    }
 
     auto registry = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
     if (!registry) {

@@ -1,7 +1,10 @@
 // The tools' shared command-line convention, tried on the real programs: usage errors, bad data,
 // an unreachable daemon, and help on every subcommand, each with its exit status.
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
+#include <map>
 #include <string>
 #include <vector>
 
@@ -94,4 +97,50 @@ TEST(Cli, ParsesOptionsValuesAndOperands) {
     EXPECT_EQ(p.parsed->value("--value"), std::optional<std::string>("2"));
     EXPECT_EQ(p.parsed->operands, (std::vector<std::string>{"a", "-b"}));
     EXPECT_EQ(cli::parse("tool", syntax, {"-"}).parsed->operands, std::vector<std::string>{"-"});
+}
+
+// A root or a runtime directory that cannot be used is named at once, with what to do, by every
+// program that needs it; an absent daemon is named by its socket and how to start it.
+TEST(Cli, ProgramsNameThePlaceTheyCannotUseAndHowToStartTheDaemon) {
+    axtest::PlatformRoot root;
+    axtest::writeFile(root / "file", "");
+    const std::string noRuntime = "/run/user/" + std::to_string(::getuid());
+    struct Case {
+        std::vector<std::string> argv;
+        std::map<std::string, std::string> environment;
+        int status;
+        std::string stderrHas;
+    };
+    std::vector<Case> cases = {
+        {{"axctl", "match"}, {{"CORVANE_ROOT", "relative/root"}}, 78, "CORVANE_ROOT=relative/root is not an absolute path"},
+        {{"vantry", "list"}, {{"CORVANE_ROOT", root / "nowhere"}}, 78, "CORVANE_ROOT=" + root / "nowhere" + ": No such file"},
+        {{"pcx", "list", "/x"}, {{"CORVANE_ROOT", root / "file"}}, 78, "CORVANE_ROOT=" + root / "file" + " is not a directory"},
+        {{"spawnd"}, {{"CORVANE_ROOT", "relative"}}, 78, "CORVANE_ROOT=relative is not an absolute path"},
+        {{"axd"}, {{"CORVANE_ROOT", "relative"}}, 78, "CORVANE_ROOT=relative is not an absolute path"},
+        {{"axsign", "verify", root / "file"}, {{"CORVANE_ROOT", "relative"}}, 78, "is not an absolute path"},
+        {{"axctl", "match"}, {}, 69,
+         "cannot reach the daemon at com.corvane.annexa.axd: nothing answers on " + root / "run/user/" +
+             std::to_string(::getuid()) + "/rpx/com.corvane.annexa.axd (start it with: systemctl --user start axd.socket)"},
+    };
+    // Without a user manager: only where this machine has no runtime directory for this user.
+    struct stat st {};
+    if (::stat(noRuntime.c_str(), &st) != 0) {
+        cases.push_back({{"axctl", "match"}, {{"CORVANE_ROOT", ""}, {"XDG_RUNTIME_DIR", ""}}, 78,
+                         "XDG_RUNTIME_DIR is not set, and " + noRuntime + ": No such file or directory"});
+        // A tool that does not talk to the daemons does not need it.
+        cases.push_back({{"axsign", "verify", root / "file"}, {{"CORVANE_ROOT", ""}, {"XDG_RUNTIME_DIR", ""}}, 1, "unsigned"});
+    }
+    for (const auto& c : cases) {
+        std::vector<std::string> argv = c.argv;
+        argv[0] = axtest::binary(argv[0]);
+        auto r = axtest::run(argv, c.environment);
+        EXPECT_EQ(r.status, c.status) << c.argv[0] << "\n" << r.err;
+        if (!c.stderrHas.empty()) {
+            EXPECT_NE(r.err.find(c.stderrHas), std::string::npos) << c.argv[0] << "\n" << r.err;
+        }
+    }
+    auto help = axtest::run({axtest::binary("axd"), "--help"});
+    EXPECT_EQ(help.status, 0);
+    for (const char* option : {"-c LIMIT", "-d DATABASE", "-S SERVICENAME"})
+        EXPECT_NE(help.out.find(option), std::string::npos) << help.out;
 }

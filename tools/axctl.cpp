@@ -98,7 +98,10 @@ std::string absolute(const std::string& path) {
 }
 
 int unreachable(const corvane::rpx::Reply& reply, const std::string& service) {
-    return cli::fail(kTool, "cannot reach the daemon at " + service + ": " + reply.description(), cli::kUnavailable);
+    const char* unit = service == annexa::kDefaultServiceName ? "axd.socket" : nullptr;
+    std::string why = reply.error == corvane::rpx::ErrorKind::ConnectionInvalid ? corvane::rpx::unreachableText(service, unit)
+                                                                               : reply.description();
+    return cli::fail(kTool, "cannot reach the daemon at " + service + ": " + why, cli::kUnavailable);
 }
 
 // Prints the daemon's answer and turns it into an exit status.

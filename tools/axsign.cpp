@@ -113,5 +113,5 @@ int main(int argc, char** argv) {
     const std::vector<cli::Command> commands = {{"keygen", kKeygen, keygen}, {"trust", kTrust, trust},
                                                 {"sign", kSign, sign},       {"show", kShow, show},
                                                 {"verify", kVerify, verifyCommand}};
-    return cli::runCommand(kTool, kUsage, commands, std::vector<std::string>(argv + 1, argv + argc));
+    return cli::runCommand(kTool, kUsage, commands, std::vector<std::string>(argv + 1, argv + argc), false);
 }

@@ -79,6 +79,7 @@ int main(int argc, char** argv) {
         return cli::usageError(kTool, "a count must be a whole number (MiB, instances)", syntax.usage);
     }
     options.memoryPerInstance = memoryMib << 20;
+    if (int status = cli::checkPlaces(kTool); status != cli::kSuccess) return status;
 
     // Before any thread starts, so that the signals reach only the wait below, and SIGCHLD only
     // the daemon's signalfd (it reaps every child, instances and what they leave behind).

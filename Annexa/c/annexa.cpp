@@ -10,6 +10,7 @@
 
 #include "Annexa/AXDaemonClient.h"
 #include "Annexa/AXPlugInRuntime.h"
+#include "platform/rpx/Rpx.h"
 
 struct annexa_plugin {
     corvane::rpx::ConnectionPtr connection;
@@ -38,8 +39,11 @@ int64_t report(int64_t code, const std::string& text, char** errorText) {
 }
 
 int64_t unreachable(const AXDaemonClient& client, const Reply& reply, char** errorText) {
-    return report(ANNEXA_EUNREACHABLE, "cannot reach the daemon at " + client.serviceName() + ": " + reply.description(),
-                  errorText);
+    const std::string& service = client.serviceName();
+    const char* unit = service == annexa::kDefaultServiceName ? "axd.socket" : nullptr;
+    std::string why = reply.error == corvane::rpx::ErrorKind::ConnectionInvalid ? corvane::rpx::unreachableText(service, unit)
+                                                                               : reply.description();
+    return report(ANNEXA_EUNREACHABLE, "cannot reach the daemon at " + service + ": " + why, errorText);
 }
 
 int64_t finish(const AXDaemonClient& client, const Reply& reply, char** errorText) {

@@ -8,6 +8,7 @@
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 
 namespace corvane::layout {
 
@@ -35,6 +36,35 @@ std::string runtimeDir() {
     if (!r.empty()) return r + "/run/user/" + uid;
     std::string xdg = env("XDG_RUNTIME_DIR");
     return xdg.empty() ? "/run/user/" + uid : xdg;
+}
+
+namespace {
+
+Error placeError(int err, std::string text) { return Error{kPosixErrorDomain, err, std::move(text)}; }
+
+}  // namespace
+
+Status checkPlaces(bool runtime) {
+    if (const char* given = std::getenv("CORVANE_ROOT"); given && *given) {
+        std::string named = std::string("CORVANE_ROOT=") + given;
+        if (given[0] != '/') return placeError(EINVAL, named + " is not an absolute path");
+        struct stat st {};
+        if (::stat(given, &st) != 0) return placeError(errno, named + ": " + std::strerror(errno));
+        if (!S_ISDIR(st.st_mode)) return placeError(ENOTDIR, named + " is not a directory");
+        return {};
+    }
+    if (!runtime || !env("XDG_RUNTIME_DIR").empty()) return {};
+    std::string fallback = "/run/user/" + std::to_string(getuid());
+    const std::string advice = " (run it in a user session, under systemd --user, or set XDG_RUNTIME_DIR to a directory "
+                               "of your own, mode 0700)";
+    struct stat st {};
+    if (::stat(fallback.c_str(), &st) != 0) {
+        int err = errno;
+        return placeError(err, "XDG_RUNTIME_DIR is not set, and " + fallback + ": " + std::strerror(err) + advice);
+    }
+    if (!S_ISDIR(st.st_mode) || st.st_uid != getuid())
+        return placeError(EACCES, "XDG_RUNTIME_DIR is not set, and " + fallback + " is not this user's" + advice);
+    return {};
 }
 
 std::string homeDir() {

@@ -41,6 +41,12 @@ std::string systemRoot();
 // Places a platform path (written as on a real system, "/var/db/...") under the root.
 std::string underRoot(const std::string& absolutePath);
 
+// Whether the platform's places can be used: CORVANE_ROOT, when set, is the absolute path of an
+// existing directory; and, with `runtime`, without a root and without XDG_RUNTIME_DIR,
+// /run/user/<uid> exists and belongs to the user (as a user manager makes it). The error says which
+// variable and which path, and what to do. Programs check it when they start.
+Status checkPlaces(bool runtime = true);
+
 // Creates a directory and its missing parents with the given mode (existing ones are left as they
 // are).
 Status makeDirectories(const std::string& path, mode_t mode);

@@ -1,7 +1,13 @@
 #include "platform/rpx/Rpx.h"
 
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
 #include <atomic>
+#include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <string_view>
 
 #include "platform/layout/Layout.h"
@@ -65,6 +71,32 @@ std::string Event::description() const {
 std::string Reply::description() const { return error ? errorDescription(*error) : value.description(); }
 
 std::string endpointPath(const std::string& name) { return layout::runtimeDir() + "/rpx/" + name; }
+
+namespace {
+
+// Whether something accepts connections on the socket now.
+bool answers(const std::string& path) {
+    struct sockaddr_un addr {};
+    if (path.size() >= sizeof addr.sun_path) return false;
+    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+    if (fd < 0) return false;
+    addr.sun_family = AF_UNIX;
+    std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+    bool connected = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0 || errno == EAGAIN;
+    ::close(fd);
+    return connected;
+}
+
+}  // namespace
+
+std::string unreachableText(const std::string& name, const char* socketUnit) {
+    if (Status places = layout::checkPlaces(); !places.ok()) return places.error().description();
+    std::string path = endpointPath(name);
+    if (answers(path)) return "the connection to " + path + " ended before the reply";
+    std::string text = "nothing answers on " + path;
+    if (socketUnit) text += std::string(" (start it with: systemctl --user start ") + socketUnit + ")";
+    return text;
+}
 
 void beginWork() { gOutstandingWork.fetch_add(1); }
 void endWork() { gOutstandingWork.fetch_sub(1); }

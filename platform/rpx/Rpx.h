@@ -242,6 +242,10 @@ size_t arrayCount(const Value& array);
 
 // The socket path of an endpoint under the current platform root.
 std::string endpointPath(const std::string& name);
+// Why a connection to the endpoint `name` failed, for a message: what is wrong with the platform's
+// places (layout::checkPlaces), or the socket path that nothing answers on, followed, when
+// `socketUnit` is given, by how to start the daemon ("systemctl --user start UNIT").
+std::string unreachableText(const std::string& name, const char* socketUnit = nullptr);
 
 // Makes SIGTERM deliver "termination imminent" to every connection of this process and then end
 // the process with status 0. Call from main before any thread is started (it blocks SIGTERM for

@@ -70,7 +70,7 @@ int removeExternalService(const std::string& bundleIdentifier, const std::string
 Result<std::shared_ptr<FileDescriptor>> connectToService(const std::string& bundleIdentifier) {
     auto reply = roundTrip(kEndpoint, dict({{protocol::kRequest, protocol::kConnect},
                                             {protocol::kBundleIdentifier, bundleIdentifier}}));
-    if (!reply) return Error::posix(EHOSTUNREACH, "the service manager cannot be reached");
+    if (!reply) return Error{kPosixErrorDomain, EHOSTUNREACH, "spawnd cannot be reached: " + rpx::unreachableText(kEndpoint, "spawnd.socket")};
     if (const auto* fd = (*reply)[protocol::kFd].asFd()) return *fd;
     Error error;
     error.domain = kPosixErrorDomain;
@@ -84,7 +84,9 @@ Result<Array> busyExtensionInstances(const std::vector<std::string>& bundleIdent
     Array identifiers(bundleIdentifiers.begin(), bundleIdentifiers.end());
     auto reply = roundTrip(kAssertionEndpoint, dict({{protocol::kBundleIdentifiers, Value(std::move(identifiers))}}));
     const Array* instances = reply ? (*reply)[protocol::kInstances].asArray() : nullptr;
-    if (!instances) return Error::posix(EHOSTUNREACH, "the process-assertion service cannot be reached");
+    if (!instances)
+        return Error{kPosixErrorDomain, EHOSTUNREACH,
+                     "the process-assertion service cannot be reached: " + rpx::unreachableText(kAssertionEndpoint, "spawnd.socket")};
     return *instances;
 }
 

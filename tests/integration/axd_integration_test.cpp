@@ -314,6 +314,7 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
     ASSERT_TRUE(one);
     auto host = axtest::run({axtest::binary("annexa_c_client"), app, one->uuid().string()});
     ASSERT_EQ(host.status, 0) << host.err;
+    const std::string nobody = rpx::endpointPath("com.nobody.here");
     EXPECT_EQ(host.out,
               "send: 0 {}\n"
               "send garbage: -1 not one value in the text notation: at offset 1: expected a key in double quotes\n"
@@ -333,8 +334,8 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
               "receipt: 2 caller is not a known plug-in\n"
               "bulk-annotate: 0 -\n"
               "remove: 11 caller lacks entitlement for this operation\n"
-              "unreachable: -2 cannot reach the daemon at com.nobody.here: Connection invalid\n"
-              "send unreachable: -2 cannot reach the daemon at com.nobody.here: Connection invalid\n");
+              "unreachable: -2 cannot reach the daemon at com.nobody.here: nothing answers on " + nobody + "\n"
+              "send unreachable: -2 cannot reach the daemon at com.nobody.here: nothing answers on " + nobody + "\n");
     // The library logged its communications errors, but not on the host's standard error.
     EXPECT_EQ(host.err, "");
     std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";

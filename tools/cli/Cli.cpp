@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cstdio>
 
+#include "platform/layout/Layout.h"
+
 namespace corvane::cli {
 
 std::optional<std::string> Parsed::value(const std::string& option) const {
@@ -55,8 +57,13 @@ Outcome parse(const std::string& tool, const Syntax& syntax, const std::vector<s
     return {std::move(parsed), kSuccess};
 }
 
+int checkPlaces(const std::string& tool, bool runtime) {
+    Status places = layout::checkPlaces(runtime);
+    return places.ok() ? kSuccess : fail(tool, places.error().description(), kConfig);
+}
+
 int runCommand(const std::string& tool, const char* help, const std::vector<Command>& commands,
-               std::vector<std::string> args) {
+               std::vector<std::string> args, bool runtime) {
     if (args.empty()) {
         std::fputs(help, stderr);
         return kUsage;
@@ -70,7 +77,9 @@ int runCommand(const std::string& tool, const char* help, const std::vector<Comm
     for (const auto& command : commands) {
         if (name != command.name) continue;
         Outcome parsed = parse(tool, command.syntax, args);
-        return parsed.parsed ? command.run(*parsed.parsed) : parsed.exitStatus;
+        if (!parsed.parsed) return parsed.exitStatus;
+        if (int status = checkPlaces(tool, runtime); status != kSuccess) return status;
+        return command.run(*parsed.parsed);
     }
     std::fprintf(stderr, "%s: unknown command %s\n%s", tool.c_str(), name.c_str(), help);
     return kUsage;

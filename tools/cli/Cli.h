@@ -23,6 +23,7 @@ enum ExitStatus : int {
     kDataError = 65,     // input that cannot be read or used
     kUnavailable = 69,   // a service that cannot be reached
     kNoPermission = 77,  // refused for lack of an entitlement
+    kConfig = 78,        // the platform's places cannot be used (CORVANE_ROOT, XDG_RUNTIME_DIR)
 };
 
 struct Syntax {
@@ -58,8 +59,12 @@ struct Command {
 
 // Runs the command that args[0] names with the rest of `args`. Without a command, or with an unknown
 // one, prints `help` on standard error and returns kUsage; for --help prints it on standard output.
+// Before a command runs, the platform's places are checked (checkPlaces; the runtime directory only
+// for a tool that talks to the daemons, `runtime`).
 int runCommand(const std::string& tool, const char* help, const std::vector<Command>& commands,
-               std::vector<std::string> args);
+               std::vector<std::string> args, bool runtime = true);
+// Prints why the platform's places cannot be used and returns kConfig, or returns kSuccess.
+int checkPlaces(const std::string& tool, bool runtime = true);
 
 // Prints "<tool>: <message>" and the usage line(s) on standard error; returns kUsage.
 int usageError(const std::string& tool, const std::string& message, const std::string& usage);
