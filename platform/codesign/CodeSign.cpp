@@ -341,21 +341,28 @@ bool installedByRoot(const std::string& path, const struct stat& file) {
     return st.st_uid == 0 && !(st.st_mode & (S_IWGRP | S_IWOTH));
 }
 
-// A small file of /proc, whole (empty when it cannot be read).
-std::string readProcFile(const std::string& path) {
+// A file of /proc, whole; nothing when it cannot be read or is larger than `limit` (a process
+// decides how large its own environment and its list of mappings are).
+std::optional<std::string> readProcFile(const std::string& path, size_t limit) {
     std::string text;
     int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return text;
+    if (fd < 0) return std::nullopt;
     char buf[16384];
     for (;;) {
         ssize_t n = ::read(fd, buf, sizeof buf);
         if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) break;
+        if (n <= 0 || text.size() + static_cast<size_t>(n) > limit) {
+            ::close(fd);
+            if (n != 0) return std::nullopt;
+            return text;
+        }
         text.append(buf, static_cast<size_t>(n));
     }
-    ::close(fd);
-    return text;
 }
+
+// The most executable mappings a process may have and still be looked at: a program and its
+// libraries have tens; a process that makes thousands only costs whoever checks it.
+constexpr size_t kMaxExecutableMappings = 4096;
 
 // The code found installed by root, by path and the file it was then: a later look at the same
 // path and file needs no stat. Only root can change what such a path names or who owns it, and a
@@ -429,6 +436,7 @@ std::optional<std::vector<ExecutableMapping>> queryExecutableMappings(int maps) 
         }
         found.push_back(ExecutableMapping{q.start, q.nameSize > 0 ? std::string(name, strnlen(name, q.nameSize)) : "",
                                           makedev(q.deviceMajor, q.deviceMinor), static_cast<ino_t>(q.inode)});
+        if (found.size() > kMaxExecutableMappings) return found;
         if (q.end <= address) break;
         address = q.end;
     }
@@ -461,7 +469,9 @@ std::vector<ExecutableMapping> parseExecutableMappings(const std::string& maps) 
 
 std::optional<std::string> untrustedCodeIn(pid_t pid, const struct stat& exe) {
     std::string proc = "/proc/" + std::to_string(pid);
-    std::string environment = readProcFile(proc + "/environ");
+    auto readEnvironment = readProcFile(proc + "/environ", size_t{1} << 20);
+    if (!readEnvironment) return std::string("its environment cannot be read, or is larger than 1 MiB");
+    const std::string& environment = *readEnvironment;
     for (size_t at = 0; at < environment.size();) {
         size_t end = environment.find('\0', at);
         std::string_view entry(environment.data() + at, (end == std::string::npos ? environment.size() : end) - at);
@@ -475,8 +485,15 @@ std::optional<std::string> untrustedCodeIn(pid_t pid, const struct stat& exe) {
     if (maps < 0) return std::string("its mappings cannot be read");
     auto queried = queryExecutableMappings(maps);
     ::close(maps);
-    std::vector<ExecutableMapping> mappings = queried ? std::move(*queried) : parseExecutableMappings(readProcFile(proc + "/maps"));
+    std::vector<ExecutableMapping> mappings;
+    if (queried) {
+        mappings = std::move(*queried);
+    } else if (auto text = readProcFile(proc + "/maps", size_t{16} << 20)) {
+        mappings = parseExecutableMappings(*text);
+    }
     if (mappings.empty()) return std::string("its mappings cannot be read");
+    if (mappings.size() > kMaxExecutableMappings)
+        return "it has more than " + std::to_string(kMaxExecutableMappings) + " executable mappings";
     std::string previous;
     for (const ExecutableMapping& m : mappings) {
         const std::string& path = m.path;

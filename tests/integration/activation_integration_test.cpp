@@ -339,10 +339,13 @@ TEST(Activation, ASignedProgramRunningCodeItsSignatureDoesNotCoverHasNoEntitleme
         const char* name;
         std::map<std::string, std::string> environment;
     };
+    std::map<std::string, std::string> large;  // 1.2 MiB, in pieces of what one variable may be
+    for (int i = 0; i < 12; ++i) large["PADDING" + std::to_string(i)] = std::string(100 << 10, 'x');
     const Case cases[] = {
         {"a preloaded library", {{"LD_PRELOAD", library}, {"ASAN_OPTIONS", "verify_asan_link_order=0"}}},
         {"a library path", {{"LD_LIBRARY_PATH", writable}}},
         {"an audit library", {{"LD_AUDIT", library}}},
+        {"an environment too large to be looked through", large},
     };
     for (const auto& c : cases) {
         auto ran = axtest::run({manager, "remove", p.app}, c.environment);
