@@ -166,8 +166,9 @@ Status AXDaemonClient::errorInReply(const Reply& reply) {
         return makeErrorWithFormat(AXErrorCode::InvalidRequest, "axd reported error without a code: %s", *text);
     }
     auto replyCode = static_cast<AXErrorCode>(code);
-    if (text) return makeError(replyCode, *text);
-    return makeError(replyCode, "unknown error returned by Annexa subsystem");
+    Error error = makeError(replyCode, text ? *text : "unknown error returned by Annexa subsystem");
+    if (const std::string* reason = reply.value[message::kReason].asString()) error.cause = *reason;
+    return error;
 }
 
 std::optional<Value> AXDaemonClient::convertFromRPX(const Value& message) const {

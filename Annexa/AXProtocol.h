@@ -72,6 +72,8 @@ inline constexpr const char* kMatches = "matches";
 inline constexpr const char* kData = "data";
 inline constexpr const char* kErrorCode = "errorcode";
 inline constexpr const char* kError = "error";
+// Beside an error: the cause a lower layer gave (the registry, the service manager), for people.
+inline constexpr const char* kReason = "reason";
 }  // namespace message
 
 }  // namespace annexa

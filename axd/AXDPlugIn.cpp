@@ -119,7 +119,7 @@ Status AXDPlugIn::diagnose() const {
         return makeError(AXErrorCode::PlugInUnusable, "this plug-in has no sandbox data container");
     // Stand-alone plug-ins belong to the system volume (under the platform root when it moves).
     if (!containingUrl() && path().rfind(corvane::layout::systemRoot() + "/", 0) != 0)
-        return makeError(AXErrorCode::PlugInUnusable, "plug-ins outside containing apps must be in /System");
+        return makeError(AXErrorCode::PlugInUnusable, "plug-ins outside containing apps must be in /usr");
     return {};
 }
 

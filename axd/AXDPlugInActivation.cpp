@@ -107,7 +107,8 @@ Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
                                    identifier, uuid);
     }
     log::debug(logOps(), "activation overlay=%@", overlay);
-    int result = corvane::spawn::addExternalService(client.pid(), *executable, overlay);
+    std::string reason;
+    int result = corvane::spawn::addExternalService(client.pid(), *executable, overlay, &reason);
     if (result != 0) {
         log::error(logOps(), "spawnd error %d trying to allow %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", result,
                    client.pid(), client.path(), identifier, version, uuid, path());
@@ -118,7 +119,9 @@ Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {
             log::error(logOps(), "spawnd cannot be reached on %{public}s: %{public}s", corvane::spawn::kEndpoint,
                        corvane::rpx::unreachableText(corvane::spawn::kEndpoint, "spawnd.socket"));
         }
-        return makeErrorWithFormat(AXErrorCode::InvalidRequest, "unable to enable plug-in %@(%@)", identifier, uuid);
+        Error error = makeErrorWithFormat(AXErrorCode::InvalidRequest, "unable to enable plug-in %@(%@)", identifier, uuid);
+        error.cause = reason;
+        return error;
     }
     return {};
 }

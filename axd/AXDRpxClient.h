@@ -29,6 +29,8 @@ public:
 
     // The peer's process id; 0 once the connection is gone.
     int pid() const;
+    // The peer's user, from the kernel when it connected.
+    uid_t uid() const { return auditToken_.uid; }
     const std::string& path() const { return path_; }
     const std::shared_ptr<AXBundle>& bundle() const { return identity().bundle; }
     AXDServer* server() const { return server_; }

@@ -107,19 +107,25 @@ std::optional<std::vector<AXDPlugInPtr>> AXDatabase::plugInsWithinApplication(co
     return result;
 }
 
+bool AXDatabase::isSystemBundle(const std::string& path) { return workspace_->isSystemBundle(path); }
+
 Status AXDatabase::addPlugIn(const std::string& path) {
     Status registered = workspace_->registerBundle(path);
     if (registered.ok()) return {};
-    // The reply's text is fixed; the registry's reason goes to the log.
+    // The reply's text is fixed; the registry's reason goes to the log, and beside the text.
     log::error(logOps(), "Vantry cannot register %@: %{public}@", path, registered.error().description());
-    return makeError(AXErrorCode::RegistryRefused, "Vantry failed to register the plug-in");
+    Error error = makeError(AXErrorCode::RegistryRefused, "Vantry failed to register the plug-in");
+    error.cause = registered.error().description();
+    return error;
 }
 
 Status AXDatabase::removePlugIn(const std::string& path) {
     Status unregistered = workspace_->unregisterBundle(path);
     if (unregistered.ok()) return {};
     log::info(logOps(), "Vantry cannot unregister %@: %{public}@", path, unregistered.error().description());
-    return makeError(AXErrorCode::RegistryRefused, "Vantry failed to deregister the plug-in");
+    Error error = makeError(AXErrorCode::RegistryRefused, "Vantry failed to deregister the plug-in");
+    error.cause = unregistered.error().description();
+    return error;
 }
 
 namespace {

@@ -72,6 +72,8 @@ public:
     // Null (not empty) when the application has no plug-ins or is not known; a canonical path.
     std::optional<std::vector<AXDPlugInPtr>> plugInsWithinApplication(const std::string& canonicalPath);
     Status addPlugIn(const std::string& path);
+    // Whether `path` belongs to the system registry.
+    bool isSystemBundle(const std::string& path);
     Status removePlugIn(const std::string& path);
 
     Value annotationForPlugIn(const AXDPlugIn& plugIn);

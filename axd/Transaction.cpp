@@ -114,17 +114,18 @@ void Transaction::done() {
     if (conn && request_.wantsReply) conn->sendReply(request_.messageId, reply);
 }
 
-void Transaction::failMessage(AXErrorCode code, const std::string& message) {
+void Transaction::failMessage(AXErrorCode code, const std::string& message, const std::optional<std::string>& cause) {
     reply_[message::kErrorCode] = Value(static_cast<uint64_t>(errorCodeValue(code)));
     reply_[message::kError] = Value(message);
+    if (cause) reply_[message::kReason] = Value(*cause);
     done();
 }
 
 void Transaction::failError(AXErrorCode fallback, const Error& error) {
     if (error.domain == kAnnexaErrorDomain) {
-        failMessage(static_cast<AXErrorCode>(error.code), error.text.value_or(""));
+        failMessage(static_cast<AXErrorCode>(error.code), error.text.value_or(""), error.cause);
     } else {
-        failMessage(fallback, error.description());
+        failMessage(fallback, error.description(), error.cause);
     }
 }
 
@@ -262,13 +263,26 @@ void Transaction::addPlugIns() {
             return Walk::Stop;
         }
         AXD_TRACE(plugin__add, path.c_str());
-        if (!server().addPlugIn(path).ok()) {
+        if (!maySystemRegistry(path)) return Walk::Stop;
+        if (Status added = server().addPlugIn(path); !added.ok()) {
             log::notice(logOps(), "failed to register plug-in at %@", path);
-            failMessage(AXErrorCode::RegistryRefused, log::formatText("unable to register plug-in at %@", path));
+            failMessage(AXErrorCode::RegistryRefused, log::formatText("unable to register plug-in at %@", path),
+                        added.error().cause);
             return Walk::Stop;
         }
         return Walk::Continue;
     });
+}
+
+bool Transaction::maySystemRegistry(const std::string& path) {
+    // The system registry is the machine's: only root, or a manager, changes it through axd (and
+    // then only when this axd may write it).
+    if (!server().isSystemBundle(path) || client_->uid() == 0 || client_->hasEntitlement(keys::kManagerEntitlement))
+        return true;
+    log::notice(log::defaultLog(), "refused request from pid=%d to change the system registry at %@", client_->pid(), path);
+    failMessage(AXErrorCode::NotEntitled, "caller lacks entitlement for this operation",
+                "only root or a manager may change the system registry; packages keep it in step");
+    return false;
 }
 
 void Transaction::removePlugIns() {
@@ -281,8 +295,9 @@ void Transaction::removePlugIns() {
             failMessage(AXErrorCode::NotEntitled, "caller lacks entitlement for this operation");
             return Walk::Stop;
         }
-        if (!server().removePlugIn(path).ok()) {
-            failMessage(AXErrorCode::BadPath, log::formatText("no plugin at %@", path));
+        if (!maySystemRegistry(path)) return Walk::Stop;
+        if (Status removed = server().removePlugIn(path); !removed.ok()) {
+            failMessage(AXErrorCode::BadPath, log::formatText("no plugin at %@", path), removed.error().cause);
             return Walk::Stop;
         }
         return Walk::Continue;

@@ -55,7 +55,8 @@ public:
     // is gone or no reply is expected): what a reply acknowledges is on disk, at one write per
     // request.
     void done();
-    void failMessage(AXErrorCode code, const std::string& message);
+    void failMessage(AXErrorCode code, const std::string& message,
+                     const std::optional<std::string>& cause = std::nullopt);
     // An error of the domain "Annexa" answers with its own code and text; any other with
     // `fallback` and its description.
     void failError(AXErrorCode fallback, const Error& error);
@@ -80,6 +81,8 @@ public:
     void inSlices(size_t count, std::function<Walk(size_t)> step, std::function<void(bool)> finish);
 
     // The request handlers.
+    // Whether the client may change the registry that holds `path`; replies when not.
+    bool maySystemRegistry(const std::string& path);
     void addPlugIns();
     void removePlugIns();
     void bulkPlugIns();

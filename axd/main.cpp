@@ -72,7 +72,7 @@ int main(int argc, char** argv) {
         return 78;
     }
 
-    auto registry = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
+    auto registry = corvane::vantry::Registry::openDefault();
     if (!registry) {
         log::error(annexa::logOps(), "cannot open the application registry: %{public}@", registry.error().description());
         log::error(annexa::logOps(), "unable to construct server");

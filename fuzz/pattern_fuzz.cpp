@@ -13,7 +13,7 @@ std::shared_ptr<annexa::AXDPlugIn> plugIn() {
     using corvane::Value;
     auto record = corvane::vantry::PlugInRecord::deserialize(
         dict({{"uuid", "01234567-89AB-CDEF-0123-456789ABCDEF"},
-              {"path", "/System/P.appex"},
+              {"path", "/usr/lib/corvane/P.appex"},
               {"identifier", "com.example.p"},
               {"bundleIdentifier", "com.example.p"},
               {"originalIdentifier", "com.example.p"},

@@ -104,10 +104,10 @@ TEST(AXDPlugIn, DaemonDiagnoseRefusesWhatCannotRun) {
         {"data plug-in without container", {{"container", Value()}, {"plugin", data}}, nullptr},
         {"code plug-in without container", {{"container", Value()}}, "this plug-in has no sandbox data container"},
         {"stand-alone on the system volume", {{"application", Value()}, {"path", system + "/P.appex"}}, nullptr},
-        {"stand-alone elsewhere", {{"application", Value()}}, "plug-ins outside containing apps must be in /System"},
+        {"stand-alone elsewhere", {{"application", Value()}}, "plug-ins outside containing apps must be in /usr"},
         {"stand-alone next to the system volume",
          {{"application", Value()}, {"path", system + "x/P.appex"}},
-         "plug-ins outside containing apps must be in /System"},
+         "plug-ins outside containing apps must be in /usr"},
         {"base checks come first", {{"plugin", dict({{"KSExtensionAttributes", dict({})}, {"EmbeddedCode", 1}})}},
          "hybrid plug-ins are not supported on this platform"},
     };

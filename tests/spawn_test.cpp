@@ -160,7 +160,7 @@ TEST(Spawnd, OnlyAnEntitledRegistrarRegistersAndBadRegistrationsAreRefused) {
     std::string executable = d.plugIn("com.example.sample");
     Value good = d.overlay("plugin", "com.example.sample");
     EXPECT_EQ(d.add(::getpid(), executable, good, d.unentitled), EPERM);
-    EXPECT_TRUE(d.daemon->waitForErr("no com.corvane.private.rpx.domain-extension.proxy entitlement"));
+    EXPECT_TRUE(d.daemon->waitForErr("with the com.corvane.private.rpx.domain-extension.proxy entitlement, and "));
 
     fs::create_directories(d.root / "loose");
     axtest::writeFile(d.root / "loose/tool", "#!/bin/sh\n", 0755);

@@ -356,3 +356,89 @@ TEST(Vantry, ARegistrationTheDiskRefusesChangesNothing) {
         EXPECT_NE(f.vantry({"list"}).out.find(other), std::string::npos) << c.name;
     }
 }
+
+// The system registry holds what is in the system applications directory and the user's registry
+// everything else; read together they are one registry, and both tell every observer.
+TEST(Vantry, TheSystemAndTheUserRegistryAreReadAsOne) {
+    axtest::PlatformRoot root;
+    auto makeApp = [](const std::string& parent, const std::string& name, const std::string& id) {
+        std::string app = axtest::makeBundle(parent, name, axtest::appInfo(id), "/bin/true");
+        axtest::makeBundle(app + "/PlugIns", "P.appex",
+                           axtest::plugInInfo(id + ".p", dict({{"KSExtensionPointIdentifier", "com.example.point"}})),
+                           "/bin/true");
+        return app;
+    };
+    ASSERT_TRUE(layout::makeDirectories(layout::systemApplicationsDir(), 0755).ok());
+    std::string systemApp = makeApp(layout::systemApplicationsDir(), "Tools.app", "com.example.tools");
+    std::string userApp = makeApp(layout::userApplicationsDir(), "Mine.app", "com.example.mine");
+
+    auto both = Registry::openDefault();
+    ASSERT_TRUE(both) << both.error().description();
+    struct Counter : vantry::Observer {
+        std::atomic<int> installs{0}, uninstalls{0};
+        void pluginsDidInstall(const std::vector<vantry::PlugInRecordPtr>& r) override { installs += int(r.size()); }
+        void pluginsWillUninstall(const std::vector<vantry::PlugInRecordPtr>& r) override { uninstalls += int(r.size()); }
+    } counter;
+    auto subscription = (*both)->subscribe(counter);
+
+    // Written by the package system's run of `vantry --system sync`, in another process.
+    auto synced = axtest::run({axtest::binary("vantry"), "--system", "sync"});
+    ASSERT_EQ(synced.status, 0) << synced.err;
+    EXPECT_EQ(synced.out, "registered " + systemApp + "\n");
+    ASSERT_TRUE((*both)->registerBundle(userApp).ok());
+    EXPECT_TRUE(axtest::eventually([&] { return counter.installs == 2; }));
+
+    auto system = (*both)->plugInForPath(systemApp + "/PlugIns/P.appex");
+    auto mine = (*both)->plugInForPath(userApp + "/PlugIns/P.appex");
+    ASSERT_TRUE(system && mine);
+    EXPECT_TRUE(system->onSystemVolume());
+    EXPECT_FALSE(mine->onSystemVolume());
+    EXPECT_EQ((*both)->plugInForUUID(system->uuid()), system);
+    // Each reader of the system registry gets a data container of its own.
+    EXPECT_EQ(system->dataContainerPath(), layout::userDataDir() + "/containers/4/com.example.tools.p");
+    EXPECT_EQ((*both)->installedPlugIns().size(), 2u);
+    EXPECT_EQ((*both)->query(dict({}), nullptr).size(), 2u);
+    EXPECT_TRUE((*both)->isSystemBundle(systemApp));
+    EXPECT_FALSE((*both)->isSystemBundle(userApp));
+    // Which database holds which: the user's knows nothing of the system's application.
+    auto userOnly = Registry::open(Registry::defaultPath());
+    ASSERT_TRUE(userOnly);
+    EXPECT_FALSE((*userOnly)->plugInForPath(systemApp + "/PlugIns/P.appex"));
+    EXPECT_TRUE((*userOnly)->plugInForPath(userApp + "/PlugIns/P.appex"));
+
+    // Sync again: an unchanged bundle keeps its UUIDs, a changed one is registered again, one that
+    // left is unregistered, one that cannot be read is reported and the others still go in.
+    ASSERT_EQ(axtest::run({axtest::binary("vantry"), "--system", "sync"}).out, "");
+    EXPECT_EQ((*both)->plugInForPath(systemApp + "/PlugIns/P.appex")->uuid(), system->uuid());
+    std::string second = makeApp(layout::systemApplicationsDir(), "Second.app", "com.example.second");
+    std::string broken = axtest::makeBundle(layout::systemApplicationsDir(), "Broken.app", axtest::appInfo("com.example.broken"));
+    axtest::writeFile(broken + "/Info.plist", "<plist><dict>");
+    axtest::writeFile(systemApp + "/PlugIns/P.appex/Info.plist",
+                      *plist::toXML(axtest::plugInInfo("com.example.tools.p", dict({{"KSExtensionPointIdentifier", "com.example.other"}}))));
+    synced = axtest::run({axtest::binary("vantry"), "--system", "sync"});
+    EXPECT_EQ(synced.status, 65);
+    EXPECT_EQ(synced.out, "registered " + second + "\nregistered again " + systemApp + "\n");
+    EXPECT_NE(synced.err.find("malformed Info.plist"), std::string::npos) << synced.err;
+    EXPECT_NE((*both)->plugInForPath(systemApp + "/PlugIns/P.appex")->uuid(), system->uuid());
+    fs::remove_all(second);
+    fs::remove_all(broken);
+    synced = axtest::run({axtest::binary("vantry"), "--system", "sync"});
+    EXPECT_EQ(synced.status, 0) << synced.err;
+    EXPECT_EQ(synced.out, "unregistered " + second + "\n");
+    EXPECT_TRUE(axtest::eventually([&] { return counter.uninstalls == 2 && counter.installs == 4; }))
+        << counter.installs << " " << counter.uninstalls;
+
+    // A path is in one registry only: the system's application cannot go to the user's, and one
+    // the user registers stays out of the system's.
+    auto refused = axtest::run({axtest::binary("vantry"), "register", systemApp});
+    EXPECT_EQ(refused.status, 0) << refused.err;  // root here may write the system registry
+    EXPECT_FALSE((*userOnly)->plugInForPath(systemApp + "/PlugIns/P.appex"));
+    auto systemAlone = Registry::openSystem();
+    ASSERT_TRUE(systemAlone);
+    EXPECT_FALSE((*systemAlone)->plugInForPath(userApp + "/PlugIns/P.appex"));
+    // The shared database is readable by everyone and written with a rollback journal.
+    struct stat st {};
+    ASSERT_EQ(::stat(Registry::systemPath().c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0644u);
+    EXPECT_FALSE(fs::exists(Registry::systemPath() + "-wal"));
+}

@@ -112,7 +112,8 @@ int finish(const corvane::rpx::Reply& reply, const std::string& service) {
     const corvane::Error& error = status.error();
     int exit = error.code == annexa::errorCodeValue(annexa::AXErrorCode::NotEntitled) ? cli::kNoPermission
                                                                                      : cli::kFailure;
-    return cli::fail(kTool, error.description() + " (error " + std::to_string(error.code) + ")", exit);
+    std::string cause = error.cause ? ": " + *error.cause : std::string();
+    return cli::fail(kTool, error.description() + cause + " (error " + std::to_string(error.code) + ")", exit);
 }
 
 int send(const std::string& service, const cli::Parsed& p) {
@@ -148,15 +149,8 @@ int addOrRemove(const std::string& service, bool add, const cli::Parsed& p) {
             client.removePlugIns(paths, done);
         }
     });
-    int status = finish(reply, service);
-    if (add && status == cli::kFailure) {
-        // The reply's text is fixed; the registry's reading of the bundles here says why.
-        for (const auto& path : paths) {
-            if (corvane::Status readable = corvane::vantry::Registry::checkBundle(path); !readable.ok())
-                std::fprintf(stderr, "axctl: %s\n", readable.error().description().c_str());
-        }
-    }
-    return status;
+    // The reply's reason says why the registry refused.
+    return finish(reply, service);
 }
 
 // The UUIDs of the texts; the first text that is no UUID, when there is one.
@@ -339,7 +333,7 @@ int run(const std::string& service, const cli::Parsed& p) {
         message = *parsed;
     }
     if (p.has("--keep")) blockStopSignals();
-    auto registry = corvane::vantry::Registry::open(corvane::vantry::Registry::defaultPath());
+    auto registry = corvane::vantry::Registry::openDefault();
     auto record = registry ? (*registry)->plugInForUUID(*uuid) : nullptr;
     if (!record) return cli::fail(kTool, "no plug-in with the UUID " + uuid->string(), cli::kDataError);
     AXDaemonClient client(service);

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/layout/Layout.h"
 #include "platform/log/Log.h"
 #include "platform/vantry/Vantry.h"
 #include "tools/cli/Cli.h"
@@ -26,16 +27,25 @@ const cli::Syntax kList{"list [--json]", {"--json"}, {}, 0, 0};
 const cli::Syntax kShow{"show [--json] UUID|PATH", {"--json"}, {}, 1, 1};
 const cli::Syntax kWatch{"watch", {}, {}, 0, 0};
 const cli::Syntax kRebuild{"rebuild", {}, {}, 0, 0};
+const cli::Syntax kSync{"sync [DIRECTORY]", {}, {}, 0, 1};
 
 const char* kUsage =
-    "usage: vantry register [--placeholder] PATH...   register application or plug-in bundles\n"
-    "       vantry unregister PATH...                 unregister them\n"
-    "       vantry list [--json]                      applications and plug-ins with their UUIDs\n"
-    "       vantry show [--json] UUID|PATH            one plug-in's record\n"
-    "       vantry watch                              print install and uninstall events as they happen\n"
-    "       vantry rebuild                            move a damaged database aside and register again\n"
-    "The registry lives under the platform root (CORVANE_ROOT). COMMAND --help shows one command's\n"
-    "usage. See docs/registry.md.\n";
+    "usage: vantry [--system] register [--placeholder] PATH...   register application or plug-in bundles\n"
+    "       vantry [--system] unregister PATH...                 unregister them\n"
+    "       vantry [--system] sync [DIRECTORY]                   register what is in a directory of bundles,\n"
+    "                                                            unregister what left it\n"
+    "       vantry [--system] list [--json]                      applications and plug-ins with their UUIDs\n"
+    "       vantry [--system] show [--json] UUID|PATH            one plug-in's record\n"
+    "       vantry [--system] watch                              print install and uninstall events\n"
+    "       vantry [--system] rebuild                            move a damaged database aside and register again\n"
+    "Without --system, the user's registry and the system registry are read as one, and what is\n"
+    "registered goes to the user's (a bundle of the system applications directory to the system\n"
+    "registry, which only root writes). With --system, only the system registry; sync then reads the\n"
+    "system applications directory, else the user's. COMMAND --help shows one command's usage.\n"
+    "See docs/registry.md.\n";
+
+// Set by --system before the command.
+bool systemOnly = false;
 
 struct Printer : vantry::Observer {
     // One line per event, then one line per record.
@@ -53,7 +63,7 @@ struct Printer : vantry::Observer {
 };
 
 std::unique_ptr<vantry::Registry> openRegistry() {
-    auto r = vantry::Registry::open(vantry::Registry::defaultPath());
+    auto r = systemOnly ? vantry::Registry::openSystem() : vantry::Registry::openDefault();
     if (!r) {
         std::fprintf(stderr, "vantry: %s\n", r.error().description().c_str());
         return nullptr;
@@ -139,11 +149,29 @@ int watch(const cli::Parsed&) {
 }
 
 int rebuild(const cli::Parsed&) {
-    auto failed = vantry::Registry::rebuild(vantry::Registry::defaultPath());
+    std::string path = systemOnly ? vantry::Registry::systemPath() : vantry::Registry::defaultPath();
+    auto failed = vantry::Registry::rebuild(path);
     if (!failed) return cli::fail(kTool, failed.error().description());
-    for (const auto& path : *failed) std::fprintf(stderr, "vantry: could not register %s again\n", path.c_str());
-    std::printf("rebuilt %s\n", vantry::Registry::defaultPath().c_str());
+    for (const auto& p : *failed) std::fprintf(stderr, "vantry: could not register %s again\n", p.c_str());
+    std::printf("rebuilt %s\n", path.c_str());
     return failed->empty() ? cli::kSuccess : cli::kFailure;
+}
+
+// One line per bundle that changed; a bundle that cannot be read is reported and does not stop
+// the others.
+int syncDirectory(const cli::Parsed& p) {
+    auto registry = openRegistry();
+    if (!registry) return cli::kFailure;
+    std::string directory = !p.operands.empty() ? p.operands[0]
+                            : systemOnly        ? layout::systemApplicationsDir()
+                                                : layout::userApplicationsDir();
+    auto report = registry->sync(directory);
+    if (!report) return cli::fail(kTool, report.error().description(), cli::kDataError);
+    for (const auto& path : report->registered) std::printf("registered %s\n", path.c_str());
+    for (const auto& path : report->updated) std::printf("registered again %s\n", path.c_str());
+    for (const auto& path : report->unregistered) std::printf("unregistered %s\n", path.c_str());
+    for (const auto& [path, reason] : report->refused) std::fprintf(stderr, "vantry: %s\n", reason.c_str());
+    return report->refused.empty() ? cli::kSuccess : cli::kDataError;
 }
 
 }  // namespace
@@ -157,6 +185,14 @@ int main(int argc, char** argv) {
         {"show", kShow, show},
         {"watch", kWatch, watch},
         {"rebuild", kRebuild, rebuild},
+        {"sync", kSync, syncDirectory},
     };
-    return cli::runCommand(kTool, kUsage, commands, std::vector<std::string>(argv + 1, argv + argc));
+    std::vector<std::string> args(argv + 1, argv + argc);
+    if (!args.empty() && args[0] == "--system") {
+        systemOnly = true;
+        args.erase(args.begin());
+    }
+    // The registry needs no daemon, so no runtime directory either (the package system runs it as
+    // root, outside any session).
+    return cli::runCommand(kTool, kUsage, commands, std::move(args), /*runtime=*/false);
 }

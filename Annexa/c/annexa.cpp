@@ -49,7 +49,10 @@ int64_t unreachable(const AXDaemonClient& client, const Reply& reply, char** err
 int64_t finish(const AXDaemonClient& client, const Reply& reply, char** errorText) {
     if (!reply.ok()) return unreachable(client, reply, errorText);
     corvane::Status status = AXDaemonClient::errorInReply(reply);
-    if (!status.ok()) return report(status.error().code, status.error().description(), errorText);
+    if (!status.ok()) {
+        const corvane::Error& e = status.error();
+        return report(e.code, e.description() + (e.cause ? ": " + *e.cause : std::string()), errorText);
+    }
     return report(0, {}, errorText);
 }
 

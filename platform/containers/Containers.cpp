@@ -70,10 +70,15 @@ Result<OpenedDirectory> openDataContainer(int containerClass, const std::string&
     return openBeneath(*byClass, identifier, create);
 }
 
-Result<std::string> lookupDataContainer(int containerClass, const std::string& identifier, bool create) {
+Result<std::string> dataContainerPath(int containerClass, const std::string& identifier) {
     if (containerClass < 0 || !validName(identifier)) return invalid(identifier);
-    std::string path =
-        layout::userDataDir() + "/containers/" + std::to_string(containerClass) + "/" + identifier;
+    return layout::userDataDir() + "/containers/" + std::to_string(containerClass) + "/" + identifier;
+}
+
+Result<std::string> lookupDataContainer(int containerClass, const std::string& identifier, bool create) {
+    auto named = dataContainerPath(containerClass, identifier);
+    if (!named) return named.error();
+    const std::string& path = *named;
     struct stat st {};
     if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path;
     if (!create) return Error{kErrorDomain, kNotFound, "no container at " + path};

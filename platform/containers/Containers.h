@@ -24,6 +24,9 @@ inline constexpr int kDaemonDataClass = 10;
 
 inline constexpr int64_t kSymbolicLink = 40;  // ELOOP: a symbolic link where a directory should be
 
+// Where the container of this user is, whether or not it exists; nothing on disk is touched.
+Result<std::string> dataContainerPath(int containerClass, const std::string& identifier);
+
 // The container's path; with `create`, made when missing. Errors carry kErrorDomain and one of the
 // codes above.
 Result<std::string> lookupDataContainer(int containerClass, const std::string& identifier, bool create);

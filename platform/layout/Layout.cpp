@@ -90,10 +90,25 @@ std::string userConfigDir() {
     return homeDir() + "/.config/corvane";
 }
 
+std::string userStateDir() {
+    if (root().empty()) {
+        std::string xdg = env("XDG_STATE_HOME");
+        if (!xdg.empty()) return xdg + "/corvane";
+    }
+    return homeDir() + "/.local/state/corvane";
+}
+
 std::string stateDir() { return underRoot("/var/lib/corvane"); }
 std::string configDir() { return underRoot("/etc/corvane"); }
 std::string sharedDataDir() { return underRoot("/usr/share/corvane"); }
-std::string systemRoot() { return underRoot("/System"); }
+std::string systemRoot() { return underRoot("/usr"); }
+std::string systemApplicationsDir() { return underRoot("/usr/lib/corvane/Applications"); }
+std::string userApplicationsDir() { return userDataDir() + "/Applications"; }
+
+bool isBeneath(const std::string& path, const std::string& directory) {
+    return path.size() >= directory.size() && path.compare(0, directory.size(), directory) == 0 &&
+           (path.size() == directory.size() || path[directory.size()] == '/');
+}
 
 Status makeDirectories(const std::string& path, mode_t mode) {
     if (path.empty()) return Error::posix(ENOENT, path);

@@ -36,8 +36,18 @@ std::string stateDir();
 std::string configDir();
 // Read-only shared data: <root>/usr/share/corvane.
 std::string sharedDataDir();
-// The system volume: <root>/System. Bundles under it are system resident.
+// Per-user state: <root>/home/.local/state/corvane, or $XDG_STATE_HOME/corvane
+// (default ~/.local/state/corvane).
+std::string userStateDir();
+// The system volume: <root>/usr. What packages install under it is system resident.
 std::string systemRoot();
+// Where packages install applications: <root>/usr/lib/corvane/Applications. The system registry
+// holds what is there.
+std::string systemApplicationsDir();
+// Where a user installs applications: <per-user data>/Applications.
+std::string userApplicationsDir();
+// Whether `path` is `directory` or lies beneath it (by name; neither is resolved).
+bool isBeneath(const std::string& path, const std::string& directory);
 // Places a platform path (written as on a real system, "/var/db/...") under the root.
 std::string underRoot(const std::string& absolutePath);
 

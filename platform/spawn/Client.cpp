@@ -54,11 +54,19 @@ int resultOf(const std::optional<Value>& reply) {
 
 }  // namespace
 
-int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay) {
-    return resultOf(roundTrip(kEndpoint, dict({{protocol::kRequest, protocol::kAdd},
-                                               {protocol::kHost, int64_t{hostPid}},
-                                               {protocol::kExecutable, executablePath},
-                                               {protocol::kOverlay, overlay}})));
+int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay, std::string* reason) {
+    auto reply = roundTrip(kEndpoint, dict({{protocol::kRequest, protocol::kAdd},
+                                            {protocol::kHost, int64_t{hostPid}},
+                                            {protocol::kExecutable, executablePath},
+                                            {protocol::kOverlay, overlay}}));
+    int result = resultOf(reply);
+    if (result != 0 && reason) {
+        const std::string* text = reply ? (*reply)[protocol::kError].asString() : nullptr;
+        *reason = text ? *text
+              : reply  ? std::string("spawnd gave no reason (error ") + std::to_string(result) + ")"
+                       : "spawnd cannot be reached: " + rpx::unreachableText(kEndpoint, "spawnd.socket");
+    }
+    return result;
 }
 
 int removeExternalService(const std::string& bundleIdentifier, const std::string& bundleVersion) {

@@ -101,9 +101,15 @@ Value errorReply(int error, const std::string& text) {
     return dict({{protocol::kErrno, int64_t{error}}, {protocol::kError, text}});
 }
 
-bool entitledRegistrar(const rpx::Connection& connection) {
+// Why the peer may not register plug-ins for hosts, or nothing when it may.
+std::optional<std::string> registrarRefusal(const rpx::Connection& connection) {
     auto signer = codesign::Handle::fromAuditToken(connection.peer().auditToken);
-    return signer && signer->valueForEntitlement(kDomainExtensionProxyEntitlement).isTrue();
+    if (signer && signer->valueForEntitlement(kDomainExtensionProxyEntitlement).isTrue()) return std::nullopt;
+    std::string why = !signer ? "it runs code its signature does not cover"
+                      : !signer->verification().valid ? signer->verification().reason
+                                                      : "its signature does not grant it";
+    return "spawnd accepts plug-ins only from a program with the " + std::string(kDomainExtensionProxyEntitlement) +
+           " entitlement, and " + connection.peer().executablePath + " has none: " + why;
 }
 
 // The overlay's shape: {"RPXService": {...}, "KFBundlePackageType": "RPX!"}, the environment a
@@ -272,16 +278,21 @@ void Manager::serveManager(const rpx::ConnectionPtr& connection, const rpx::Even
     const std::string* request = ev.message[protocol::kRequest].asString();
     if (request && *request == protocol::kConnect) return connect(connection, ev.messageId, ev.message);
     int result = EINVAL;
+    std::string reason = "the request is not one spawnd knows";
     if (request && (*request == protocol::kAdd || *request == protocol::kRemove)) {
-        if (!entitledRegistrar(*connection)) {
-            log::error(spawnLog(), "refused %{public}s from pid %d %@: no %{public}s entitlement", *request,
-                       connection->pid(), connection->peer().executablePath, kDomainExtensionProxyEntitlement);
+        if (auto refusal = registrarRefusal(*connection)) {
+            log::error(spawnLog(), "refused %{public}s from pid %d %{public}@: %{public}@", *request, connection->pid(),
+                       connection->peer().executablePath, *refusal);
             result = EPERM;
+            reason = *refusal;
         } else {
             result = *request == protocol::kAdd ? add(*connection, ev.message) : remove(*connection, ev.message);
+            reason = "spawnd could not " + *request + " the plug-in: " + std::strerror(result);
         }
     }
-    connection->sendReply(ev.messageId, dict({{protocol::kResult, int64_t{result}}}));
+    Dictionary reply{{protocol::kResult, Value(int64_t{result})}};
+    if (result != 0) reply[protocol::kError] = Value(reason);
+    connection->sendReply(ev.messageId, Value(std::move(reply)));
 }
 
 int Manager::add(const rpx::Connection& registrar, const Value& request) {
@@ -320,7 +331,7 @@ int Manager::add(const rpx::Connection& registrar, const Value& request) {
         });
     }
     domain.services[*identifier] = Registration{*executable, *bundlePath, *identifier, version ? *version : "", overlay};
-    log::info(spawnLog(), "pid %d %@ registered %{public}@ for host %d", registrar.pid(),
+    log::info(spawnLog(), "pid %d %{public}@ registered %{public}@ for host %d", registrar.pid(),
               registrar.peer().executablePath, *identifier, pid);
     log::debug(spawnLog(), "overlay of %{public}@ for host %d: %@", *identifier, pid, overlay);
     return 0;
@@ -344,7 +355,7 @@ int Manager::remove(const rpx::Connection& registrar, const Value& request) {
             terminate(instance, "its service was removed");
         }
     }
-    log::info(spawnLog(), "pid %d removed %{public}@ (%@): %{public}s", registrar.pid(), *identifier, *version,
+    log::info(spawnLog(), "pid %d removed %{public}@ (%{public}@): %{public}s", registrar.pid(), *identifier, *version,
               found ? "done" : "nothing on record");
     return found ? 0 : kNothingOnRecord;
 }
@@ -361,7 +372,9 @@ void Manager::connect(const rpx::ConnectionPtr& host, uint64_t messageId, const 
     }
     if (!service) {
         return host->sendReply(messageId, errorReply(ENOENT, "no service " + *identifier + " in the domain of pid " +
-                                                                 std::to_string(token.pid)));
+                                                                 std::to_string(token.pid) +
+                                                                 ": the host gets the plug-in ready first (the \"ready\" "
+                                                                 "request: annexa_ready, axctl ready)"));
     }
     auto running = domain->second.instances.find(*identifier);
     bool launching = running == domain->second.instances.end() || !running->second || running->second->ending;
@@ -380,7 +393,7 @@ void Manager::connect(const rpx::ConnectionPtr& host, uint64_t messageId, const 
         auto launched = launchInstance(domain->first, *service);
         if (!launched) {
             domain->second.instances.erase(*identifier);
-            log::error(spawnLog(), "cannot launch %{public}@ for host %d: %@", *identifier, token.pid, launched.error());
+            log::error(spawnLog(), "cannot launch %{public}@ for host %d: %{public}@", *identifier, token.pid, launched.error());
             return host->sendReply(messageId, errorReply(static_cast<int>(launched.error().code),
                                                          "cannot launch " + *identifier + ": " + launched.error().description()));
         }
@@ -545,7 +558,7 @@ void Manager::handOver(const InstancePtr& instance, const rpx::ConnectionPtr& ho
             if (!self || !target) return;
             self->queue_->assertCurrent();
             target->acceptTimer = 0;
-            log::error(spawnLog(), "%@ did not take its first connection in time; ending it", target->description());
+            log::error(spawnLog(), "%{public}@ did not take its first connection in time; ending it", target->description());
             for (auto& [waitingId, waiting] : target->waiting) {
                 waiting.host->sendReply(waiting.messageId,
                                         errorReply(ETIMEDOUT, target->registration.identifier + " did not accept the connection in time"));
@@ -587,7 +600,7 @@ void Manager::controlEvent(const InstancePtr& instance, const rpx::Event& ev) {
         auto assertion = message[protocol::kAssertion].uint64Value();
         if (!assertion) return;
         if (instance->busy.size() >= options_.assertionsPerInstance) {
-            log::error(spawnLog(), "%@ holds too many busy assertions; ignoring another", instance->description());
+            log::error(spawnLog(), "%{public}@ holds too many busy assertions; ignoring another", instance->description());
             return;
         }
         instance->busy[*assertion] = keptReason(*reason);
@@ -615,7 +628,7 @@ void Manager::updateIdleTimer(const InstancePtr& instance, bool idle) {
 void Manager::terminate(const InstancePtr& instance, const char* why) {
     if (instance->ending || instance->exited) return;
     instance->ending = true;
-    log::info(spawnLog(), "ending %@: %{public}s", instance->description(), why);
+    log::info(spawnLog(), "ending %{public}@: %{public}s", instance->description(), why);
     // Until the leader is reaped its pid, and so its process group, cannot be reused.
     ::syscall(SYS_pidfd_send_signal, instance->pidfd->get(), SIGTERM, nullptr, 0);
     ::kill(-instance->pid, SIGTERM);
@@ -627,7 +640,7 @@ void Manager::terminate(const InstancePtr& instance, const char* why) {
         if (!self || !target || target->exited) return;
         self->queue_->assertCurrent();
         target->killTimer = 0;
-        log::notice(spawnLog(), "%@ outlived its grace period; killing it", target->description());
+        log::notice(spawnLog(), "%{public}@ outlived its grace period; killing it", target->description());
         ::kill(-target->pid, SIGKILL);
         ::syscall(SYS_pidfd_send_signal, target->pidfd->get(), SIGKILL, nullptr, 0);
     });
@@ -667,7 +680,7 @@ void Manager::instanceExited(const InstancePtr& instance) {
     } else {
         how = "ended";
     }
-    log::notice(spawnLog(), "%@ %{public}@", instance->description(), how);
+    log::notice(spawnLog(), "%{public}@ %{public}@", instance->description(), how);
     for (auto& [id, waiting] : instance->waiting) {
         Value refusal = errorReply(ECONNREFUSED, instance->registration.identifier + " " + how +
                                                      " before accepting the connection");

@@ -53,7 +53,9 @@ inline constexpr int kNothingOnRecord = 3;
 // launch settings. 0, or an errno value: EPERM without the entitlement, ESRCH when the host is
 // gone, ENOENT when there is no executable or no bundle around it, EINVAL for an executable that is
 // not a regular file or an overlay of the wrong shape, EHOSTUNREACH when spawnd cannot be reached.
-int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay);
+// On failure, `reason` (when given) gets what spawnd said, or why it could not be asked.
+int addExternalService(pid_t hostPid, const std::string& executablePath, const Value& overlay,
+                       std::string* reason = nullptr);
 // Drops the registrations of a bundle from every domain and ends its running instances. 0,
 // kNothingOnRecord, or an errno value as above. An empty version matches every version.
 int removeExternalService(const std::string& bundleIdentifier, const std::string& bundleVersion);

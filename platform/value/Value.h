@@ -242,9 +242,16 @@ bool isValidUtf8(std::string_view text);
 
 // An error value: a domain, an integer code and an optional description text.
 struct Error {
+    Error() = default;
+    Error(std::string domain, int64_t code, std::optional<std::string> text = std::nullopt)
+        : domain(std::move(domain)), code(code), text(std::move(text)) {}
+
     std::string domain;
     int64_t code = 0;
     std::optional<std::string> text;
+    // What the layer below said (the registry's reason, the service manager's), for the person who
+    // reads the error; the text stays what the protocol says.
+    std::optional<std::string> cause;
 
     // The text, or "Error Domain=<domain> Code=<code>" when there is none.
     std::string description() const;

@@ -123,20 +123,28 @@ void Store::deliverNewEvents() {
 Subscription::Subscription(std::weak_ptr<Store> store, uint64_t id) : store_(std::move(store)), id_(id) {}
 
 Subscription::Subscription(Subscription&& other) noexcept
-    : store_(std::move(other.store_)), id_(std::exchange(other.id_, 0)) {}
+    : store_(std::move(other.store_)), id_(std::exchange(other.id_, 0)), next_(std::move(other.next_)) {}
 
 Subscription& Subscription::operator=(Subscription&& other) noexcept {
     if (this != &other) {
         cancel();
         store_ = std::move(other.store_);
         id_ = std::exchange(other.id_, 0);
+        next_ = std::move(other.next_);
     }
     return *this;
 }
 
 Subscription::~Subscription() { cancel(); }
 
+void Subscription::join(Subscription&& more) {
+    if (next_) return next_->join(std::move(more));
+    next_ = std::make_unique<Subscription>(std::move(more));
+}
+
 void Subscription::cancel() {
+    if (next_) next_->cancel();
+    next_.reset();
     if (id_ == 0) return;
     if (auto store = store_.lock()) store->unsubscribe(id_);
     id_ = 0;

@@ -142,7 +142,7 @@ Status checkBundle(const std::string& given) {
     return {};
 }
 
-Result<ScannedPlugIn> scanPlugIn(const std::string& path) {
+Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool makeContainer) {
     auto read = readPlugInInfo(path);
     if (!read) return read.error();
     const Value& info = *read;
@@ -156,12 +156,12 @@ Result<ScannedPlugIn> scanPlugIn(const std::string& path) {
     s.info = resolved.info;
     s.plugin = resolved.plugin;
     s.entitlements = codesign::entitlementsOfBundle(path);
-    std::string system = layout::systemRoot() + "/";
-    s.system = path.rfind(system, 0) == 0;
+    s.system = layout::isBeneath(path, layout::systemRoot());
     if (!(s.plugin["KSExtensionProtocol"] == Value("#Data"))) {
-        auto container = containers::lookupDataContainer(containers::kPlugInDataClass, s.identifier, true);
+        auto container = makeContainer ? containers::lookupDataContainer(containers::kPlugInDataClass, s.identifier, true)
+                                       : containers::dataContainerPath(containers::kPlugInDataClass, s.identifier);
         if (!container) return refusal("no data container for " + path + ": " + container.error().description());
-        s.container = *container;
+        if (makeContainer) s.container = *container;
     }
     LocalizedNames names = localizedNames(path, info);
     s.name = names.display;

@@ -10,6 +10,7 @@
 #include <cstdlib>
 
 #include "platform/bundle/Bundle.h"
+#include "platform/containers/Containers.h"
 #include "platform/layout/Layout.h"
 #include "platform/plist/Plist.h"
 #include "platform/vantry/Store.h"
@@ -38,21 +39,31 @@ std::optional<std::string> stringAt(const Value& v, std::string_view key) {
     return std::nullopt;
 }
 
-Result<std::shared_ptr<Store>> Store::open(const std::string& path) {
-    auto store = std::make_shared<Store>(path);
-    if (Status err = layout::makeDirectories(store->directory(), 0755); !err.ok()) return err.error();
-    if (sqlite3_open_v2(path.c_str(), &store->db_,
-                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_FULLMUTEX, nullptr) != SQLITE_OK)
+Result<std::shared_ptr<Store>> Store::open(const std::string& path, StoreOptions options) {
+    auto store = std::make_shared<Store>(path, options);
+    if (!options.readOnly) {
+        if (Status err = layout::makeDirectories(store->directory(), 0755); !err.ok()) return err.error();
+    }
+    int flags = (options.readOnly ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE) |
+                SQLITE_OPEN_FULLMUTEX;
+    if (sqlite3_open_v2(path.c_str(), &store->db_, flags, nullptr) != SQLITE_OK)
         return store->sqlError("opening the registry");
     // A writer in another process holds the lock for a few milliseconds at most; wait that long,
     // boundedly.
     sqlite3_busy_timeout(store->db_, 5000);
-    if (Status err = store->exec("PRAGMA journal_mode=WAL"); !err.ok()) return err.error();
-    if (Status err = store->exec("PRAGMA foreign_keys=ON"); !err.ok()) return err.error();
     // Answers are kept in memory until the data changes (rowsOf), so pages are read again only
     // after a change: a small page cache (the default is 2 MiB) costs little.
     if (Status err = store->exec("PRAGMA cache_size=-256"); !err.ok()) return err.error();
+    if (options.readOnly) {
+        if (Status err = store->checkSchema(); !err.ok()) return err.error();
+        return store;
+    }
+    const char* journal = options.shared ? "PRAGMA journal_mode=DELETE" : "PRAGMA journal_mode=WAL";
+    if (Status err = store->exec(journal); !err.ok()) return err.error();
+    if (Status err = store->exec("PRAGMA foreign_keys=ON"); !err.ok()) return err.error();
     if (Status err = store->migrate(); !err.ok()) return err.error();
+    // Every user reads the shared registry, whatever the writer's umask.
+    if (options.shared && ::chmod(path.c_str(), 0644) != 0) return Error::posix(errno, path);
     return store;
 }
 
@@ -95,14 +106,28 @@ Status Store::exec(const char* sql) {
     return {};
 }
 
-Status Store::migrate() {
-    if (Status err = exec("CREATE TABLE IF NOT EXISTS meta (key TEXT PRIMARY KEY, value TEXT)"); !err.ok()) return err;
+Result<int> Store::schemaVersion() {
     Statement q(db_, "SELECT value FROM meta WHERE key = 'schema'");
     if (!q) return sqlError("reading the schema version");
     int version = q.step() == SQLITE_ROW ? std::atoi(q.text(0).c_str()) : 0;
     if (version > kSchemaVersion)
         return refusal("registry database " + path_ + " is of a newer release (schema " + std::to_string(version) + ")");
-    if (version == kSchemaVersion) return {};
+    return version;
+}
+
+Status Store::checkSchema() {
+    auto version = schemaVersion();
+    if (!version) return version.error();
+    if (*version != kSchemaVersion)
+        return refusal("registry database " + path_ + " is of an older release; its next writer brings it up to date (as root: vantry --system sync)");
+    return {};
+}
+
+Status Store::migrate() {
+    if (Status err = exec("CREATE TABLE IF NOT EXISTS meta (key TEXT PRIMARY KEY, value TEXT)"); !err.ok()) return err;
+    auto version = schemaVersion();
+    if (!version) return version.error();
+    if (*version == kSchemaVersion) return {};
     // Version 0 -> 1: the first schema.
     return exec(
         "BEGIN;"
@@ -193,10 +218,21 @@ PlugInRecordPtr Store::recordFromRow(const std::string& uuidText, std::string_vi
     if (it != byUUID_.end()) return it->second;
     auto v = plist::parse(blob);
     if (!v) return nullptr;
+    if (options_.shared) v = withReadersContainer(std::move(*v));
     ApplicationRecordPtr app = appPath.empty() ? nullptr : appFromRow(appPath);
     auto r = PlugInRecord::deserialize(*v, app);
     if (r) byUUID_[*uuid] = r;
     return r;
+}
+
+Value Store::withReadersContainer(Value serialized) {
+    const Dictionary* fields = serialized.asDictionary();
+    if (!fields || serialized["plugin"]["KSExtensionProtocol"] == Value("#Data")) return serialized;
+    auto container = containers::dataContainerPath(containers::kPlugInDataClass, stringAt(serialized, "identifier").value_or(""));
+    if (!container) return serialized;
+    Dictionary d = *fields;
+    d["container"] = Value(*container);
+    return Value(std::move(d));
 }
 
 std::vector<PlugInRecordPtr> Store::selectPlugIns(const std::string& where, const std::vector<std::string>& args) {
@@ -228,6 +264,10 @@ ApplicationRecordPtr Store::applicationForPath(const std::string& path) {
 
 std::vector<std::string> Store::registeredPaths() {
     MutexLock lock(mutex_);
+    return registeredPathsLocked();
+}
+
+std::vector<std::string> Store::registeredPathsLocked() {
     Statement q(db_, "SELECT path FROM applications UNION SELECT path FROM plugins WHERE app_path IS NULL ORDER BY 1");
     std::vector<std::string> out;
     while (q && q.step() == SQLITE_ROW) out.push_back(q.text(0));
@@ -350,19 +390,18 @@ Status Store::write(const WriteBody& body) {
     MutexLock lock(mutex_);
     checkFreshness();
     if (Status err = exec("BEGIN IMMEDIATE"); !err.ok()) return err;
-    std::vector<PlugInRecordPtr> installed;
-    std::vector<PlugInRecordPtr> uninstalled;
-    Status status = body(installed, uninstalled);
-    if (status.ok()) status = journal(JournalKind::Uninstall, uninstalled);
-    if (status.ok()) status = journal(JournalKind::Install, installed);
-    if (!status.ok() || (installed.empty() && uninstalled.empty() && !changedOther_)) {
+    Events events;
+    Status status = body(events);
+    if (status.ok()) status = journal(JournalKind::Uninstall, events.uninstalled);
+    if (status.ok()) status = journal(JournalKind::Install, events.installed);
+    if (!status.ok() || (events.installed.empty() && events.uninstalled.empty() && !events.changedOther)) {
         (void)exec("ROLLBACK");
-        changedOther_ = false;
+        if (!status.ok()) forgetRecords();  // records built inside the transaction are gone with it
         return status;
     }
-    changedOther_ = false;
     if (Status committed = exec("COMMIT"); !committed.ok()) {
         (void)exec("ROLLBACK");
+        forgetRecords();
         return committed;
     }
     forgetRecords();
@@ -371,131 +410,219 @@ Status Store::write(const WriteBody& body) {
     return {};
 }
 
-Status Store::registerBundle(const std::string& given, bool placeholder) {
+Result<ScannedBundle> Store::scanBundle(const std::string& given, bool placeholder) {
     auto path = layout::canonicalPath(given);
     struct stat st {};
     if (!path || ::stat(path->c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return refusal("not a bundle: " + given);
     auto info = readInfoDictionary(*path);
     if (!info) return info.error();
-    if ((*info)["KSExtension"].isDictionary()) return registerPlugIn(*path);
-    return registerApplication(*path, *info, placeholder);
-}
-
-Status Store::registerPlugIn(const std::string& path) {
-    auto scanned = scanPlugIn(path);
-    if (!scanned) return scanned.error();
-    return write([&](auto& installed, auto& uninstalled) -> Status {
-        mutex_.assertHeld();
-        auto old = existing("path = ?", path);
-        if (!old.empty() && old.begin()->second.fingerprint == scanned->fingerprint) return {};
-        if (!old.empty()) {
-            if (auto r = recordByUUIDText(old.begin()->second.uuid)) uninstalled.push_back(r);
-            if (Status err = deletePlugIn(old.begin()->second.uuid); !err.ok()) return err;
-        }
-        auto r = makeRecord(*scanned, nullptr);
-        if (Status err = insertPlugIn(r, "", scanned->fingerprint); !err.ok()) return err;
-        installed.push_back(r);
-        return {};
-    });
-}
-
-Status Store::registerApplication(const std::string& path, const Value& info, bool placeholder) {
-    auto appId = stringAt(info, "KFBundleIdentifier");
-    if (!appId) return refusal("application without identifier (KFBundleIdentifier): " + path);
-    // Scan every plug-in first: a bundle that cannot be read leaves the database as it was.
-    std::vector<ScannedPlugIn> scanned;
-    auto plugInPaths = plugInPathsOf(path);
+    ScannedBundle bundle;
+    bundle.path = *path;
+    if ((*info)["KSExtension"].isDictionary()) {
+        auto scanned = scanPlugIn(*path, !options_.shared);
+        if (!scanned) return scanned.error();
+        bundle.plugIns.push_back(std::move(*scanned));
+        return bundle;
+    }
+    auto appId = stringAt(*info, "KFBundleIdentifier");
+    if (!appId) return refusal("application without identifier (KFBundleIdentifier): " + *path);
+    // Every plug-in is read first: a bundle that cannot be read leaves the database as it was.
+    auto plugInPaths = plugInPathsOf(*path);
     if (!plugInPaths) return plugInPaths.error();
     for (const auto& p : *plugInPaths) {
-        auto s = scanPlugIn(p);
+        auto s = scanPlugIn(p, !options_.shared);
         if (!s) return s.error();
-        scanned.push_back(std::move(*s));
+        bundle.plugIns.push_back(std::move(*s));
     }
-    LocalizedNames names = localizedNames(path, info);
-    Dictionary appRecord{{"identifier", *appId}, {"placeholder", placeholder}};
-    if (names.display) appRecord.emplace("name", *names.display);
-    std::string receipt = path + "/" + bundle::kReceiptFileName;
-    struct stat st {};
-    if (::stat(receipt.c_str(), &st) == 0 && S_ISREG(st.st_mode)) appRecord.emplace("receipt", receipt);
-    std::string appFingerprint = Value(appRecord).description();
+    LocalizedNames names = localizedNames(*path, *info);
+    bundle.application = true;
+    bundle.identifier = *appId;
+    bundle.record = Dictionary{{"identifier", *appId}, {"placeholder", placeholder}};
+    if (names.display) bundle.record.emplace("name", *names.display);
+    std::string receipt = *path + "/" + bundle::kReceiptFileName;
+    if (::stat(receipt.c_str(), &st) == 0 && S_ISREG(st.st_mode)) bundle.record.emplace("receipt", receipt);
+    bundle.fingerprint = Value(bundle.record).description();
+    return bundle;
+}
 
-    return write([&](auto& installed, auto& uninstalled) -> Status {
+Status Store::storePlugIn(const ScannedPlugIn& scanned, Events& events) {
+    auto old = existing("path = ?", scanned.path);
+    if (!old.empty() && old.begin()->second.fingerprint == scanned.fingerprint) return {};
+    if (!old.empty()) {
+        if (auto r = recordByUUIDText(old.begin()->second.uuid)) events.uninstalled.push_back(r);
+        if (Status err = deletePlugIn(old.begin()->second.uuid); !err.ok()) return err;
+    }
+    auto r = makeRecord(scanned, nullptr);
+    if (Status err = insertPlugIn(r, "", scanned.fingerprint); !err.ok()) return err;
+    events.installed.push_back(r);
+    return {};
+}
+
+Status Store::storeApplication(const ScannedBundle& bundle, Events& events) {
+    const std::string& path = bundle.path;
+    Statement old(db_, "SELECT fingerprint FROM applications WHERE path = ?");
+    old.bind(1, path);
+    bool appChanged = old.step() != SQLITE_ROW || old.text(0) != bundle.fingerprint;
+    if (appChanged) {
+        auto xml = plist::toXML(Value(bundle.record));
+        if (!xml) return xml.error();
+        Statement up(db_,
+                     "INSERT INTO applications (path, identifier, record, fingerprint) VALUES (?,?,?,?) "
+                     "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, "
+                     "record = excluded.record, fingerprint = excluded.fingerprint");
+        up.bind(1, path);
+        up.bind(2, bundle.identifier);
+        up.bindBlob(3, xml->data(), xml->size());
+        up.bind(4, bundle.fingerprint);
+        if (up.step() != SQLITE_DONE) return sqlError("recording an application");
+        apps_.erase(path);
+        rows_.clear();  // their records name the application's old record
+        events.changedOther = true;
+    }
+    auto before = existing("app_path = ?", path);
+    ApplicationRecordPtr app = appFromRow(path);
+    // Plug-ins that went away or changed are uninstalled; new and changed ones installed;
+    // unchanged ones keep their UUIDs, unless the application's own record changed (they carry
+    // it).
+    for (const auto& [p, row] : before) {
+        auto same = std::find_if(bundle.plugIns.begin(), bundle.plugIns.end(), [&](const ScannedPlugIn& s) {
+            return s.path == p && s.fingerprint == row.fingerprint && !appChanged;
+        });
+        if (same != bundle.plugIns.end()) continue;
+        if (auto r = recordByUUIDText(row.uuid)) events.uninstalled.push_back(r);
+        if (Status err = deletePlugIn(row.uuid); !err.ok()) return err;
+    }
+    for (const auto& s : bundle.plugIns) {
+        auto it = before.find(s.path);
+        if (it != before.end() && it->second.fingerprint == s.fingerprint && !appChanged) continue;
+        auto r = makeRecord(s, app);
+        if (Status err = insertPlugIn(r, path, s.fingerprint); !err.ok()) {
+            if (sqlite3_errcode(db_) == SQLITE_CONSTRAINT) return refusal(s.path + " is already registered elsewhere");
+            return err;
+        }
+        events.installed.push_back(r);
+    }
+    return {};
+}
+
+Status Store::storeBundle(const ScannedBundle& bundle, Events& events) {
+    if (bundle.application) return storeApplication(bundle, events);
+    return storePlugIn(bundle.plugIns.front(), events);
+}
+
+Status Store::registerBundle(const std::string& given, bool placeholder) {
+    auto bundle = scanBundle(given, placeholder);
+    if (!bundle) return bundle.error();
+    return write([&](Events& events) -> Status {
         mutex_.assertHeld();
-        Statement old(db_, "SELECT fingerprint FROM applications WHERE path = ?");
-        old.bind(1, path);
-        bool appChanged = old.step() != SQLITE_ROW || old.text(0) != appFingerprint;
-        if (appChanged) {
-            auto xml = plist::toXML(Value(appRecord));
-            if (!xml) return xml.error();
-            Statement up(db_,
-                         "INSERT INTO applications (path, identifier, record, fingerprint) VALUES (?,?,?,?) "
-                         "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, "
-                         "record = excluded.record, fingerprint = excluded.fingerprint");
-            up.bind(1, path);
-            up.bind(2, *appId);
-            up.bindBlob(3, xml->data(), xml->size());
-            up.bind(4, appFingerprint);
-            if (up.step() != SQLITE_DONE) return sqlError("recording an application");
-            apps_.erase(path);
-            rows_.clear();  // their records name the application's old record
-            changedOther_ = true;
-        }
-        auto before = existing("app_path = ?", path);
-        ApplicationRecordPtr app = appFromRow(path);
-        // Plug-ins that went away or changed are uninstalled; new and changed ones installed;
-        // unchanged ones keep their UUIDs, unless the application's own record changed (they
-        // carry it).
-        for (const auto& entry : before) {
-            const std::string& p = entry.first;
-            const auto& row = entry.second;
-            auto same = std::find_if(scanned.begin(), scanned.end(), [&](const ScannedPlugIn& s) {
-                return s.path == p && s.fingerprint == row.fingerprint && !appChanged;
-            });
-            if (same != scanned.end()) continue;
-            if (auto r = recordByUUIDText(row.uuid)) uninstalled.push_back(r);
-            if (Status err = deletePlugIn(row.uuid); !err.ok()) return err;
-        }
-        for (const auto& s : scanned) {
-            auto it = before.find(s.path);
-            if (it != before.end() && it->second.fingerprint == s.fingerprint && !appChanged) continue;
-            auto r = makeRecord(s, app);
-            if (Status err = insertPlugIn(r, path, s.fingerprint); !err.ok()) {
-                if (sqlite3_errcode(db_) == SQLITE_CONSTRAINT)
-                    return refusal(s.path + " is already registered elsewhere");
-                return err;
-            }
-            installed.push_back(r);
-        }
-        return {};
+        return storeBundle(*bundle, events);
     });
+}
+
+Result<bool> Store::removeBundle(const std::string& path, Events& events) {
+    auto plugins = existing("app_path = ?", path);
+    Statement app(db_, "SELECT 1 FROM applications WHERE path = ?");
+    app.bind(1, path);
+    bool isApp = app.step() == SQLITE_ROW;
+    if (!isApp) plugins = existing("path = ?", path);
+    if (!isApp && plugins.empty()) return false;
+    for (const auto& [p, row] : plugins) {
+        if (auto r = recordByUUIDText(row.uuid)) events.uninstalled.push_back(r);
+        if (Status err = deletePlugIn(row.uuid); !err.ok()) return err.error();
+    }
+    if (isApp) {
+        Statement del(db_, "DELETE FROM applications WHERE path = ?");
+        del.bind(1, path);
+        if (del.step() != SQLITE_DONE) return sqlError("removing an application");
+        events.changedOther = true;
+    }
+    return true;
+}
+
+bool Store::holdsBundle(const std::string& path) {
+    MutexLock lock(mutex_);
+    return holdsBundleLocked(path);
+}
+
+bool Store::holdsBundleLocked(const std::string& path) {
+    Statement q(db_, "SELECT 1 FROM applications WHERE path = ?1 UNION ALL SELECT 1 FROM plugins WHERE path = ?1");
+    q.bind(1, path);
+    return q.step() == SQLITE_ROW;
 }
 
 Status Store::unregisterBundle(const std::string& given) {
     std::vector<std::string> candidates{given};
     if (auto p = layout::canonicalPath(given); p && *p != given) candidates.insert(candidates.begin(), *p);
-    return write([&](auto&, auto& uninstalled) -> Status {
+    return write([&](Events& events) -> Status {
         mutex_.assertHeld();
         for (const auto& path : candidates) {
-            auto plugins = existing("app_path = ?", path);
-            Statement app(db_, "SELECT 1 FROM applications WHERE path = ?");
-            app.bind(1, path);
-            bool isApp = app.step() == SQLITE_ROW;
-            if (!isApp) plugins = existing("path = ?", path);
-            if (!isApp && plugins.empty()) continue;
-            for (const auto& [p, row] : plugins) {
-                if (auto r = recordByUUIDText(row.uuid)) uninstalled.push_back(r);
-                if (Status err = deletePlugIn(row.uuid); !err.ok()) return err;
-            }
-            if (isApp) {
-                Statement del(db_, "DELETE FROM applications WHERE path = ?");
-                del.bind(1, path);
-                if (del.step() != SQLITE_DONE) return sqlError("removing an application");
-                changedOther_ = true;
-            }
-            return {};
+            auto removed = removeBundle(path, events);
+            if (!removed) return removed.error();
+            if (*removed) return {};
         }
         return refusal("not registered: " + given);
     });
+}
+
+Result<SyncReport> Store::sync(const std::string& directory) {
+    SyncReport report;
+    std::vector<ScannedBundle> present;
+    std::vector<std::string> names;
+    if (DIR* d = opendir(directory.c_str())) {
+        while (struct dirent* e = readdir(d)) {
+            std::string n = e->d_name;
+            if (n != "." && n != "..") names.push_back(n);
+        }
+        closedir(d);
+    } else if (errno != ENOENT) {
+        return Error::posix(errno, directory);
+    }
+    std::sort(names.begin(), names.end());
+    for (const auto& n : names) {
+        std::string path = directory + "/" + n;
+        auto bundle = scanBundle(path, false);
+        if (!bundle) {
+            report.refused.emplace_back(path, bundle.error().description());
+            continue;
+        }
+        present.push_back(std::move(*bundle));
+    }
+    Status written = write([&](Events& events) -> Status {
+        mutex_.assertHeld();
+        // What is registered under the directory and is no longer there (or no longer readable)
+        // goes first, so that a bundle renamed within the directory keeps no stale row.
+        for (const auto& path : registeredPathsLocked()) {
+            if (!layout::isBeneath(path, directory)) continue;
+            bool stays = std::any_of(present.begin(), present.end(), [&](const auto& b) { return b.path == path; });
+            if (stays) continue;
+            auto removed = removeBundle(path, events);
+            if (!removed) return removed.error();
+            report.unregistered.push_back(path);
+        }
+        for (const auto& bundle : present) {
+            // Each bundle in a savepoint of its own: one that cannot be stored leaves the others.
+            Events own;
+            bool known = holdsBundleLocked(bundle.path);
+            if (Status err = exec("SAVEPOINT bundle"); !err.ok()) return err;
+            if (Status err = storeBundle(bundle, own); !err.ok()) {
+                if (Status undone = exec("ROLLBACK TO bundle"); !undone.ok()) return undone;
+                (void)exec("RELEASE bundle");
+                forgetRecords();
+                report.refused.emplace_back(bundle.path, err.error().description());
+                continue;
+            }
+            if (Status err = exec("RELEASE bundle"); !err.ok()) return err;
+            if (!known) {
+                report.registered.push_back(bundle.path);
+            } else if (!own.installed.empty() || !own.uninstalled.empty() || own.changedOther) {
+                report.updated.push_back(bundle.path);
+            }
+            events.add(std::move(own));
+        }
+        return {};
+    });
+    if (!written.ok()) return written.error();
+    return report;
 }
 
 }  // namespace corvane::vantry

@@ -102,8 +102,10 @@ Result<Value> readPlugInInfo(const std::string& path);
 // The bundle's Info.plist as a dictionary, or a refusal that says what is wrong and where: missing,
 // unreadable (a FIFO, a link, too large), malformed (with the parser's place), or no dictionary.
 Result<Value> readInfoDictionary(const std::string& bundlePath);
-// Reads one plug-in bundle. Refused when it cannot be read or has no identifier.
-Result<ScannedPlugIn> scanPlugIn(const std::string& path);
+// Reads one plug-in bundle. Refused when it cannot be read or has no identifier. With
+// `makeContainer` the registering user's data container is made and recorded; without, the
+// identifier is only checked to name one (each reader of a shared registry has its own).
+Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool makeContainer = true);
 // The plug-in bundles under an application's PlugIns/, canonical and in order; refused on a link
 // loop or an unreadable entry.
 Result<std::vector<std::string>> plugInPathsOf(const std::string& appPath);
@@ -116,6 +118,28 @@ PlugInRecordPtr makeRecord(const ScannedPlugIn& s, const ApplicationRecordPtr& a
 
 // ---- the store
 
+// A bundle read from disk, ready to be written in a transaction: an application with its plug-ins,
+// or one plug-in alone.
+struct ScannedBundle {
+    std::string path;
+    bool application = false;
+    std::string identifier, fingerprint;  // of an application
+    Dictionary record;                    // of an application
+    std::vector<ScannedPlugIn> plugIns;
+};
+
+// What one write changed: the events it journals, and whether rows without events changed (an
+// application alone).
+struct Events {
+    std::vector<PlugInRecordPtr> installed, uninstalled;
+    bool changedOther = false;
+    void add(Events&& more) {
+        installed.insert(installed.end(), more.installed.begin(), more.installed.end());
+        uninstalled.insert(uninstalled.end(), more.uninstalled.begin(), more.uninstalled.end());
+        changedOther = changedOther || more.changedOther;
+    }
+};
+
 // The kind of a journal entry, as stored.
 enum class JournalKind : int64_t { Install = 1, Uninstall = 2 };
 
@@ -125,17 +149,28 @@ struct StoredPlugIn {
     std::string fingerprint;
 };
 
+// How a store is opened.
+struct StoreOptions {
+    // The database must exist and nothing is written to it.
+    bool readOnly = false;
+    // Shared by every user of the machine (the system registry): a rollback journal instead of
+    // WAL, because a reader of a WAL database must be able to write its index file, and users may
+    // only read this one; files readable by all; and each reader's own data containers.
+    bool shared = false;
+};
+
 // The database and the records built from it. The SQLite handle is opened in serialized mode; the
 // records built from it, and every multi-statement use of it, are guarded by `mutex_`.
 class Store : public std::enable_shared_from_this<Store> {
 public:
-    static Result<std::shared_ptr<Store>> open(const std::string& path);
-    explicit Store(std::string path) : path_(std::move(path)) {}
+    static Result<std::shared_ptr<Store>> open(const std::string& path, StoreOptions options = {});
+    Store(std::string path, StoreOptions options) : path_(std::move(path)), options_(options) {}
     ~Store();
     Store(const Store&) = delete;
     Store& operator=(const Store&) = delete;
 
     const std::string& path() const { return path_; }
+    const StoreOptions& options() const { return options_; }
 
     // Reads.
     PlugInRecordPtr plugInForUUID(const UUID& uuid) EXCLUDES(mutex_);
@@ -152,17 +187,20 @@ public:
     // Changes whenever records built earlier may no longer be what the database holds.
     uint64_t contentVersion() EXCLUDES(mutex_);
 
+    // Whether an application or plug-in is registered at this canonical path.
+    bool holdsBundle(const std::string& path) EXCLUDES(mutex_);
+
     // Writes.
     Status registerBundle(const std::string& given, bool placeholder) EXCLUDES(mutex_);
     Status unregisterBundle(const std::string& given) EXCLUDES(mutex_);
+    Result<SyncReport> sync(const std::string& directory) EXCLUDES(mutex_);
 
     // Events (Events.cpp).
     Subscription subscribe(Observer& observer) EXCLUDES(observersMutex_);
     void unsubscribe(uint64_t id) EXCLUDES(observersMutex_, deliveryMutex_);
 
 private:
-    using WriteBody = std::function<Status(std::vector<PlugInRecordPtr>& installed,
-                                           std::vector<PlugInRecordPtr>& uninstalled)>;
+    using WriteBody = std::function<Status(Events& events)>;
 
     std::string directory() const { return path_.substr(0, path_.rfind('/')); }
     std::string wakePath() const { return path_ + ".events"; }
@@ -171,6 +209,9 @@ private:
 
     Error sqlError(const char* what) const;
     Status exec(const char* sql);
+    Result<int> schemaVersion();
+    // For a reader that may not migrate: the schema must be this release's.
+    Status checkSchema();
     Status migrate();
     void checkFreshness() REQUIRES(mutex_);
     // Drops every record and query answer built from the database.
@@ -182,6 +223,8 @@ private:
     // keeps beside it for its indexes.
     Rows rowsOf(const std::string& sql, const std::vector<std::string>& args) REQUIRES(mutex_);
     ApplicationRecordPtr appFromRow(const std::string& appPath) REQUIRES(mutex_);
+    // A shared registry's record names no container; each reader's is its own.
+    static Value withReadersContainer(Value serialized);
     PlugInRecordPtr recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath)
         REQUIRES(mutex_);
     Status insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint)
@@ -196,13 +239,20 @@ private:
     // Runs `body` in one write transaction, under the mutex; on success records journal entries,
     // remembers the registered paths and wakes observers.
     Status write(const WriteBody& body) EXCLUDES(mutex_);
-    Status registerPlugIn(const std::string& path) EXCLUDES(mutex_);
-    Status registerApplication(const std::string& path, const Value& info, bool placeholder) EXCLUDES(mutex_);
+    Result<ScannedBundle> scanBundle(const std::string& given, bool placeholder);
+    Status storePlugIn(const ScannedPlugIn& scanned, Events& events) REQUIRES(mutex_);
+    Status storeApplication(const ScannedBundle& bundle, Events& events) REQUIRES(mutex_);
+    Status storeBundle(const ScannedBundle& bundle, Events& events) REQUIRES(mutex_);
+    // Whether something was registered at `path` (and is now removed).
+    Result<bool> removeBundle(const std::string& path, Events& events) REQUIRES(mutex_);
+    bool holdsBundleLocked(const std::string& path) REQUIRES(mutex_);
+    std::vector<std::string> registeredPathsLocked() REQUIRES(mutex_);
 
     void startWatcher() REQUIRES(observersMutex_);
     void deliverNewEvents() EXCLUDES(mutex_, observersMutex_);
 
     const std::string path_;
+    const StoreOptions options_;
     sqlite3* db_ = nullptr;
     Mutex mutex_;
     int64_t seenDataVersion_ GUARDED_BY(mutex_) = -1;
@@ -216,8 +266,6 @@ private:
     // last asked.
     std::unique_ptr<notify::ChangeWatch> commits_ GUARDED_BY(mutex_);
     std::chrono::steady_clock::time_point versionAskedAt_ GUARDED_BY(mutex_);
-    // A write that changed rows without plug-in events (an application alone).
-    bool changedOther_ GUARDED_BY(mutex_) = false;
     int64_t lastSeq_ GUARDED_BY(mutex_) = 0;
 
     // Observers are called on the thread "vantry.events", one round of events at a time, while

@@ -18,6 +18,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "platform/value/Value.h"
@@ -123,20 +124,43 @@ public:
 
     void cancel();
 
+    // One subscription that ends `more` together with this one.
+    void join(Subscription&& more);
+
 private:
     friend class Store;
     Subscription(std::weak_ptr<Store> store, uint64_t id);
     std::weak_ptr<Store> store_;
     uint64_t id_ = 0;
+    std::unique_ptr<Subscription> next_;
 };
 
+// What bringing a registry in step with a directory did, by bundle path.
+struct SyncReport {
+    std::vector<std::string> registered, updated, unregistered;
+    // Bundles that could not be registered, with the reason; a registration they had is gone.
+    std::vector<std::pair<std::string, std::string>> refused;
+};
+
+// Two registries are read as one: the system registry, which holds what packages install in the
+// system applications directory and which only its owner (root) writes, and the user's own,
+// which holds everything else the user registers. A bundle path is in one of them, never both.
 class Registry {
 public:
-    // A registry over the database at `path` (created when missing). Each opening is independent;
-    // a program opens the registry of its platform root at defaultPath() and hands it to its users.
+    // The user's registry and the system registry, read as one (the layout's places). The system
+    // registry is read only unless this process may write it; it is left out while it does not
+    // exist.
+    static Result<std::unique_ptr<Registry>> openDefault();
+    // The system registry alone: to be written (created when missing) when this process may, else
+    // read only.
+    static Result<std::unique_ptr<Registry>> openSystem();
+    // One registry over the database at `path` (created when missing), with no system part. Each
+    // opening is independent.
     static Result<std::unique_ptr<Registry>> open(const std::string& path);
-    // <root>/var/lib/corvane/vantry/registry.db
+    // The user's registry: <per-user state>/vantry/registry.db
     static std::string defaultPath();
+    // The system registry: <root>/var/lib/corvane/vantry/registry.db
+    static std::string systemPath();
     ~Registry();
 
     PlugInRecordPtr plugInForUUID(const UUID& uuid);
@@ -156,9 +180,17 @@ public:
 
     // Registers an application (with its plug-ins) or a stand-alone plug-in. An unchanged bundle
     // changes nothing; a changed one replaces its records. Refused with the reason when the bundle
-    // cannot be read; the database is then unchanged.
+    // cannot be read; the database is then unchanged. A bundle in the system applications
+    // directory, or one the system registry holds, goes to the system registry (refused when this
+    // process may not write it); any other to the user's.
     Status registerBundle(const std::string& path, bool placeholder = false);
     Status unregisterBundle(const std::string& path);
+    // Whether registering or unregistering `path` writes the system registry.
+    bool isSystemBundle(const std::string& path);
+    // Brings the registry that holds `directory` (as registerBundle chooses) in step with it,
+    // in one transaction: registers what is new, registers again what changed, unregisters what
+    // was registered under the directory and is gone or can no longer be read.
+    Result<SyncReport> sync(const std::string& directory);
     // Reads a bundle as registration would and says why it would be refused; writes nothing and
     // needs no database.
     static Status checkBundle(const std::string& path);
@@ -177,11 +209,15 @@ public:
     // registered in it and can still be read. Returns the paths that could not be registered.
     static Result<std::vector<std::string>> rebuild(const std::string& path);
 
+    // The database written by default: the user's, or the system one when it is alone.
     const std::string& path() const;
 
 private:
-    explicit Registry(std::shared_ptr<Store> store);
-    std::shared_ptr<Store> store_;
+    Registry(std::shared_ptr<Store> user, std::shared_ptr<Store> system);
+    // The stores present, the system one first.
+    std::vector<Store*> stores() const;
+    Result<Store*> writerFor(const std::string& canonicalPath);
+    std::shared_ptr<Store> user_, system_;
 };
 
 }  // namespace corvane::vantry

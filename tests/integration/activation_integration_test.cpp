@@ -278,12 +278,16 @@ TEST(Activation, UninstallingAnApplicationEndsItsRunningPlugIn) {
 TEST(Activation, ReadyFailsWithTheDocumentedTextWhileSpawndIsAwayOrRefusesAndWorksWhenItIsBack) {
     Platform p;
     std::string uuid = p.uuids.at("com.example.greeter").string();
-    std::string unable = "unable to enable plug-in com.example.greeter(" + uuid + ") (error 4)";
+    std::string unable = "unable to enable plug-in com.example.greeter(" + uuid + "): ";
     p.spawnd->signal(SIGTERM);
     ASSERT_EQ(p.spawnd->wait(5s), 0);
     auto away = p.axctl({"ready", uuid});
     EXPECT_EQ(away.status, 1);
-    EXPECT_NE(away.err.find(unable), std::string::npos) << away.err;
+    // The reply's text, and beside it the cause: the socket nobody answers on, and how to start it.
+    EXPECT_NE(away.err.find(unable + "spawnd cannot be reached: nothing answers on " + p.root.path() + "/run/user/"),
+              std::string::npos)
+        << away.err;
+    EXPECT_NE(away.err.find("(start it with: systemctl --user start spawnd.socket) (error 4)"), std::string::npos) << away.err;
     EXPECT_TRUE(p.axd->waitForErr("spawnd cannot be reached on com.corvane.spawnd"));
     p.startSpawnd();
     auto back = p.axctl({"ready", uuid});
@@ -298,9 +302,15 @@ TEST(Activation, AnUnsignedDaemonServesDiscoveryButSaysWhyItCannotActivate) {
     EXPECT_NE(matched.out.find(uuid), std::string::npos) << matched.out;
     auto refused = p.axctl({"ready", uuid});
     EXPECT_EQ(refused.status, 1);
-    EXPECT_NE(refused.err.find("unable to enable plug-in com.example.greeter"), std::string::npos) << refused.err;
+    // The host reads spawnd's reason: which program lacks which entitlement, and why.
+    EXPECT_NE(refused.err.find("unable to enable plug-in com.example.greeter(" + uuid +
+                               "): spawnd accepts plug-ins only from a program with the "
+                               "com.corvane.private.rpx.domain-extension.proxy entitlement, and "),
+              std::string::npos)
+        << refused.err;
+    EXPECT_NE(refused.err.find("has none: "), std::string::npos) << refused.err;
     EXPECT_TRUE(p.axd->waitForErr("spawnd refused: this axd's signature lacks the com.corvane.private.rpx.domain-extension.proxy entitlement"));
-    EXPECT_TRUE(p.spawnd->waitForErr("no com.corvane.private.rpx.domain-extension.proxy entitlement"));
+    EXPECT_TRUE(p.spawnd->waitForErr("with the com.corvane.private.rpx.domain-extension.proxy entitlement, and "));
     // Read tokens need no platform entitlement: one per UUID, in order.
     auto tokens = p.axctl({"access", "--json", uuid, p.uuids.at("com.example.keys").string(), uuid});
     EXPECT_EQ(tokens.status, 0) << tokens.err;
