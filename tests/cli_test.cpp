@@ -52,8 +52,9 @@ TEST(Cli, EveryToolFollowsTheConvention) {
         {{"axsign", "keygen", "--out"}, 64, "option --out needs a value"},
         {{"axsign", "sign", "--key", root / "k"}, 64, "missing operand"},
         {{"axsign", "verify", "a", "b"}, 64, "unexpected argument b"},
-        {{"axsign", "trust", root / "nowhere.pub"}, 65, ""},
-        {{"axsign", "sign", "--key", root / "nowhere", root.path()}, 65, ""},
+        {{"axsign", "trust", root / "nowhere.pub"}, 66, ""},
+        {{"axsign", "sign", "--key", root / "nowhere", root.path()}, 66, ""},
+        {{"axsign", "sign", "--key", root / "nowhere", root / "absent"}, 66, ""},
         {{"axsign", "verify", "--help"}, 0, ""},
     };
     for (const auto& c : cases) {
@@ -82,7 +83,7 @@ TEST(Cli, KeygenRefusesToReplaceAKeyUnlessForced) {
     ASSERT_EQ(axtest::run({axtest::binary("axsign"), "keygen", "--out", key}).status, 0);
     std::string before = axtest::readFile(key);
     auto refused = axtest::run({axtest::binary("axsign"), "keygen", "--out", key});
-    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(refused.status, 73);
     EXPECT_NE(refused.err.find("--force"), std::string::npos) << refused.err;
     EXPECT_EQ(axtest::readFile(key), before);
     ASSERT_EQ(axtest::run({axtest::binary("axsign"), "keygen", "--out", key, "--force"}).status, 0);

@@ -305,12 +305,34 @@ Verification verifyContents(const std::string& bundlePath) {
 
 }  // namespace
 
+std::string machineSignatureDirectory() { return layout::stateDir() + "/signatures"; }
+
+std::string machineSignaturePath(const std::string& executable) {
+    std::string escaped;
+    for (char c : layout::canonicalPath(executable).value_or(executable)) {
+        if (c == '/') {
+            escaped += "%2F";
+        } else if (c == '%') {
+            escaped += "%25";
+        } else {
+            escaped += c;
+        }
+    }
+    return machineSignatureDirectory() + "/" + escaped + ".axsig";
+}
+
 std::string signaturePath(const std::string& path) {
     struct stat st {};
     if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path + "/" + bundle::kSignatureFileName;
     auto b = bundle::Bundle::openExecutable(path);
     if (auto dir = b->property(bundle::kPropertyBundlePath)) return *dir + "/" + bundle::kSignatureFileName;
-    return path + ".axsig";
+    // Beside the executable, else in the machine's store (programs a package installed, whose
+    // directory is the package's).
+    std::string beside = path + ".axsig";
+    if (::lstat(beside.c_str(), &st) == 0) return beside;
+    std::string machine = machineSignaturePath(path);
+    if (::lstat(machine.c_str(), &st) == 0) return machine;
+    return beside;
 }
 
 Verification verifyExecutable(const std::string& path) {
@@ -591,21 +613,35 @@ Result<Bytes> readPublicKey(const std::string& path) {
 
 std::string trustDirectory() { return layout::configDir() + "/trust.d"; }
 
+namespace {
+std::string trustFileOf(const Bytes& key) { return trustDirectory() + "/" + hex(key).substr(0, 16) + ".pub"; }
+}  // namespace
+
+Result<bool> untrustKey(const std::string& publicKeyPath) {
+    auto key = readPublicKey(publicKeyPath);
+    if (!key) return key.error();
+    if (::unlink(trustFileOf(*key).c_str()) == 0) return true;
+    if (errno == ENOENT) return false;
+    return Error::posix(errno, trustFileOf(*key));
+}
+
 Status trustKey(const std::string& publicKeyPath) {
     auto key = readPublicKey(publicKeyPath);
     if (!key) return key.error();
     if (Status made = layout::makeDirectories(trustDirectory(), 0755); !made.ok()) return made;
-    return plist::writeFileAtomically(trustDirectory() + "/" + hex(*key).substr(0, 16) + ".pub",
-                                      hex(*key) + "\n", 0644);
+    return plist::writeFileAtomically(trustFileOf(*key), hex(*key) + "\n", 0644);
 }
 
 Status sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
-                const Value& entitlements) {
+                const Value& entitlements, Placement placement) {
     if (!sodiumReady()) return signError("no crypto library");
     std::string exe = path;
     auto covers = SignatureFile::Covers::Executable;
     struct stat st {};
-    if (::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
+    if (::stat(path.c_str(), &st) != 0) return Error::posix(errno, path);
+    if (S_ISDIR(st.st_mode) && placement == Placement::Machine)
+        return signError(path + ": a bundle keeps its signature in itself, not in the machine's store");
+    if (S_ISDIR(st.st_mode)) {
         auto b = bundle::Bundle::openPath(path);
         if (!b) return signError(path + ": not a bundle");
         auto named = b->property(bundle::kPropertyExecutablePath);
@@ -645,7 +681,7 @@ Status sign(const std::string& path, const KeyPair& keys, std::optional<std::str
                        {"entitlements", Value::data(entBytes)},
                        {"signer", Value::data(keys.publicKey)},
                        {"signature", Value::data(signature)}});
-    std::string target = signaturePath(path);
+    std::string target = placement == Placement::Machine ? machineSignaturePath(path) : signaturePath(path);
     if (Status made = layout::makeDirectories(target.substr(0, target.rfind('/')), 0755); !made.ok()) return made;
     return plist::writeXMLFile(target, file, 0644);
 }

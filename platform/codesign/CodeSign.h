@@ -81,17 +81,29 @@ Status writeKeyPair(const std::string& path, const KeyPair& keys);
 Result<KeyPair> readSecretKey(const std::string& path);
 Result<Bytes> readPublicKey(const std::string& path);
 std::string trustDirectory();
+// Removes a public key from the trust directory; false when it was not there.
+Result<bool> untrustKey(const std::string& publicKeyPath);
 // Installs a public key file in the trust directory.
 Status trustKey(const std::string& publicKeyPath);
+
+// Where a bare executable's signature is written: beside it ("<executable>.axsig"), or in the
+// machine's store (<root>/var/lib/corvane/signatures), for programs a package installed, whose
+// directory belongs to the package. A signature verifies wherever it lies: only a trusted key
+// makes one, so the store needs no protection of its own.
+enum class Placement { Beside, Machine };
 
 // Signs a bundle (its executable, or its contents when it has no executable, as a data plug-in) or a
 // bare executable. Without an identifier, the bundle's KFBundleIdentifier or the executable's file
 // name is used.
 Status sign(const std::string& path, const KeyPair& keys, std::optional<std::string> identifier,
-                const Value& entitlements);
+            const Value& entitlements, Placement placement = Placement::Beside);
 
-// Where the signature of `path` (a bundle or an executable) lives.
+// Where the signature of `path` (a bundle or an executable) lives: a bundle's Signature.plist; for a
+// bare executable, the detached signature beside it, else the one in the machine's store.
 std::string signaturePath(const std::string& path);
+std::string machineSignatureDirectory();
+// The machine store's file for an executable: its canonical path with "/" and "%" escaped.
+std::string machineSignaturePath(const std::string& executable);
 
 // ---- the signature file, for the fuzz target and tools
 

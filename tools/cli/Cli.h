@@ -21,8 +21,10 @@ enum ExitStatus : int {
     kFailure = 1,        // anything not listed below
     kUsage = 64,         // a bad command line
     kDataError = 65,     // input that cannot be read or used
+    kNoInput = 66,       // a named input file that does not exist
     kUnavailable = 69,   // a service that cannot be reached
-    kNoPermission = 77,  // refused for lack of an entitlement
+    kCannotCreate = 73,  // an output file that cannot be made
+    kNoPermission = 77,  // refused for lack of an entitlement or of permission
     kConfig = 78,        // the platform's places cannot be used (CORVANE_ROOT, XDG_RUNTIME_DIR)
 };
 
