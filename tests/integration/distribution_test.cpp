@@ -74,6 +74,20 @@ TEST(Distribution, TheUnitsPassSystemdVerification) {
                                  dir / "spawnd.socket", dir / "spawnd.service"});
     EXPECT_EQ(verified.status, 0) << verified.out << verified.err;
     EXPECT_EQ(verified.err, "");
+
+    // How exposed each daemon is, by systemd's own measure (lower is better): as far as a per-user
+    // service can be confined without breaking what it does.
+    struct Goal {
+        const char* unit;
+        double most;
+    };
+    for (Goal goal : {Goal{"axd.service", 3.5}, Goal{"spawnd.service", 5.5}}) {
+        auto scored = axtest::run({"/usr/bin/systemd-analyze", "security", "--offline=yes", "--no-pager", dir / goal.unit});
+        std::smatch level;
+        ASSERT_TRUE(std::regex_search(scored.out, level, std::regex("Overall exposure level for [a-z.]+: ([0-9.]+)")))
+            << scored.out << scored.err;
+        EXPECT_LE(std::stod(level[1]), goal.most) << goal.unit << "\n" << scored.out;
+    }
 }
 
 TEST(Distribution, SocketActivationStartsEachDaemonOnItsFirstClient) {
