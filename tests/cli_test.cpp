@@ -4,6 +4,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <filesystem>
+
 #include <map>
 #include <string>
 #include <vector>
@@ -16,6 +18,8 @@ namespace cli = corvane::cli;
 TEST(Cli, EveryToolFollowsTheConvention) {
     axtest::PlatformRoot root;
     axtest::writeFile(root / "garbage.plist", "not a property list");
+    std::filesystem::create_directories(root / "Fifo.app");
+    ASSERT_EQ(::mkfifo((root / "Fifo.app/Info.plist").c_str(), 0600), 0);
     const std::string uuid = "01234567-89AB-CDEF-0123-456789ABCDEF";
     struct Case {
         std::vector<std::string> argv;
@@ -45,6 +49,7 @@ TEST(Cli, EveryToolFollowsTheConvention) {
         {{"vantry", "show"}, 64, "missing operand"},
         {{"vantry", "show", "--help"}, 0, ""},
         {{"vantry", "register", root / "nowhere"}, 65, "not a bundle"},
+        {{"pcx", "grant", root / "Fifo.app", "com.example.camera"}, 65, "Info.plist: a FIFO, not a regular file"},
         {{"vantry", "show", uuid}, 65, "no plug-in"},
         // axsign
         {{"axsign"}, 64, "usage: axsign"},

@@ -71,10 +71,13 @@ Value answer(const rpx::Connection& connection, const Value& request) {
 std::string storePath() { return layout::userDataDir() + "/pcx/consent.plist"; }
 
 Result<std::string> bundleIdentifierAt(const std::string& bundlePath) {
-    Value info = bundle::readInfoPlist(bundlePath);
-    const std::string* identifier = info["KFBundleIdentifier"].asString();
+    // What is wrong, said as it is: no Info.plist, one that cannot be read (a FIFO, too large, no
+    // permission), one that does not parse, or one without identifier.
+    auto info = bundle::readPropertyListOfBundle(bundlePath + "/Info.plist");
+    if (!info) return Error(kPosixErrorDomain, ENOENT, bundlePath + " is no bundle: " + info.error().description());
+    const std::string* identifier = (*info)["KFBundleIdentifier"].asString();
     if (!identifier || identifier->empty()) {
-        return Error::posix(ENOENT, bundlePath + ": no bundle with a KFBundleIdentifier");
+        return Error(kPosixErrorDomain, ENOENT, bundlePath + "/Info.plist has no KFBundleIdentifier");
     }
     return *identifier;
 }
