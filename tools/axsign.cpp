@@ -52,7 +52,7 @@ bool exists(const std::string& path) {
 
 bool permissionDenied(const Error& e) {
     return (e.domain == kPosixErrorDomain && (e.code == EACCES || e.code == EPERM || e.code == EROFS)) ||
-           (e.domain == kFileErrorDomain && e.code == kFileNoPermission);
+           (e.domain == kFileErrorDomain && (e.code == kFileNoPermission || e.code == kFileWriteNoPermission));
 }
 
 // A file that could not be read: missing (66), not allowed (77), or not what it should be (65).

@@ -340,7 +340,8 @@ Error Error::posix(int err, std::string_view context) {
 }
 
 Error Error::file(int err, std::string_view path, bool writing) {
-    int64_t code = writing ? kFileWriteUnknown
+    int64_t code = writing && (err == EACCES || err == EPERM || err == EROFS) ? kFileWriteNoPermission
+                   : writing                                                 ? kFileWriteUnknown
                    : err == ENOENT || err == ENOTDIR ? kFileNoSuchFile
                    : err == EACCES || err == EPERM   ? kFileNoPermission
                                                      : kFileReadUnknown;

@@ -264,12 +264,14 @@ struct Error {
 
 inline constexpr const char* kPosixErrorDomain = "POSIX";
 // File errors: kFileNoSuchFile for a missing file, kFileNoPermission, kFileReadUnknown for any
-// other read failure and kFileWriteUnknown for any failed write.
+// other read failure; kFileWriteNoPermission for a write refused by permissions (or a read-only file
+// system) and kFileWriteUnknown for any other failed write.
 inline constexpr const char* kFileErrorDomain = "com.corvane.file";
 inline constexpr int64_t kFileReadUnknown = 256;
 inline constexpr int64_t kFileNoPermission = 257;
 inline constexpr int64_t kFileNoSuchFile = 260;
 inline constexpr int64_t kFileWriteUnknown = 512;
+inline constexpr int64_t kFileWriteNoPermission = 513;
 
 // The outcome of an operation that gives nothing back: ok, or the error that stopped it. Failures
 // are values throughout: nothing is thrown.
