@@ -484,7 +484,9 @@ Status Store::storeApplication(const ScannedBundle& bundle, Events& events) {
     // Plug-ins that went away or changed are uninstalled; new and changed ones installed;
     // unchanged ones keep their UUIDs, unless the application's own record changed (they carry
     // it).
-    for (const auto& [p, row] : before) {
+    for (const auto& entry : before) {
+        const std::string& p = entry.first;
+        const StoredPlugIn& row = entry.second;
         auto same = std::find_if(bundle.plugIns.begin(), bundle.plugIns.end(), [&](const ScannedPlugIn& s) {
             return s.path == p && s.fingerprint == row.fingerprint && !appChanged;
         });
