@@ -19,9 +19,18 @@ users=(axpkg-alice axpkg-bob)
 ours=(annexa-test-greeter libannexa-dev libannexa1 annexa)
 pids=()
 export DEBIAN_FRONTEND=noninteractive
+# The test's users go with everything they had, so that a second run starts as fresh as the first.
+remove_users() {
+    for user in "${users[@]}"; do
+        id "$user" >/dev/null 2>&1 || continue
+        pkill -KILL -u "$user" 2>/dev/null || true
+        rm -rf "/run/user/$(id -u "$user")"
+        userdel --remove "$user" 2>/dev/null || true
+    done
+}
 cleanup() {
     for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null || true; done
-    for user in "${users[@]}"; do pkill -u "$user" 2>/dev/null || true; done
+    remove_users
     [ -f "$work/developer.key.pub" ] && axsign untrust "$work/developer.key.pub" >/dev/null 2>&1 || true
     dpkg --purge "${ours[@]}" >/dev/null 2>&1 || true
     rm -rf "$work"
@@ -54,9 +63,8 @@ for package in annexa libannexa1 libannexa-dev; do
 done
 
 echo "== users, and what the machine holds before"
-for user in "${users[@]}"; do
-    id "$user" >/dev/null 2>&1 || useradd --create-home --shell /bin/bash "$user"
-done
+remove_users
+for user in "${users[@]}"; do useradd --create-home --shell /bin/bash "$user"; done
 # What the packages depend on comes in first (and stays), so that the listings differ only by ours.
 dpkg --purge "${ours[@]}" >/dev/null 2>&1 || true
 apt-get install -y -qq "${debs[@]}" >"$work/apt.log" 2>&1 || { cat "$work/apt.log"; fail "the packages do not install"; }
@@ -143,6 +151,8 @@ start_daemons() {
     local user=$1 uid rpx
     uid=$(id -u "$user")
     rpx=/run/user/$uid/rpx
+    # As logind makes it at login: new, the user's, 0700.
+    rm -rf "/run/user/$uid"
     install -d -o "$user" -g "$user" -m 0700 "/run/user/$uid"
     as "$user" mkdir -p -m 0700 "$rpx"
     local environment=(-E HOME -E XDG_RUNTIME_DIR -E PATH -E LANG)
@@ -236,6 +246,10 @@ echo "== purging leaves nothing of ours"
 for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null || true; done
 for user in "${users[@]}"; do pkill -u "$user" 2>/dev/null || true; done
 pids=()
+# Every process of the users has ended before their files are looked at.
+for user in "${users[@]}"; do
+    for _ in $(seq 100); do pgrep -u "$user" >/dev/null || break; sleep 0.05; done
+done
 axsign untrust "$work/developer.key.pub" >/dev/null
 dpkg --purge "${ours[@]}" >"$work/purge.log" 2>&1 || { cat "$work/purge.log"; fail "dpkg --purge failed"; }
 listing >"$work/after"
