@@ -79,7 +79,8 @@ std::vector<Store*> Registry::stores() const {
 bool Registry::isSystemBundle(const std::string& path) {
     if (!user_) return true;
     std::string canonical = layout::canonicalPath(path).value_or(path);
-    if (layout::isBeneath(canonical, layout::systemApplicationsDir())) return true;
+    std::string applications = layout::systemApplicationsDir();
+    if (layout::isBeneath(canonical, layout::canonicalPath(applications).value_or(applications))) return true;
     return system_ && (system_->holdsBundle(canonical) || system_->holdsBundle(path));
 }
 
@@ -138,11 +139,7 @@ std::vector<PlugInRecordPtr> Registry::query(const Value& pattern,
     std::vector<PlugInRecordPtr> out;
     for (Store* store : stores()) {
         auto some = store->query(pattern, filter);
-        if (out.empty()) {
-            out = std::move(some);
-        } else {
-            out.insert(out.end(), std::make_move_iterator(some.begin()), std::make_move_iterator(some.end()));
-        }
+        out.insert(out.end(), std::make_move_iterator(some.begin()), std::make_move_iterator(some.end()));
     }
     return out;
 }
