@@ -58,13 +58,22 @@ corvane::rpx::ConnectionPtr Transaction::connection() const { return client_->co
 
 void Transaction::dispatch() {
     const std::string* name = request()[message::kRequest].asString();
+    // The version is a number of either integer kind (a client writing JSON has no unsigned
+    // one); anything else counts as none.
     const Value& version = request()[message::kVersion];
-    version_ = version.kind() == Value::Kind::UInt64 ? *version.uint64Value() : 0;
+    std::string received = "0";
+    version_ = 0;
+    if (auto u = version.kind() == Value::Kind::UInt64 ? version.uint64Value() : std::nullopt) {
+        version_ = *u;
+        received = std::to_string(*u);
+    } else if (auto i = version.kind() == Value::Kind::Int64 ? version.int64Value() : std::nullopt) {
+        version_ = *i > 0 ? static_cast<uint64_t>(*i) : 0;
+        received = std::to_string(*i);
+    }
     if (version_ < kOldestProtocolVersion || version_ > kCurrentProtocolVersion) {
-        // The number as it was sent, not cut to 32 bits or read as signed.
+        // The number as it was sent, not cut to 32 bits.
         failMessage(AXErrorCode::VersionMismatch,
-                    log::formatText("unsupported protocol version %llu (current %llu)",
-                                    static_cast<unsigned long long>(version_),
+                    log::formatText("unsupported protocol version %s (current %llu)", received.c_str(),
                                     static_cast<unsigned long long>(kCurrentProtocolVersion)));
         return;
     }

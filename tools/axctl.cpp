@@ -36,7 +36,7 @@ const cli::Syntax kRemove{"[-S servicename] remove PATH...", {}, {}, 1};
 const cli::Syntax kAnnotate{"[-S servicename] annotate [--election N] [--extension FILE.plist] UUID...", {},
                           {"--election", "--extension"}, 1};
 const cli::Syntax kBulkAnnotate{"[-S servicename] bulk-annotate FILE.plist", {}, {}, 1, 1};
-const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN]... [--rules FILE.plist] [--all-versions] [--duplicates] "
+const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN|KEY:=VALUE]... [--rules FILE.plist] [--all-versions] [--duplicates] "
                          "[--system-only] [--all] [--explain] [--json]",
                          {"--all-versions", "--duplicates", "--system-only", "--all", "--explain", "--json"},
                          {"-r", "--rules"},
@@ -70,10 +70,13 @@ const char* kHelp =
     "                                               set the user's choices about plug-ins\n"
     "  bulk-annotate FILE.plist                     set each plug-in's extension dictionary:\n"
     "                                               FILE.plist maps UUID texts to dictionaries\n"
-    "  match [-r KEY=PATTERN]... [--rules FILE.plist] [--all-versions] [--duplicates]\n"
+    "  match [-r KEY=PATTERN|KEY:=VALUE]... [--rules FILE.plist] [--all-versions] [--duplicates]\n"
     "        [--system-only] [--all] [--explain] [--json]\n"
     "                                               the plug-ins that fit; --explain says why\n"
-    "                                               each installed plug-in was left out\n"
+    "                                               each installed plug-in was left out;\n"
+    "                                               KEY=PATTERN is a string as written (an array\n"
+    "                                               or dictionary in the notation is that value),\n"
+    "                                               KEY:=VALUE a value in the notation (2u, true)\n"
     "  ready [--json] UUID...                       get plug-ins ready for this process\n"
     "  access [--json] UUID...                      read tokens for the plug-ins' bundles\n"
     "  lock --apps|--plugins [--json] PATH...       hold plug-ins (of applications, or themselves);\n"
@@ -215,12 +218,24 @@ int match(const std::string& service, const cli::Parsed& p) {
     if (p.has("-r")) {
         for (const auto& rule : p.options.at("-r")) {
             size_t eq = rule.find('=');
-            if (eq == std::string::npos || eq == 0) return cli::usageError(kTool, "-r needs KEY=PATTERN: " + rule, kMatch.usage);
-            // A pattern in the text notation (true, ["a", ">2"], {"items": [...]}) is taken as that
-            // value; anything else is one operator pattern, as written.
+            bool notation = eq != std::string::npos && eq > 0 && rule[eq - 1] == ':';
+            size_t keyEnd = notation ? eq - 1 : eq;
+            if (eq == std::string::npos || keyEnd == 0)
+                return cli::usageError(kTool, "-r needs KEY=PATTERN or KEY:=VALUE: " + rule, kMatch.usage);
             std::string text = rule.substr(eq + 1);
+            if (notation) {
+                // KEY:=VALUE: any value, as the text notation writes it (2, 2u, true, "2").
+                auto value = Value::parseReporting(text);
+                if (!value) return cli::fail(kTool, "-r " + rule + ": " + value.error().description(), cli::kDataError);
+                rules[rule.substr(0, keyEnd)] = *value;
+                continue;
+            }
+            // KEY=PATTERN is the pattern as written, a string ("2" and "1" too), unless it is an
+            // array or a dictionary in the text notation (["a", ">2"], {"items": [...]}), which no
+            // one means as a string.
             auto value = Value::parse(text);
-            rules[rule.substr(0, eq)] = value ? *value : Value(text);
+            bool structured = value && (value->isArray() || value->isDictionary());
+            rules[rule.substr(0, keyEnd)] = structured ? *value : Value(text);
         }
     }
     uint64_t flags = 0;

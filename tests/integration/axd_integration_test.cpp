@@ -110,7 +110,12 @@ TEST(Axd, MalformedRequestsGetTheirErrorReplies) {
         {"no version", dict({{"request", "bulk"}}), error(7, "unsupported protocol version 0 (current 3)")},
         {"version 1", dict({{"request", "bulk"}, {"version", uint64_t{1}}}), error(7, "unsupported protocol version 1 (current 3)")},
         {"version 4", dict({{"request", "bulk"}, {"version", uint64_t{4}}}), error(7, "unsupported protocol version 4 (current 3)")},
-        {"version of another type", dict({{"request", "bulk"}, {"version", int64_t{3}}}),
+        // JSON has no unsigned numbers: a signed 3 is version 3, and a number that is no version is
+        // named as it was sent.
+        {"signed version 3 is served", dict({{"request", "bulk"}, {"version", int64_t{3}}}), dict({})},
+        {"negative version", dict({{"request", "bulk"}, {"version", int64_t{-1}}}),
+         error(7, "unsupported protocol version -1 (current 3)")},
+        {"version of another type", dict({{"request", "bulk"}, {"version", 3.0}}),
          error(7, "unsupported protocol version 0 (current 3)")},
         {"version 2 is served", dict({{"request", "bulk"}, {"version", uint64_t{2}}}), dict({})},
         {"no request name", dict({{"version", uint64_t{3}}}), error(4, "invalid request format (missing type)")},
@@ -282,6 +287,26 @@ TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
     EXPECT_EQ(notify::count(kChange), 2u);
     EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"], dict({{"election", 2}, {"extension", dict({})}}));
     EXPECT_TRUE(d.axd->waitForErr("election := 1"));
+
+    // axctl's rules: KEY=PATTERN is a string as written, also when it looks like a number (the
+    // election's subject is the text "2"); KEY:=VALUE is a value in the notation.
+    struct RuleCase {
+        std::string rule;
+        int status;
+        std::string found;  // an identifier the answer has, or "" for none
+    };
+    for (const RuleCase& c : std::vector<RuleCase>{{"KSUserElection=2", 0, "com.example.One"},
+                                                   {"KSUserElection=3", 0, "com.example.Two"},
+                                                   {"KSUserElection:=\"3\"", 0, "com.example.Two"},
+                                                   {"KSUserElection:=[3", 65, ""},
+                                                   {":=3", 64, ""}}) {
+        auto matched = d.axctl({"match", "-r", c.rule});
+        EXPECT_EQ(matched.status, c.status) << c.rule << "\n" << matched.err;
+        if (!c.found.empty()) {
+            EXPECT_NE(matched.out.find(c.found), std::string::npos) << c.rule << "\n" << matched.out;
+            EXPECT_EQ(matched.out.find('\n'), matched.out.size() - 1) << c.rule << ": one plug-in\n" << matched.out;
+        }
+    }
 
     // remove: refused without the manager entitlement, served with it.
     auto refused = d.axctl({"remove", app});
