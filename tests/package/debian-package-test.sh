@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Builds the Debian packages from the source tree, installs them on this machine (CI's machines are
 # throwaway, and the test runs as root) and uses them as ordinary users would:
+#   - lintian finds no error and no warning in them;
 #   - the installation makes the machine's key, signs the programs and creates the system registry;
 #   - a package that ships an application into /usr/lib/corvane/Applications needs no script of its
 #     own: the trigger registers it, and removing the package unregisters it and ends its instance;
@@ -61,6 +62,8 @@ for package in annexa libannexa1 libannexa-dev; do
     [ -n "$deb" ] || fail "no package $package was built"
     debs+=("$deb")
 done
+lintian --fail-on error,warning --tag-display-limit 0 "${debs[@]}" >"$work/lintian.log" 2>&1 ||
+    { grep -v 'root privileges' "$work/lintian.log"; fail "lintian finds errors or warnings"; }
 
 echo "== users, and what the machine holds before"
 remove_users
