@@ -413,15 +413,18 @@ TEST(Vantry, TheSystemAndTheUserRegistryAreReadAsOne) {
     std::string second = makeApp(layout::systemApplicationsDir(), "Second.app", "com.example.second");
     std::string broken = axtest::makeBundle(layout::systemApplicationsDir(), "Broken.app", axtest::appInfo("com.example.broken"));
     axtest::writeFile(broken + "/Info.plist", "<plist><dict>");
+    fs::create_directory_symlink(userApp, layout::systemApplicationsDir() + "/Elsewhere.app");
     axtest::writeFile(systemApp + "/PlugIns/P.appex/Info.plist",
                       *plist::toXML(axtest::plugInInfo("com.example.tools.p", dict({{"KSExtensionPointIdentifier", "com.example.other"}}))));
     synced = axtest::run({axtest::binary("vantry"), "--system", "sync"});
     EXPECT_EQ(synced.status, 65);
     EXPECT_EQ(synced.out, "registered " + second + "\nregistered again " + systemApp + "\n");
     EXPECT_NE(synced.err.find("malformed Info.plist"), std::string::npos) << synced.err;
+    EXPECT_NE(synced.err.find("Elsewhere.app leads out of"), std::string::npos) << synced.err;
     EXPECT_NE((*both)->plugInForPath(systemApp + "/PlugIns/P.appex")->uuid(), system->uuid());
     fs::remove_all(second);
     fs::remove_all(broken);
+    fs::remove(layout::systemApplicationsDir() + "/Elsewhere.app");
     synced = axtest::run({axtest::binary("vantry"), "--system", "sync"});
     EXPECT_EQ(synced.status, 0) << synced.err;
     EXPECT_EQ(synced.out, "unregistered " + second + "\n");

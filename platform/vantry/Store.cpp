@@ -587,6 +587,12 @@ Result<SyncReport> Store::sync(const std::string& directory) {
             report.refused.emplace_back(path, bundle.error().description());
             continue;
         }
+        // A link to a bundle elsewhere would be registered at its target, where no later sync of
+        // this directory would see it leave.
+        if (!layout::isBeneath(bundle->path, directory)) {
+            report.refused.emplace_back(path, path + " leads out of " + directory + " (to " + bundle->path + ")");
+            continue;
+        }
         present.push_back(std::move(*bundle));
     }
     Status written = write([&](Events& events) -> Status {

@@ -205,7 +205,13 @@ as axpkg-alice vantry --system register "$home/.local/share/corvane/Applications
 system_status=$?
 as axpkg-alice axctl remove /usr/lib/corvane/Applications/Greeter.app >/dev/null 2>"$work/remove.err"
 remove_status=$?
+# A copy of axctl has no signature, so no manager entitlement: axd itself refuses the change.
+as axpkg-alice cp /usr/bin/axctl "$home/axctl"
+as axpkg-alice "$home/axctl" add /usr/lib/corvane/Applications/Greeter.app >/dev/null 2>"$work/add.err"
+add_status=$?
 set -e
+[ "$add_status" = 77 ] && grep -q 'only root or a manager may change the system registry' "$work/add.err" ||
+    fail "an unsigned axctl adding a system application: $add_status $(cat "$work/add.err")"
 grep -q 'only its owner writes' "$work/remove.err" || fail "axctl remove of a system application: $remove_status $(cat "$work/remove.err")"
 [ "$status" = 77 ] && grep -q 'run it as root' "$work/trust.err" || fail "axsign trust as a user: $status $(cat "$work/trust.err")"
 [ "$system_status" = 65 ] && grep -q 'only its owner writes' "$work/system.err" ||
