@@ -279,8 +279,7 @@ TEST(Vantry, ListingShowsApplicationsWithoutPlugIns) {
     EXPECT_NE(text.out.find(f.app + "\n  "), std::string::npos) << text.out;
     auto json = f.vantry({"list", "--json"});
     ASSERT_EQ(json.status, 0);
-    // JSON's objects and arrays read as the text notation's, so the document parses as a Value.
-    auto document = Value::parse(json.out);
+    auto document = Value::parseJson(json.out);
     ASSERT_TRUE(document) << json.out;
     const Array* apps = (*document)["applications"].asArray();
     ASSERT_TRUE(apps);
@@ -288,6 +287,9 @@ TEST(Vantry, ListingShowsApplicationsWithoutPlugIns) {
     EXPECT_EQ((*apps)[0]["path"], Value(bare));
     EXPECT_EQ((*apps)[0]["plugins"], Value(Array{}));
     EXPECT_EQ((*apps)[1]["plugins"].asArray()->size(), 3u);
+    // Values keep their kinds: the registration date reads back as a date.
+    const Value& record = (*(*apps)[1]["plugins"].asArray())[0];
+    EXPECT_TRUE(record["registered"].asDate()) << json.out;
 }
 
 TEST(Vantry, ADamagedDatabaseIsReportedAndRebuilt) {

@@ -4,7 +4,10 @@
  *     cc host.c $(pkg-config --cflags --libs annexa)
  *
  * Values cross this interface in the text notation of messages (docs/rpx-wire.md), for example
- * {"election": 1} or {"request": "bulk", "version": 3u}.
+ * {"election": 1} or {"request": "bulk", "version": 3u}, or in JSON once a client, a plug-in
+ * connection or a plug-in's serving loop is set to ANNEXA_NOTATION_JSON: then every value the
+ * library returns is JSON and every value it reads must be, with the tagged objects of
+ * docs/rpx-wire.md for what JSON lacks ({"$uuid": "..."}, {"$data": "<base64>"}, ...).
  *
  * Return codes: 0 for success; a positive code is the daemon's error code (docs/client-library.md
  * lists them); ANNEXA_EUNREACHABLE when the daemon cannot be reached (not running, or the
@@ -32,6 +35,12 @@ extern "C" {
 
 #define ANNEXA_EINVAL (-1)
 #define ANNEXA_EUNREACHABLE (-2)
+/* annexa_watch_next: no event came within the time given. */
+#define ANNEXA_ETIMEDOUT (-3)
+
+/* How values are written as text: the text notation (the default) or JSON. */
+#define ANNEXA_NOTATION_TEXT 0
+#define ANNEXA_NOTATION_JSON 1
 
 typedef struct annexa_client annexa_client;
 
@@ -39,6 +48,9 @@ typedef struct annexa_client annexa_client;
  * when memory runs out: an unreachable daemon shows in the replies. */
 annexa_client* annexa_client_create(const char* service_name);
 void annexa_client_destroy(annexa_client* client);
+/* Sets the notation of every value this client's calls read and return; ANNEXA_EINVAL for an
+ * unknown notation, else 0. */
+int64_t annexa_client_set_notation(annexa_client* client, int notation);
 
 /* Sends one message written in the text notation and waits for the reply, which `reply` receives
  * in the same notation (release it with annexa_free). Returns 0 whenever a reply came, whatever it
@@ -81,6 +93,22 @@ int64_t annexa_unlock(annexa_client* client, const char* token, char** error_tex
  * with annexa_free) receives `size` bytes. */
 int64_t annexa_receipt(annexa_client* client, void** bytes, size_t* size, char** error_text);
 
+/* ---- Following the registry: installs, uninstalls, annotations and holds, as they happen */
+
+typedef struct annexa_watch annexa_watch;
+
+/* Subscribes to the daemon's events on a connection of its own, in the client's notation. Null
+ * when the daemon cannot be reached or refuses, with the reason in `error_text`. */
+annexa_watch* annexa_watch_start(annexa_client* client, char** error_text);
+/* A descriptor that polls readable while an event waits, for a host's own event loop. */
+int annexa_watch_fd(const annexa_watch* watch);
+/* The next event (release it with annexa_free), waiting at most `timeout_ms` milliseconds (-1:
+ * without limit). ANNEXA_ETIMEDOUT when none came; ANNEXA_EUNREACHABLE once the daemon ended the
+ * watch, or when the host fell so far behind that events were lost (the watch has then ended;
+ * match again and start a new one). */
+int64_t annexa_watch_next(annexa_watch* watch, int timeout_ms, char** event, char** error_text);
+void annexa_watch_stop(annexa_watch* watch);
+
 /* ---- Running plug-ins (docs/spawnd.md) */
 
 /* A host's connection to a running instance of a plug-in. */
@@ -94,6 +122,9 @@ annexa_plugin* annexa_plugin_connect(const char* bundle_identifier, char** error
  * receives in the notation. ANNEXA_EUNREACHABLE when the plug-in's connection ended. */
 int64_t annexa_plugin_send(annexa_plugin* plugin, const char* message, char** reply, char** error_text);
 void annexa_plugin_close(annexa_plugin* plugin);
+/* Sets the notation of the messages and replies of this connection; ANNEXA_EINVAL for an unknown
+ * notation, else 0. */
+int64_t annexa_plugin_set_notation(annexa_plugin* plugin, int notation);
 
 /* The plug-in's side. The handler receives each message from a host in the text notation and
  * returns the reply in the notation, allocated with malloc (the library frees it), or null to reply
@@ -102,12 +133,17 @@ typedef char* (*annexa_plugin_handler)(const char* message, void* context);
 /* Serves host connections until spawnd ends the instance, then returns 0; ANNEXA_EINVAL at once when
  * this process was not launched by spawnd. */
 int64_t annexa_plugin_run(annexa_plugin_handler handler, void* context);
+/* The same in either notation: the handler receives and returns text in `notation`. */
+int64_t annexa_plugin_serve(annexa_plugin_handler handler, void* context, int notation);
 /* Busy assertions: while one is held, the instance is reported busy with its reason. */
 uint64_t annexa_plugin_begin_busy(const char* reason);
 void annexa_plugin_end_busy(uint64_t assertion);
 
 /* Releases text returned by this interface. */
 void annexa_free(void* text);
+/* A copy of `text` that the library may release: what a handler written in another language
+ * returns, since the library frees the reply with free(). Null when memory runs out. */
+char* annexa_copy_text(const char* text);
 
 #ifdef __cplusplus
 }

@@ -47,30 +47,6 @@ bool xmlCarries(std::string_view s) {
     return isValidUtf8(s);
 }
 
-void appendBase64(std::string& out, const Bytes& bytes) {
-    static const char* table = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-    size_t i = 0;
-    for (; i + 2 < bytes.size(); i += 3) {
-        uint32_t n = bytes[i] << 16 | bytes[i + 1] << 8 | bytes[i + 2];
-        out += table[n >> 18];
-        out += table[n >> 12 & 63];
-        out += table[n >> 6 & 63];
-        out += table[n & 63];
-    }
-    if (i + 1 == bytes.size()) {
-        uint32_t n = bytes[i] << 16;
-        out += table[n >> 18];
-        out += table[n >> 12 & 63];
-        out += "==";
-    } else if (i + 2 == bytes.size()) {
-        uint32_t n = bytes[i] << 16 | bytes[i + 1] << 8;
-        out += table[n >> 18];
-        out += table[n >> 12 & 63];
-        out += table[n >> 6 & 63];
-        out += '=';
-    }
-}
-
 Status writeNode(std::string& out, const Value& v, int depth) {
     if (depth > kMaxDepth) return plistError(kPlistWriteInvalid, "value nested too deeply");
     std::string indent(static_cast<size_t>(depth), '\t');

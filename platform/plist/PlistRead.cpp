@@ -298,39 +298,9 @@ private:
     }
 
     static std::optional<Value> data(const std::string& body) {
-        Bytes out;
-        uint32_t acc = 0;
-        int bits = 0;
-        int pad = 0;
-        for (char c : body) {
-            int v;
-            if (c >= 'A' && c <= 'Z') {
-                v = c - 'A';
-            } else if (c >= 'a' && c <= 'z') {
-                v = c - 'a' + 26;
-            } else if (c >= '0' && c <= '9') {
-                v = c - '0' + 52;
-            } else if (c == '+') {
-                v = 62;
-            } else if (c == '/') {
-                v = 63;
-            } else if (c == '=') {
-                ++pad;
-                continue;
-            } else if (c == ' ' || c == '\t' || c == '\n' || c == '\r') {
-                continue;
-            } else {
-                return std::nullopt;
-            }
-            if (pad) return std::nullopt;  // data after padding
-            acc = acc << 6 | static_cast<uint32_t>(v);
-            bits += 6;
-            if (bits >= 8) {
-                bits -= 8;
-                out.push_back(static_cast<uint8_t>(acc >> bits & 0xff));
-            }
-        }
-        return Value::data(std::move(out));
+        auto bytes = decodeBase64(body);
+        if (!bytes) return std::nullopt;
+        return Value::data(std::move(*bytes));
     }
 };
 

@@ -326,6 +326,68 @@ bool operator==(const Value& a, const Value& b) {
     }
 }
 
+// ---- base64
+
+void appendBase64(std::string& out, const Bytes& bytes) {
+    static const char* table = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+    size_t i = 0;
+    for (; i + 2 < bytes.size(); i += 3) {
+        uint32_t n = bytes[i] << 16 | bytes[i + 1] << 8 | bytes[i + 2];
+        out += table[n >> 18];
+        out += table[n >> 12 & 63];
+        out += table[n >> 6 & 63];
+        out += table[n & 63];
+    }
+    if (i + 1 == bytes.size()) {
+        uint32_t n = bytes[i] << 16;
+        out += table[n >> 18];
+        out += table[n >> 12 & 63];
+        out += "==";
+    } else if (i + 2 == bytes.size()) {
+        uint32_t n = bytes[i] << 16 | bytes[i + 1] << 8;
+        out += table[n >> 18];
+        out += table[n >> 12 & 63];
+        out += table[n >> 6 & 63];
+        out += '=';
+    }
+}
+
+std::optional<Bytes> decodeBase64(std::string_view text) {
+    Bytes out;
+    uint32_t acc = 0;
+    int bits = 0;
+    int pad = 0;
+    for (char c : text) {
+        int v;
+        if (c >= 'A' && c <= 'Z') {
+            v = c - 'A';
+        } else if (c >= 'a' && c <= 'z') {
+            v = c - 'a' + 26;
+        } else if (c >= '0' && c <= '9') {
+            v = c - '0' + 52;
+        } else if (c == '+') {
+            v = 62;
+        } else if (c == '/') {
+            v = 63;
+        } else if (c == '=') {
+            if (++pad > 2) return std::nullopt;
+            continue;
+        } else if (c == ' ' || c == '\t' || c == '\n' || c == '\r') {
+            continue;
+        } else {
+            return std::nullopt;
+        }
+        if (pad) return std::nullopt;  // data after padding
+        acc = acc << 6 | static_cast<uint32_t>(v);
+        bits += 6;
+        if (bits >= 8) {
+            bits -= 8;
+            out.push_back(static_cast<uint8_t>(acc >> bits & 0xff));
+        }
+    }
+    return out;
+}
+
 // ---- Error
 
 std::string Error::description() const {

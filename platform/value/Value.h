@@ -181,13 +181,18 @@ public:
 
     // The text notation (docs/rpx-wire.md): round-trips through parse().
     std::string description() const;
-    // JSON, for tools that print records: a UUID, data, a date or a descriptor is its text-notation
-    // form as a string (a date without the "@"), a non-finite double is null.
+    // JSON (docs/rpx-wire.md, "JSON"): JSON's own literals where they say the same, and an object
+    // of one tagged key for the rest ({"$uuid": "..."}, {"$data": "<base64>"}, {"$date": "..."},
+    // {"$fd": N}, {"$double": "nan"}, {"$int64": "..."} and {"$uint64": "..."} beyond 2^53);
+    // round-trips through parseJson(), integers up to 2^53 reading back as signed ones.
     std::string json() const;
     // Reads one value in the text notation; nullopt on anything malformed or trailing text.
     static std::optional<Value> parse(std::string_view text);
     // The same, saying where the text went wrong: "at offset N: expected X".
     static Result<Value> parseReporting(std::string_view text);
+    // Reads one JSON text, tagged objects decoded; an error says where the text went wrong or
+    // which tagged object is malformed.
+    static Result<Value> parseJson(std::string_view text);
 
     friend bool operator==(const Value& a, const Value& b);
 
@@ -319,6 +324,11 @@ bool appendUtf8(std::string& out, uint32_t codePoint);
 // Days since 1970-01-01 of a date of the proleptic Gregorian calendar (month 1 to 12), for the
 // readers of dates in text.
 int64_t daysFromCivil(int64_t year, unsigned month, unsigned day);
+
+// Base64 (RFC 4648, with padding), as property lists and JSON carry data. The reader skips white
+// space and refuses any other character, and data after the padding.
+void appendBase64(std::string& out, const Bytes& bytes);
+std::optional<Bytes> decodeBase64(std::string_view text);
 
 // Appends `s` as a JSON string, quotes included, control characters escaped; the text notation
 // writes its strings so, and tools that print JSON use it too.

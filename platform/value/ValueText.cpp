@@ -107,41 +107,60 @@ void appendDate(std::string& out, Date date) {
     out.push_back('Z');
 }
 
-// The text notation, or JSON: the same walk, with JSON's forms for what JSON has no literal of (a
-// UUID, data, a date or a descriptor is the text notation's form as a string, "@" dropped from a
-// date; an unsigned integer has no "u"; a non-finite double is null).
+// The text notation, or JSON: the same walk. JSON has no literal for a UUID, data, a date, a
+// descriptor, a non-finite double or an integer beyond 2^53 (where JSON readers start rounding), so
+// each is an object of one tagged key, {"$uuid": "..."}; a dictionary that itself has a single key
+// starting with "$" is escaped as {"$dictionary": {...}} so that it never reads as a tag.
 enum class Notation { Text, Json };
+
+constexpr uint64_t kJsonExactIntegers = uint64_t{1} << 53;
+
+void appendTagged(std::string& out, std::string_view tag, std::string_view text) {
+    out += "{\"";
+    out += tag;
+    out += "\":";
+    appendJsonString(out, text);
+    out.push_back('}');
+}
+
+bool looksLikeTag(const Dictionary& d) { return d.size() == 1 && !d.begin()->first.empty() && d.begin()->first[0] == '$'; }
 
 void write(std::string& out, const Value& v, Notation notation) {
     using K = Value::Kind;
     const bool json = notation == Notation::Json;
-    auto asJsonString = [&](const Value& scalar) {
-        std::string text;
-        write(text, scalar, Notation::Text);
-        appendJsonString(out, text[0] == '@' ? std::string_view(text).substr(1) : std::string_view(text));
-    };
     char buf[48];
     switch (v.kind()) {
         case K::Null: out += "null"; break;
         case K::Bool: out += *v.boolValue() ? "true" : "false"; break;
-        case K::Int64:
-            std::snprintf(buf, sizeof buf, "%" PRId64, *v.int64Value());
+        case K::Int64: {
+            int64_t n = *v.int64Value();
+            std::snprintf(buf, sizeof buf, "%" PRId64, n);
+            uint64_t magnitude = n < 0 ? 0 - static_cast<uint64_t>(n) : static_cast<uint64_t>(n);
+            if (json && magnitude > kJsonExactIntegers) return appendTagged(out, "$int64", buf);
             out += buf;
             break;
-        case K::UInt64:
-            std::snprintf(buf, sizeof buf, json ? "%" PRIu64 : "%" PRIu64 "u", *v.uint64Value());
+        }
+        case K::UInt64: {
+            uint64_t n = *v.uint64Value();
+            std::snprintf(buf, sizeof buf, "%" PRIu64, n);
+            if (json && n > kJsonExactIntegers) return appendTagged(out, "$uint64", buf);
             out += buf;
+            if (!json) out.push_back('u');
             break;
-        case K::Double:
-            if (json && !std::isfinite(*v.doubleValue())) {
-                out += "null";
-            } else {
-                appendDouble(out, *v.doubleValue());
-            }
+        }
+        case K::Double: {
+            double d = *v.doubleValue();
+            if (json && !std::isfinite(d)) return appendTagged(out, "$double", std::isnan(d) ? "nan" : d > 0 ? "inf" : "-inf");
+            appendDouble(out, d);
             break;
+        }
         case K::String: appendJsonString(out, *v.asString()); break;
         case K::Data: {
-            if (json) return asJsonString(v);
+            if (json) {
+                std::string text;
+                appendBase64(text, *v.asData());
+                return appendTagged(out, "$data", text);
+            }
             static const char* hex = "0123456789abcdef";
             out.push_back('<');
             for (uint8_t b : *v.asData()) {
@@ -151,17 +170,23 @@ void write(std::string& out, const Value& v, Notation notation) {
             out.push_back('>');
             break;
         }
-        case K::Date:
-            if (json) return asJsonString(v);
-            appendDate(out, *v.asDate());
+        case K::Date: {
+            std::string text;
+            appendDate(text, *v.asDate());
+            if (json) return appendTagged(out, "$date", std::string_view(text).substr(1));
+            out += text;
             break;
+        }
         case K::UUID:
-            if (json) return appendJsonString(out, v.asUUID()->string());
+            if (json) return appendTagged(out, "$uuid", v.asUUID()->string());
             out += "uuid(" + v.asUUID()->string() + ")";
             break;
         case K::Fd:
-            if (json) return asJsonString(v);
-            out += "fd(" + std::to_string((*v.asFd())->get()) + ")";
+            if (json) {
+                out += "{\"$fd\":" + std::to_string((*v.asFd())->get()) + "}";
+            } else {
+                out += "fd(" + std::to_string((*v.asFd())->get()) + ")";
+            }
             break;
         case K::Array: {
             out.push_back('[');
@@ -175,9 +200,12 @@ void write(std::string& out, const Value& v, Notation notation) {
             break;
         }
         case K::Dictionary: {
+            const Dictionary& d = *v.asDictionary();
+            const bool escaped = json && looksLikeTag(d);
+            if (escaped) out += "{\"$dictionary\":";
             out.push_back('{');
             bool first = true;
-            for (const auto& [key, e] : *v.asDictionary()) {
+            for (const auto& [key, e] : d) {
                 if (!first) out += json ? "," : ", ";
                 first = false;
                 appendJsonString(out, key);
@@ -185,6 +213,7 @@ void write(std::string& out, const Value& v, Notation notation) {
                 write(out, e, notation);
             }
             out.push_back('}');
+            if (escaped) out.push_back('}');
             break;
         }
     }
@@ -238,7 +267,8 @@ namespace {
 
 class Parser {
 public:
-    explicit Parser(std::string_view text) : s_(text) {}
+    // In JSON mode only JSON's own tokens are read; the tagged objects are decoded afterwards.
+    Parser(std::string_view text, bool json) : s_(text), json_(json) {}
 
     std::optional<Value> parseAll() {
         auto v = parseValue(0);
@@ -258,6 +288,7 @@ private:
     static constexpr int kMaxDepth = 256;
 
     std::string_view s_;
+    const bool json_;
     size_t pos_ = 0;
     size_t errorAt_ = 0;
     const char* expected_ = nullptr;
@@ -305,13 +336,15 @@ private:
                 if (!s) return fail("a string");
                 return Value(std::move(*s));
             }
-            case '<': return parseData();
-            case '@': return parseDate();
             default: break;
         }
         if (eatWord("true")) return Value(true);
         if (eatWord("false")) return Value(false);
         if (eatWord("null")) return Value();
+        if (c == '-' || (c >= '0' && c <= '9')) return parseNumber();
+        if (json_) return fail("a JSON value");
+        if (c == '<') return parseData();
+        if (c == '@') return parseDate();
         if (eatWord("nan")) return Value(std::nan(""));
         if (eatWord("uuid(")) {
             auto u = UUID::parse(s_.substr(pos_, 36));
@@ -321,7 +354,6 @@ private:
             return Value(*u);
         }
         if (eatWord("fd(")) return parseFd();
-        if (c == '-' || (c >= '0' && c <= '9')) return parseNumber();
         return fail("a value");
     }
 
@@ -523,6 +555,15 @@ private:
         std::string text(s_.substr(start, pos_ - start));
         if (isDouble) return Value(std::strtod(text.c_str(), nullptr));
         errno = 0;
+        if (json_) {
+            // JSON has one kind of integer: signed where it fits, unsigned above that.
+            long long i = std::strtoll(text.c_str(), nullptr, 10);
+            if (errno != ERANGE) return Value(static_cast<int64_t>(i));
+            errno = 0;
+            unsigned long long u = text[0] == '-' ? 0 : std::strtoull(text.c_str(), nullptr, 10);
+            if (text[0] == '-' || errno == ERANGE) return fail("an integer within 64 bits");
+            return Value(static_cast<uint64_t>(u));
+        }
         if (pos_ < s_.size() && s_[pos_] == 'u') {
             ++pos_;
             if (text[0] == '-') return fail("an unsigned integer without a sign");
@@ -550,14 +591,109 @@ std::string Value::json() const {
     return out;
 }
 
-std::optional<Value> Value::parse(std::string_view text) { return Parser(text).parseAll(); }
+std::optional<Value> Value::parse(std::string_view text) { return Parser(text, false).parseAll(); }
+
+namespace {
+
+Error parseError(const Parser& parser, const char* fallback) {
+    std::string at = "at offset " + std::to_string(parser.errorOffset());
+    return Error{"com.corvane.value", 1, at + ": expected " + (parser.expected() ? parser.expected() : fallback)};
+}
+
+Error tagError(std::string_view tag, std::string_view expected) {
+    return Error{"com.corvane.value", 1, "in a \"" + std::string(tag) + "\" object: expected " + std::string(expected)};
+}
+
+// The value one tagged object stands for.
+Result<Value> decodeTag(const std::string& tag, const Value& body) {
+    const std::string* text = body.asString();
+    if (tag == "$fd") {
+        std::optional<int64_t> n = body.kind() == Value::Kind::Int64 ? body.int64Value() : std::nullopt;
+        if (!n || *n < 0 || *n > INT32_MAX) return tagError(tag, "a descriptor number");
+        // Like the text notation's fd(N): a duplicate of this process's descriptor N.
+        int fd = fcntl(static_cast<int>(*n), F_DUPFD_CLOEXEC, 0);
+        if (fd < 0) return tagError(tag, "a descriptor open in this process");
+        return Value(std::make_shared<FileDescriptor>(fd));
+    }
+    if (!text) return tagError(tag, "a string");
+    if (tag == "$uuid") {
+        auto uuid = UUID::parse(*text);
+        if (!uuid) return tagError(tag, "a UUID of 36 characters (8-4-4-4-12 hexadecimal digits)");
+        return Value(*uuid);
+    }
+    if (tag == "$data") {
+        auto bytes = decodeBase64(*text);
+        if (!bytes) return tagError(tag, "base64");
+        return Value::data(std::move(*bytes));
+    }
+    if (tag == "$date") {
+        auto date = Value::parse("@" + *text);
+        if (!date || date->kind() != Value::Kind::Date) return tagError(tag, "a date written YYYY-MM-DDThh:mm:ss[.ffffff]Z");
+        return std::move(*date);
+    }
+    if (tag == "$double") {
+        if (*text == "nan") return Value(std::nan(""));
+        if (*text == "inf") return Value(HUGE_VAL);
+        if (*text == "-inf") return Value(-HUGE_VAL);
+        return tagError(tag, "\"nan\", \"inf\" or \"-inf\"");
+    }
+    if (tag == "$int64" || tag == "$uint64") {
+        const bool isSigned = tag == "$int64";
+        auto n = Value::parse(*text + (isSigned ? "" : "u"));
+        bool digitsOnly = !text->empty() && text->find_first_not_of("-0123456789") == std::string::npos;
+        if (!n || !digitsOnly || n->kind() != (isSigned ? Value::Kind::Int64 : Value::Kind::UInt64))
+            return tagError(tag, isSigned ? "a signed 64-bit integer in a string" : "an unsigned 64-bit integer in a string");
+        return std::move(*n);
+    }
+    return Error{"com.corvane.value", 1,
+                 "unknown tag \"" + tag + "\" (a dictionary of one key starting with \"$\" is written {\"$dictionary\": {...}})"};
+}
+
+Result<Value> decodeJson(Value&& v);
+
+Result<Value> decodeEntries(Dictionary&& d) {
+    for (auto& [key, e] : d) {
+        auto decoded = decodeJson(std::move(e));
+        if (!decoded) return decoded.error();
+        e = std::move(*decoded);
+    }
+    return Value(std::move(d));
+}
+
+// Replaces the tagged objects of parsed JSON by the values they stand for.
+Result<Value> decodeJson(Value&& v) {
+    if (const Array* a = v.asArray()) {
+        Array out = *a;
+        for (Value& e : out) {
+            auto decoded = decodeJson(std::move(e));
+            if (!decoded) return decoded.error();
+            e = std::move(*decoded);
+        }
+        return Value(std::move(out));
+    }
+    const Dictionary* d = v.asDictionary();
+    if (!d) return std::move(v);
+    if (!looksLikeTag(*d)) return decodeEntries(Dictionary(*d));
+    const auto& [tag, body] = *d->begin();
+    if (tag != "$dictionary") return decodeTag(tag, body);
+    const Dictionary* inner = body.asDictionary();
+    if (!inner) return tagError(tag, "an object");
+    return decodeEntries(Dictionary(*inner));
+}
+
+}  // namespace
 
 Result<Value> Value::parseReporting(std::string_view text) {
-    Parser parser(text);
+    Parser parser(text, false);
     if (auto v = parser.parseAll()) return std::move(*v);
-    std::string at = "at offset " + std::to_string(parser.errorOffset());
-    return Error{"com.corvane.value", 1,
-                 at + ": expected " + (parser.expected() ? parser.expected() : "a value in the text notation")};
+    return parseError(parser, "a value in the text notation");
+}
+
+Result<Value> Value::parseJson(std::string_view text) {
+    Parser parser(text, true);
+    auto v = parser.parseAll();
+    if (!v) return parseError(parser, "JSON");
+    return decodeJson(std::move(*v));
 }
 
 bool appendUtf8(std::string& out, uint32_t cp) {

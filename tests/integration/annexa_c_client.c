@@ -87,6 +87,33 @@ int main(int argc, char** argv) {
     snprintf(table, sizeof table, "{\"%s\": {\"from\": \"C\"}}", argv[2]);
     code = annexa_bulk_annotate(client, table, &text);
     line("bulk-annotate", code, text);
+
+    /* JSON: the same calls read and answer JSON, and a watch sees an annotation as it happens. */
+    printf("notation 7: %" PRId64 "\n", annexa_client_set_notation(client, 7));
+    annexa_client_set_notation(client, ANNEXA_NOTATION_JSON);
+    code = annexa_send(client, "{\"request\": \"bulk\", \"version\": 3}", &text, &error);
+    line("json send", code, text);
+    code = annexa_match(client, "{\"KSExtensionIdentifier\": \"com.example.One\"}", 0, &found, &text);
+    printf("json match: %" PRId64 " %s\n", code, found && strstr(found, "\"hubProtocolVersion\":2,") ? "plain numbers" : found);
+    annexa_free(found);
+    annexa_free(text);
+    annexa_watch* watch = annexa_watch_start(client, &text);
+    printf("watch: %s\n", watch && annexa_watch_fd(watch) >= 0 ? "started" : text);
+    annexa_free(text);
+    char* event = NULL;
+    code = annexa_watch_next(watch, 0, &event, &text);
+    line("watch nothing yet", code, text);
+    code = annexa_annotate(client, uuids, 1, "{\"election\": 0}", &text);
+    line("json annotate", code, text);
+    code = annexa_watch_next(watch, 5000, &event, &text);
+    printf("watch event: %" PRId64 " %s\n", code, event && strstr(event, "\"event\":\"annotation\"") ? "annotation" : event);
+    annexa_free(event);
+    annexa_free(text);
+    annexa_watch_stop(watch);
+    code = annexa_annotate(client, uuids, 1, "{\"election\": 1u}", &text);
+    line("json annotate in the text notation", code, text);
+    annexa_client_set_notation(client, ANNEXA_NOTATION_TEXT);
+
     code = annexa_remove(client, paths, 1, &text);
     line("remove", code, text);
     annexa_client_destroy(client);

@@ -340,14 +340,14 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
     const std::string nobody = rpx::endpointPath("com.nobody.here");
     EXPECT_EQ(host.out,
               "send: 0 {}\n"
-              "send garbage: -1 not one value in the text notation: at offset 1: expected a key in double quotes\n"
+              "send garbage: -1 the message is not one value in the text notation: at offset 1: expected a key in double quotes\n"
               "add: 0 -\n"
               "add relative: 9 absolute path required: relative/App.app\n"
               "annotate: 0 -\n"
               "annotate string election: 4 invalid request format (annotation election)\n"
               "annotate bad uuid: -1 not a UUID: not-a-uuid\n"
               "match: 0 One\n"
-              "match garbage: -1 rules are not one value in the text notation: at offset 1: expected a key in double quotes\n"
+              "match garbage: -1 the rules are not one value in the text notation: at offset 1: expected a key in double quotes\n"
               "ready: 4 unable\n"
               "access: 0 two tokens\n"
               "lock: 0 token\n"
@@ -356,6 +356,14 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
               "lock bad flags: 4 invalid request format (unsupported hold flags)\n"
               "receipt: 2 caller is not a known plug-in\n"
               "bulk-annotate: 0 -\n"
+              "notation 7: -1\n"
+              "json send: 0 {}\n"
+              "json match: 0 plain numbers\n"
+              "watch: started\n"
+              "watch nothing yet: -3 no event came in time\n"
+              "json annotate: 0 -\n"
+              "watch event: 0 annotation\n"
+              "json annotate in the text notation: -1 the annotations are not one JSON value: at offset 14: expected \",\" or \"}\"\n"
               "remove: 11 caller lacks entitlement for this operation\n"
               "unreachable: -2 cannot reach the daemon at com.nobody.here: nothing answers on " + nobody + "\n"
               "send unreachable: -2 cannot reach the daemon at com.nobody.here: nothing answers on " + nobody + "\n");
@@ -363,7 +371,7 @@ TEST(Axd, AHostWrittenInCDrivesTheDaemon) {
     EXPECT_EQ(host.err, "");
     std::string file = layout::userDataDir() + "/containers/10/com.corvane.axd/com.corvane.annexa/Annotations";
     EXPECT_EQ((*plist::readFile(file))["data"]["com.example.One"],
-              dict({{"election", 1}, {"extension", dict({{"from", "C"}})}}));
+              dict({{"election", 0}, {"extension", dict({{"from", "C"}})}}));
 }
 
 // A long-running host keeps its client: the request after the daemon went away fails as
