@@ -8,6 +8,8 @@
 #   - two users, each with the two daemons started as a user manager would (socket activation with
 #     the units' environment), register applications of their own and see the system's, not each
 #     other's; a C host and a C plug-in build against the installed library;
+#   - the Python package's tests pass against the installed tree, and docs/first-plugin.md, run
+#     literally as alice, goes from nothing to a C and a Python plug-in answering their hosts;
 #   - purging leaves no file of ours (a listing of /etc, /usr and /var/lib before and after).
 #   tests/package/debian-package-test.sh [SOURCE_DIR]
 # AX_PACKAGE_KEEP=DIR keeps the built packages there; AX_PACKAGE_PREBUILT=DIR uses those instead of
@@ -17,8 +19,9 @@ src=$(cd "${1:-$(dirname "$0")/../..}" && pwd)
 work=$(mktemp -d /tmp/annexa-package.XXXXXX)
 chmod 0755 "$work"
 users=(axpkg-alice axpkg-bob)
-ours=(annexa-test-greeter libannexa-dev libannexa1 annexa)
+ours=(annexa-test-greeter python3-annexa libannexa-dev libannexa1 annexa)
 pids=()
+guide_key=/home/axpkg-alice/.config/corvane/developer.key.pub
 export DEBIAN_FRONTEND=noninteractive
 # The test's users go with everything they had, so that a second run starts as fresh as the first.
 remove_users() {
@@ -32,7 +35,9 @@ remove_users() {
 cleanup() {
     for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null || true; done
     remove_users
-    [ -f "$work/developer.key.pub" ] && axsign untrust "$work/developer.key.pub" >/dev/null 2>&1 || true
+    for key in "$work/developer.key.pub" "$guide_key"; do
+        [ -f "$key" ] && axsign untrust "$key" >/dev/null 2>&1 || true
+    done
     dpkg --purge "${ours[@]}" >/dev/null 2>&1 || true
     rm -rf "$work"
 }
@@ -57,7 +62,7 @@ else
     [ -z "${AX_PACKAGE_KEEP:-}" ] || cp "$work"/*.deb "$AX_PACKAGE_KEEP"/
 fi
 debs=()
-for package in annexa libannexa1 libannexa-dev; do
+for package in annexa libannexa1 libannexa-dev python3-annexa; do
     deb=$(ls "$work"/${package}_*.deb 2>/dev/null | head -n 1)
     [ -n "$deb" ] || fail "no package $package was built"
     debs+=("$deb")
@@ -251,6 +256,17 @@ C
 cc "$work/host.c" $(pkg-config --cflags --libs annexa) -o "$work/host" || fail "a host does not build against the installed files"
 as axpkg-alice "$work/host" || fail "the C host's match failed"
 
+echo "== the Python package's tests, against the installed package and library"
+[ "$(/usr/bin/python3 -c 'import annexa; print(annexa.__file__)')" = /usr/lib/python3/dist-packages/annexa/__init__.py ] ||
+    fail "python3 does not import the installed annexa"
+(cd "$src/python/tests" && env -u ANNEXA_BIN -u ANNEXA_LIBRARY PYTHONDONTWRITEBYTECODE=1 \
+    /usr/bin/python3 -m pytest -q -p no:cacheprovider .) || fail "the Python package's tests failed"
+
+echo "== docs/first-plugin.md, followed literally by alice"
+/usr/bin/python3 "$src/tests/package/run-guide.py" --user axpkg-alice "$src/docs/first-plugin.md" >"$work/guide.log" 2>&1 ||
+    { cat "$work/guide.log"; logs; fail "the guide does not work as written"; }
+tail -n 1 "$work/guide.log"
+
 echo "== purging leaves nothing of ours"
 for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null || true; done
 for user in "${users[@]}"; do pkill -u "$user" 2>/dev/null || true; done
@@ -260,6 +276,7 @@ for user in "${users[@]}"; do
     for _ in $(seq 100); do pgrep -u "$user" >/dev/null || break; sleep 0.05; done
 done
 axsign untrust "$work/developer.key.pub" >/dev/null
+axsign untrust "$guide_key" >/dev/null
 dpkg --purge "${ours[@]}" >"$work/purge.log" 2>&1 || { cat "$work/purge.log"; fail "dpkg --purge failed"; }
 listing >"$work/after"
 if ! diff -u "$work/before" "$work/after" >"$work/left"; then
