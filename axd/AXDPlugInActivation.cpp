@@ -20,8 +20,6 @@ namespace log = corvane::log;
 
 namespace {
 
-constexpr const char* kKeyboardExtensionPoint = "com.corvane.keyboard-service";
-
 std::string uuidText(const AXDPlugIn& plugIn) { return plugIn.uuid() ? plugIn.uuid()->string() : std::string(); }
 std::string identifierText(const AXDPlugIn& plugIn) { return plugIn.identifier().value_or(""); }
 // A version is a string in the bundle; the log shows it as written, not quoted.
@@ -34,22 +32,11 @@ std::string versionText(const AXDPlugIn& plugIn) {
 }  // namespace
 
 std::string AXDPlugIn::sandboxProfile() const {
-    Value point = pluginKey(keys::kPointIdentifier);
-    if (point == Value(kKeyboardExtensionPoint)) {
-        if (attribute("RequestsOpenAccess").isTrue() &&
-            allowedPCXServices().count(corvane::pcx::kKeyboardNetworkService)) {
-            return "plugin";
-        }
-        return "keyboard";
-    }
-    if (point == Value("com.corvane.netshield.filter-data")) return "network-filter";
-    Value stored = plugInDictionary()[keys::kPointIdentifier];
-    if (stored == Value("com.corvane.glancer.extension.preview")) return "glancerd";
-    if (stored == Value("com.corvane.app.non-ui-extension") ||
-        stored == Value("com.corvane.app.non-ui-extension.multiple-instances")) {
-        return "sandpit-devtools";
-    }
-    return "plugin";
+    const Value pointValue = pluginKey(keys::kPointIdentifier);
+    const std::string* point = pointValue.asString();
+    bool networkGranted = attribute("RequestsOpenAccess").isTrue() &&
+                          allowedPCXServices().count(corvane::pcx::kKeyboardNetworkService);
+    return corvane::sdk::sandboxProfileFor(point ? *point : std::string(), networkGranted).profile;
 }
 
 Status AXDPlugIn::enableForClient(const AXDRpxClient& client) const {

@@ -20,6 +20,7 @@
 #include "platform/log/Log.h"
 #include "platform/plist/Plist.h"
 #include "platform/vantry/Vantry.h"
+#include "tools/AxctlBundle.h"
 #include "tools/cli/Cli.h"
 
 using annexa::AXDaemonClient;
@@ -88,6 +89,11 @@ const char* kHelp =
     "                                               --keep stays connected until standard input ends\n"
     "  watch [--json]                               print plug-ins installed and uninstalled,\n"
     "                                               annotation changes and holds as they happen\n"
+    "  bundle new --plugin|--app --identifier ID [--name NAME] [--extension-point POINT]\n"
+    "             [--language c|python] DIR         write a bundle skeleton in DIR\n"
+    "  bundle check PATH                            what the platform would say about a bundle:\n"
+    "                                               Info.plist, signature, extension point,\n"
+    "                                               sandbox profile, whether hosts find it\n"
     "The service name defaults to com.corvane.annexa.axd. COMMAND --help shows one command's usage.\n"
     "Exit status: 0 success, 1 the daemon refused (its error text on standard error), 64 usage,\n"
     "65 unreadable input, 69 daemon not reachable, 77 refused for lack of an entitlement.\n"
@@ -444,6 +450,7 @@ int main(int argc, char** argv) {
         {"unlock", kUnlock, with(unlock)},
         {"run", kRun, with(run)},
         {"watch", kWatch, with(watch)},
+        {"bundle", axctl::kBundle, with(axctl::bundle)},
     };
     return cli::runCommand(kTool, kHelp, commands, std::move(args));
 }

@@ -105,4 +105,18 @@ Resolved resolve(const Value& info) {
     return r;
 }
 
+SandboxChoice sandboxProfileFor(std::string_view point, bool keyboardNetworkGranted) {
+    if (point == "com.corvane.keyboard-service") {
+        if (keyboardNetworkGranted)
+            return {"plugin", "a keyboard whose user granted its application network access (pcx)"};
+        return {"keyboard", "a keyboard: what the user types stays on the machine unless the user grants its "
+                            "application network access (pcx), which moves it to plugin"};
+    }
+    if (point == "com.corvane.netshield.filter-data") return {"network-filter", "a network filter serves the network"};
+    if (point == "com.corvane.glancer.extension.preview") return {"glancerd", "a preview needs to reach nothing"};
+    if (point == "com.corvane.app.non-ui-extension" || point == "com.corvane.app.non-ui-extension.multiple-instances")
+        return {"sandpit-devtools", "a non-UI extension may serve the network"};
+    return {"plugin", "the profile of every extension point the platform does not name"};
+}
+
 }  // namespace corvane::sdk

@@ -55,4 +55,13 @@ struct Resolved {
 };
 Resolved resolve(const Value& info);
 
+// The sandbox profile spawnd runs a plug-in of this extension point under (docs/sandbox.md), and
+// why, in words for the plug-in's developer. A keyboard's plug-in gets the network only when it
+// asks for open access and the user granted its application the keyboard-network service.
+struct SandboxChoice {
+    std::string profile;
+    std::string why;
+};
+SandboxChoice sandboxProfileFor(std::string_view extensionPoint, bool keyboardNetworkGranted);
+
 }  // namespace corvane::sdk

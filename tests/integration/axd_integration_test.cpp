@@ -240,6 +240,74 @@ TEST(Axd, ARequestWritesTheAnnotationFileOnce) {
     ::close(in);
 }
 
+// A skeleton from `axctl bundle new` registers as it is, and `bundle check` says what each part of
+// the platform would make of a bundle, before and after registration.
+TEST(Axd, BundleNewWritesSkeletonsThatCheckSaysHowThePlatformSeesThem) {
+    Daemon d;
+    const std::string dir = d.root.path();
+    struct New {
+        std::vector<std::string> args;
+        const char* bundle;
+        const char* expected;  // in check's output
+    };
+    const New skeletons[] = {
+        {{"--plugin", "--identifier", "com.example.tools.echo"}, "echo.appex", "sandbox          plugin: the profile of every"},
+        {{"--plugin", "--identifier", "com.example.keys", "--extension-point", "com.corvane.keyboard-service", "--name", "Keys"},
+         "Keys.appex", "sandbox          keyboard: a keyboard"},
+        {{"--plugin", "--language", "c", "--identifier", "com.example.cecho"}, "cecho.appex", "extension point  com.example.cecho"},
+        {{"--app", "--identifier", "com.example.host"}, "host.app", "(an application)"},
+    };
+    for (const auto& c : skeletons) {
+        std::vector<std::string> args = {"bundle", "new"};
+        args.insert(args.end(), c.args.begin(), c.args.end());
+        args.push_back(dir);
+        auto made = d.axctl(args);
+        ASSERT_EQ(made.status, 0) << made.err;
+        auto check = d.axctl({"bundle", "check", dir + "/" + c.bundle});
+        EXPECT_EQ(check.status, 0) << check.out << check.err;
+        EXPECT_NE(check.out.find("registration     the registry accepts it"), std::string::npos) << check.out;
+        EXPECT_NE(check.out.find(c.expected), std::string::npos) << check.out;
+    }
+    EXPECT_TRUE(fs::exists(dir + "/cecho.c"));
+    EXPECT_EQ(fs::status(dir + "/echo.appex/echo").permissions() & fs::perms::owner_exec, fs::perms::owner_exec);
+    EXPECT_EQ(d.axctl({"bundle", "new", "--plugin", "--identifier", "com.example.tools.echo", dir}).status, 73);
+
+    // A plug-in inside its application: found once the application is registered. One standing
+    // alone is registered but hidden from hosts.
+    std::string echo = dir + "/echo.appex";
+    ASSERT_EQ(d.axctl({"bundle", "new", "--plugin", "--identifier", "com.example.host.inner", dir + "/host.app/PlugIns"}).status, 0);
+    std::string inner = dir + "/host.app/PlugIns/inner.appex";
+    EXPECT_NE(d.axctl({"bundle", "check", inner}).out.find("not registered: `axctl add " + inner), std::string::npos);
+    ASSERT_EQ(d.axctl({"add", dir + "/host.app"}).status, 0);
+    ASSERT_EQ(d.axctl({"add", echo}).status, 0);
+    auto registered = d.axctl({"bundle", "check", inner});
+    EXPECT_NE(registered.out.find("registered; a host matching -r KSExtensionIdentifier=com.example.host.inner: returned"),
+              std::string::npos)
+        << registered.out;
+    EXPECT_NE(d.axctl({"bundle", "check", echo}).out.find("registered, but hidden from this client"), std::string::npos);
+
+    struct Bad {
+        std::vector<std::string> args;
+        int status;
+        const char* message;
+    };
+    axtest::writeFile(dir + "/host.app/Info.plist", "<plist");
+    const Bad bad[] = {
+        {{"bundle", "check", dir + "/host.app"}, 65, "malformed Info.plist"},
+        {{"bundle", "check", dir + "/none.appex"}, 65, "Info.plist"},
+        {{"bundle", "new", "--identifier", "x", dir}, 64, "say --plugin or --app"},
+        {{"bundle", "new", "--plugin", dir}, 64, "needs --identifier"},
+        {{"bundle", "new", "--plugin", "--identifier", "a/b", dir}, 64, "reverse-DNS"},
+        {{"bundle", "new", "--plugin", "--identifier", "x", "--language", "rust", dir}, 64, "c or python"},
+        {{"bundle", "rename", dir}, 64, "bundle new or bundle check"},
+    };
+    for (const auto& b : bad) {
+        auto r = d.axctl(b.args);
+        EXPECT_EQ(r.status, b.status) << b.args[2] << r.out << r.err;
+        EXPECT_NE((r.out + r.err).find(b.message), std::string::npos) << r.out << r.err;
+    }
+}
+
 TEST(Axd, RegistrationAndAnnotationsThroughTheTools) {
     Daemon d;
     // A bundle the registry cannot read: the reply's text is fixed, the reason comes beside it.
