@@ -8,7 +8,7 @@ import os
 from typing import Any, Optional, Sequence
 
 from . import _json
-from ._errors import Error, error_for
+from ._errors import error_for
 
 NOTATION_JSON = 1
 TIMED_OUT = -3
@@ -102,4 +102,4 @@ def encode(value: Any) -> bytes:
     return _json.dumps(value).encode("utf-8")
 
 
-__all__ = ["lib", "call", "check", "texts", "encode", "take_text", "HANDLER", "NOTATION_JSON", "TIMED_OUT", "Error"]
+__all__ = ["lib", "call", "check", "texts", "encode", "take_text", "HANDLER", "NOTATION_JSON", "TIMED_OUT"]
