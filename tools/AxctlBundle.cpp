@@ -83,8 +83,13 @@ int bundleNew(const cli::Parsed& p) {
     std::string name = p.value("--name").value_or(lastPart(identifier));
     std::string executable = lastPart(identifier);
     fs::path bundle = fs::path(p.operands[1]) / (name + (plugIn ? ".appex" : ".app"));
+    // A C plug-in's source goes beside the bundle; neither replaces anything of the user's.
+    std::string source = plugIn && language == "c" ? (fs::path(p.operands[1]) / (executable + ".c")).string() : "";
     std::error_code ec;
-    if (fs::exists(bundle, ec)) return cli::fail(kTool, bundle.string() + " exists already", cli::kCannotCreate);
+    for (const std::string& made : {bundle.string(), source}) {
+        if (!made.empty() && fs::symlink_status(made, ec).type() != fs::file_type::not_found)
+            return cli::fail(kTool, made + " exists already", cli::kCannotCreate);
+    }
     if (!fs::create_directories(bundle, ec)) return cli::fail(kTool, "cannot make " + bundle.string() + ": " + ec.message(), cli::kCannotCreate);
 
     corvane::Dictionary info{{"KFBundleIdentifier", Value(identifier)},
@@ -92,7 +97,6 @@ int bundleNew(const cli::Parsed& p) {
                              {"KFBundleShortVersionString", Value("1.0")},
                              {"KFBundleVersion", Value("1")},
                              {"KFBundlePackageType", Value(plugIn ? "RPX!" : "APP!")}};
-    std::string source;
     if (plugIn) {
         std::string point = p.value("--extension-point").value_or("com.example." + executable);
         info["KSExtension"] = corvane::dict({{"KSExtensionPointIdentifier", Value(point)},
@@ -104,7 +108,6 @@ int bundleNew(const cli::Parsed& p) {
     if (plugIn && language == "python") {
         written = written && writeText(bundle / executable, kPythonPlugIn, 0755);
     } else if (plugIn) {
-        source = (fs::path(p.operands[1]) / (executable + ".c")).string();
         written = written && writeText(source, kCPlugIn, 0644);
     } else {
         written = written && writeText(bundle / executable, kApplication, 0755);

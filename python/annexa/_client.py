@@ -7,7 +7,7 @@ import dataclasses
 import enum
 import uuid as uuidlib
 from types import TracebackType
-from typing import Any, Iterable, Iterator, Optional, Union
+from typing import Any, Iterable, Iterator, Optional, TypeVar, Union
 
 from . import _json, _library
 from ._errors import ErrorCode, Unreachable
@@ -64,6 +64,7 @@ class PlugIn:
 
 
 PlugInRef = Union[PlugIn, uuidlib.UUID, str]
+_Self = TypeVar("_Self", bound="_Owned")
 
 
 def _uuid_texts(plugins: Iterable[PlugInRef]) -> Any:
@@ -73,11 +74,34 @@ def _uuid_texts(plugins: Iterable[PlugInRef]) -> Any:
     return texts(items), len(items)
 
 
-class Connection:
+class _Owned:
+    """Owns one handle of the library: released by close(), at the end of a with block, or when
+    the object goes."""
+
+    _handle: Optional[int] = None
+
+    def _release(self, handle: int) -> None:
+        raise NotImplementedError
+
+    def close(self) -> None:
+        if self._handle is not None:
+            handle, self._handle = self._handle, None
+            self._release(handle)
+
+    def __enter__(self: _Self) -> _Self:
+        return self
+
+    def __exit__(self, kind: Optional[type[BaseException]], value: Optional[BaseException], tb: Optional[TracebackType]) -> None:
+        self.close()
+
+    def __del__(self) -> None:
+        self.close()
+
+
+class Connection(_Owned):
     """A host's connection to a running plug-in: send() a dictionary, get its reply."""
 
     def __init__(self, bundle_identifier: str) -> None:
-        self._handle: Optional[int] = None
         error = ctypes.c_void_p()
         handle = lib.annexa_plugin_connect(bundle_identifier.encode("utf-8"), ctypes.byref(error))
         if not handle:
@@ -91,19 +115,8 @@ class Connection:
         (reply,) = call(lib.annexa_plugin_send, self._handle, encode(message), outputs=1)
         return reply
 
-    def close(self) -> None:
-        if self._handle is not None:
-            lib.annexa_plugin_close(self._handle)
-            self._handle = None
-
-    def __enter__(self) -> "Connection":
-        return self
-
-    def __exit__(self, kind: Optional[type[BaseException]], value: Optional[BaseException], tb: Optional[TracebackType]) -> None:
-        self.close()
-
-    def __del__(self) -> None:
-        self.close()
+    def _release(self, handle: int) -> None:
+        lib.annexa_plugin_close(handle)
 
 
 class Hold:
@@ -126,12 +139,11 @@ class Hold:
         self.release()
 
 
-class Watch:
+class Watch(_Owned):
     """The registry's events as they happen: installs, uninstalls, annotations and holds. Iterate
     over it, or call next(timeout) and poll fileno() in an event loop of your own."""
 
     def __init__(self, client_handle: int) -> None:
-        self._handle: Optional[int] = None
         error = ctypes.c_void_p()
         handle = lib.annexa_watch_start(client_handle, ctypes.byref(error))
         if not handle:
@@ -164,27 +176,15 @@ class Watch:
             if event is not None:
                 yield event
 
-    def close(self) -> None:
-        if self._handle is not None:
-            lib.annexa_watch_stop(self._handle)
-            self._handle = None
-
-    def __enter__(self) -> "Watch":
-        return self
-
-    def __exit__(self, kind: Optional[type[BaseException]], value: Optional[BaseException], tb: Optional[TracebackType]) -> None:
-        self.close()
-
-    def __del__(self) -> None:
-        self.close()
+    def _release(self, handle: int) -> None:
+        lib.annexa_watch_stop(handle)
 
 
-class Client:
+class Client(_Owned):
     """A connection to axd. Every call waits for the daemon's reply and raises annexa.Error (or a
     subclass) when it reports one."""
 
     def __init__(self, service_name: Optional[str] = None) -> None:
-        self._handle: Optional[int] = None
         handle = lib.annexa_client_create(service_name.encode("utf-8") if service_name else None)
         if not handle:
             raise MemoryError("annexa_client_create")
@@ -256,16 +256,5 @@ class Client:
     def watch(self) -> Watch:
         return Watch(self._h)
 
-    def close(self) -> None:
-        if self._handle is not None:
-            lib.annexa_client_destroy(self._handle)
-            self._handle = None
-
-    def __enter__(self) -> "Client":
-        return self
-
-    def __exit__(self, kind: Optional[type[BaseException]], value: Optional[BaseException], tb: Optional[TracebackType]) -> None:
-        self.close()
-
-    def __del__(self) -> None:
-        self.close()
+    def _release(self, handle: int) -> None:
+        lib.annexa_client_destroy(handle)

@@ -271,6 +271,11 @@ TEST(Axd, BundleNewWritesSkeletonsThatCheckSaysHowThePlatformSeesThem) {
     EXPECT_TRUE(fs::exists(dir + "/cecho.c"));
     EXPECT_EQ(fs::status(dir + "/echo.appex/echo").permissions() & fs::perms::owner_exec, fs::perms::owner_exec);
     EXPECT_EQ(d.axctl({"bundle", "new", "--plugin", "--identifier", "com.example.tools.echo", dir}).status, 73);
+    // The C source beside a bundle is the user's once written: a second skeleton does not replace it.
+    EXPECT_EQ(d.axctl({"bundle", "new", "--plugin", "--language", "c", "--name", "Other", "--identifier", "com.example.cecho", dir})
+                  .status,
+              73);
+    EXPECT_FALSE(fs::exists(dir + "/Other.appex"));
 
     // A plug-in inside its application: found once the application is registered. One standing
     // alone is registered but hidden from hosts.
