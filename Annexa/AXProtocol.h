@@ -66,6 +66,8 @@ inline constexpr const char* kUuids = "uuids";
 inline constexpr const char* kFlags = "flags";
 inline constexpr const char* kAnnotations = "annotations";
 inline constexpr const char* kRules = "rules";
+// With the explain flag, from a manager: the application whose view the explanation gives.
+inline constexpr const char* kHost = "host";
 inline constexpr const char* kExtensions = "extensions";
 inline constexpr const char* kConflicts = "conflicts";
 inline constexpr const char* kMatches = "matches";

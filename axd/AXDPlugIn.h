@@ -3,6 +3,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -88,6 +89,8 @@ public:
     // restricting entitlement (a pattern dictionary) is tested first, then the plug-in's
     // "KSExtensionHostEntitlement".
     std::optional<std::string> allowForClient(const AXDRpxClient& client) const;
+    // The same for a host known only by its entitlements (`entitlement` gives a key's value).
+    std::optional<std::string> allowForHost(const std::function<Value(const std::string&)>& entitlement) const;
     // `allowedPCXServices`: the privacy-consent services granted to the plug-in's containing
     // application; empty when there are none or they cannot be learnt.
     std::set<std::string> allowedPCXServices() const;

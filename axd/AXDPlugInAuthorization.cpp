@@ -7,7 +7,11 @@
 namespace annexa {
 
 std::optional<std::string> AXDPlugIn::allowForClient(const AXDRpxClient& client) const {
-    Value restriction = client.entitlementValueForKey(keys::kAllowedPlugInsEntitlement);
+    return allowForHost([&client](const std::string& key) { return client.entitlementValueForKey(key); });
+}
+
+std::optional<std::string> AXDPlugIn::allowForHost(const std::function<Value(const std::string&)>& entitlement) const {
+    Value restriction = entitlement(keys::kAllowedPlugInsEntitlement);
     if (!restriction.isNull()) {
         if (!restriction.isDictionary()) return std::string("invalid host restriction entitlement");
         if (!match(restriction)) return std::string("the host's plug-in entitlement does not allow this plug-in");
@@ -17,7 +21,7 @@ std::optional<std::string> AXDPlugIn::allowForClient(const AXDRpxClient& client)
         // A name that is no string cannot be held: the host is refused. The text shows the name's
         // own characters (a value of another type in its notation).
         const std::string* name = required.asString();
-        if (!name || !client.hasEntitlement(*name))
+        if (!name || !entitlementGranted(entitlement(*name)))
             return corvane::log::formatText("the host does not have the \"%@\" entitlement", required);
     }
     return std::nullopt;

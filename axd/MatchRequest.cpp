@@ -13,6 +13,7 @@
 #include "axd/AXDRpxClient.h"
 #include "axd/AXDServer.h"
 #include "axd/Transaction.h"
+#include "platform/codesign/CodeSign.h"
 #include "platform/rpx/Wire.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/trace/Trace.h"
@@ -225,7 +226,7 @@ std::optional<std::string> Transaction::matchRefusal(
             if (flags & kSystemOnly) return std::string("not on the system volume");
         }
         if (p.isDedicated()) {
-            auto bundle = client_->bundle();
+            auto bundle = explainedHost_ ? explainedHost_->bundle : client_->bundle();
             auto plugIns = bundle ? bundle->plugInsPath() : std::nullopt;
             if (!plugIns || p.path().rfind(*plugIns, 0) != 0) return std::string("dedicated to another application");
         }
@@ -242,7 +243,9 @@ std::optional<std::string> Transaction::matchRefusal(
         return worded ? "excluded by the user: " + exclusion.description() : std::string("excluded");
     }
     if (!(flags & kAll)) {
-        if (auto reason = p.allowForClient(*client_)) {
+        auto reason = explainedHost_ ? p.allowForHost([this](const std::string& key) { return explainedHost_->entitlements[key]; })
+                                     : p.allowForClient(*client_);
+        if (reason) {
             logged.push_back(
                 log::formatText("client %d cannot use plugin %@: %@", client_->pid(), p.uuid(), *reason));
             return "not allowed: " + *reason;
@@ -324,6 +327,29 @@ Value Transaction::explainAll(const std::vector<AXDPlugInPtr>& candidates, AXDMa
     return Value(std::move(explanations));
 }
 
+bool Transaction::readExplainedHost(bool explain) {
+    const Value& entry = request()[message::kHost];
+    if (entry.isNull()) return true;
+    // Another application's view names what it may see: only for a manager, and only explained.
+    if (!explain || !client_->hasEntitlement(keys::kManagerEntitlement)) {
+        failMessage(AXErrorCode::NotEntitled, "unauthorized discovery key (host)");
+        return false;
+    }
+    const std::string* path = entry.asString();
+    if (!path || path->empty() || path->front() != '/' || path->size() > 4096) {
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (host: not an absolute path)");
+        return false;
+    }
+    auto application = server().workspace().applicationForPath(*path);
+    if (!application) {
+        failMessage(AXErrorCode::InvalidRequest, "invalid request format (host: no registered application there)");
+        return false;
+    }
+    explainedHost_ = ExplainedHost{AXBundle::initWithPath(application->bundlePath()),
+                                   corvane::codesign::entitlementsOfBundle(application->bundlePath())};
+    return true;
+}
+
 void Transaction::matchPlugIns() {
     using namespace discovery;
     const Value& rulesEntry = request()[message::kRules];
@@ -352,6 +378,7 @@ void Transaction::matchPlugIns() {
         failMessage(AXErrorCode::NotEntitled, "unauthorized discovery flag (explain)");
         return;
     }
+    if (!readExplainedHost(explain)) return;
     MatchInputs inputs = currentMatchInputs(server());
     // Empty rules are no rules.
     if (const Dictionary* tests = rules.asDictionary(); tests && tests->empty()) rules = Value();

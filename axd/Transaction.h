@@ -11,6 +11,7 @@
 #include <unordered_set>
 #include <vector>
 
+#include "Annexa/AXBundle.h"
 #include "Annexa/AXUtilities.h"
 #include "axd/AXDPlugIn.h"
 #include "platform/rpx/Rpx.h"
@@ -118,6 +119,16 @@ private:
     // query left it out.
     Value explainAll(const std::vector<AXDPlugInPtr>& candidates, std::map<const AXDPlugIn*, std::string>& outcomes,
                      const Value& rules, uint64_t flags, const MatchInputs& inputs, const MatchHolds& holds);
+    // A manager's explanation for an application ("host"): false after answering that the request
+    // may not name one, or names none that is registered.
+    bool readExplainedHost(bool explain);
+    // The application a manager's explanation speaks for, in place of the client itself: its
+    // bundle and its verified entitlements.
+    struct ExplainedHost {
+        std::shared_ptr<AXBundle> bundle;
+        Value entitlements;
+    };
+    std::optional<ExplainedHost> explainedHost_;
     // The request's "flags": an unsigned number; absent, or of another type, reads as 0.
     uint64_t flagsArgument() const;
 

@@ -15,6 +15,7 @@
 #include <string>
 #include <vector>
 
+#include "Annexa/AXMessage.h"
 #include "Annexa/AXDaemonClient.h"
 #include "Annexa/AXPlugInRuntime.h"
 #include "platform/log/Log.h"
@@ -38,9 +39,9 @@ const cli::Syntax kAnnotate{"[-S servicename] annotate [--election N] [--extensi
                           {"--election", "--extension"}, 1};
 const cli::Syntax kBulkAnnotate{"[-S servicename] bulk-annotate FILE.plist", {}, {}, 1, 1};
 const cli::Syntax kMatch{"[-S servicename] match [-r KEY=PATTERN|KEY:=VALUE]... [--rules FILE.plist] [--all-versions] [--duplicates] "
-                         "[--system-only] [--all] [--explain] [--json]",
+                         "[--system-only] [--all] [--explain [--host APP-PATH]] [--json]",
                          {"--all-versions", "--duplicates", "--system-only", "--all", "--explain", "--json"},
-                         {"-r", "--rules"},
+                         {"-r", "--rules", "--host"},
                          0,
                          0};
 
@@ -72,9 +73,10 @@ const char* kHelp =
     "  bulk-annotate FILE.plist                     set each plug-in's extension dictionary:\n"
     "                                               FILE.plist maps UUID texts to dictionaries\n"
     "  match [-r KEY=PATTERN|KEY:=VALUE]... [--rules FILE.plist] [--all-versions] [--duplicates]\n"
-    "        [--system-only] [--all] [--explain] [--json]\n"
+    "        [--system-only] [--all] [--explain [--host APP-PATH]] [--json]\n"
     "                                               the plug-ins that fit; --explain says why\n"
-    "                                               each installed plug-in was left out;\n"
+    "                                               each installed plug-in was left out (to\n"
+    "                                               the application at APP-PATH with --host);\n"
     "                                               KEY=PATTERN is a string as written (an array\n"
     "                                               or dictionary in the notation is that value),\n"
     "                                               KEY:=VALUE a value in the notation (2u, true)\n"
@@ -250,8 +252,17 @@ int match(const std::string& service, const cli::Parsed& p) {
     if (p.has("--system-only")) flags |= annexa::discovery::kSystemOnly;
     if (p.has("--all")) flags |= annexa::discovery::kAll;
     if (p.has("--explain")) flags |= annexa::discovery::kExplain;
+    auto host = p.value("--host");
+    if (host && !p.has("--explain")) return cli::usageError(kTool, "--host explains: give --explain too", kMatch.usage);
     AXDaemonClient client(service);
-    auto reply = client.wait([&](auto done) { client.matchPlugIns(rules.empty() ? Value() : Value(rules), flags, done); });
+    auto reply = client.wait([&](auto done) {
+        if (!host) return client.matchPlugIns(rules.empty() ? Value() : Value(rules), flags, done);
+        annexa::Dictionary m = client.request(annexa::request::kMatch);
+        m[annexa::message::kRules] = annexa::convertValueToMessage(rules.empty() ? Value() : Value(rules));
+        m[annexa::message::kFlags] = Value(flags);
+        m[annexa::message::kHost] = Value(absolute(*host));
+        client.send(Value(std::move(m)), done);
+    });
     if (int status = finish(reply, service); status != cli::kSuccess) return status;
     const Value& matches = reply.value[annexa::message::kMatches];
     if (p.has("--json")) {

@@ -663,6 +663,28 @@ TEST(Axd, MatchFindsWhatFitsOneRegistrationPerIdentifier) {
     explained = d.axctl({"match", "--explain"}, {}, manager);
     EXPECT_NE(line(dedicated).find("dedicated to another application"), std::string::npos) << explained.out;
     EXPECT_NE(line(other + "/PlugIns/New.appex").find("returned"), std::string::npos) << explained.out;
+    // The manager explains what an application would be told: the plug-in dedicated to Other is
+    // offered to Other, and to Example it is dedicated to another application.
+    explained = d.axctl({"match", "--explain", "--host", other}, {}, manager);
+    EXPECT_NE(line(dedicated).find("returned"), std::string::npos) << explained.err << explained.out;
+    explained = d.axctl({"match", "--explain", "--host", app}, {}, manager);
+    EXPECT_NE(line(dedicated).find("dedicated to another application"), std::string::npos) << explained.out;
+    struct Refused {
+        std::vector<std::string> args;
+        std::string program, error;
+    };
+    for (const Refused& r : std::vector<Refused>{
+             {{"--explain", "--host", other}, "", "unauthorized discovery key (host)"},
+             {{"--host", other}, manager, "--host explains"},
+             {{"--explain", "--host", d.root / "Nowhere.app"}, manager, "no registered application there"},
+             {{"--explain", "--host", dedicated}, manager, "no registered application there"},
+         }) {
+        std::vector<std::string> args{"match"};
+        args.insert(args.end(), r.args.begin(), r.args.end());
+        auto refused = d.axctl(args, {}, r.program);
+        EXPECT_NE(refused.status, 0) << r.error;
+        EXPECT_NE(refused.err.find(r.error), std::string::npos) << refused.err;
+    }
 }
 
 // A host that asks again on its connection gets its last answer again only while nothing it
