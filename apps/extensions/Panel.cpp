@@ -329,7 +329,6 @@ GtkWidget* explainPage(Panel& panel) {
     panel.hostRow = adw_combo_row_new();
     adw_preferences_row_set_title(ADW_PREFERENCES_ROW(panel.hostRow), "Host application");
     adw_combo_row_set_model(ADW_COMBO_ROW(panel.hostRow), G_LIST_MODEL(names));
-    setLabel(panel.hostRow, "Host application");
     g_signal_connect(panel.hostRow, "notify::selected", G_CALLBACK(+[](GObject*, GParamSpec*, gpointer data) {
                          explain(*static_cast<Panel*>(data));
                      }),
@@ -463,7 +462,7 @@ void presentPanel(AdwApplication* application) {
                                       "application-x-addon-symbolic");
     adw_view_stack_page_set_icon_name(
         adw_view_stack_add_titled(ADW_VIEW_STACK(stack), explainPage(*panel), "why", "Why is it not offered?"),
-        "dialog-question-symbolic");
+        "help-about-symbolic");
     GtkWidget* title = adw_view_switcher_title_new();
     adw_view_switcher_title_set_stack(ADW_VIEW_SWITCHER_TITLE(title), ADW_VIEW_STACK(stack));
     adw_view_switcher_title_set_title(ADW_VIEW_SWITCHER_TITLE(title), "Extensions");

@@ -19,7 +19,7 @@ src=$(cd "${1:-$(dirname "$0")/../..}" && pwd)
 work=$(mktemp -d /tmp/annexa-package.XXXXXX)
 chmod 0755 "$work"
 users=(axpkg-alice axpkg-bob)
-ours=(annexa-test-greeter python3-annexa libannexa-dev libannexa1 annexa)
+ours=(annexa-test-greeter annexa-extensions python3-annexa libannexa-dev libannexa1 annexa)
 pids=()
 guide_key=/home/axpkg-alice/.config/corvane/developer.key.pub
 export DEBIAN_FRONTEND=noninteractive
@@ -62,7 +62,7 @@ else
     [ -z "${AX_PACKAGE_KEEP:-}" ] || cp "$work"/*.deb "$AX_PACKAGE_KEEP"/
 fi
 debs=()
-for package in annexa libannexa1 libannexa-dev python3-annexa; do
+for package in annexa libannexa1 libannexa-dev python3-annexa annexa-extensions; do
     deb=$(ls "$work"/${package}_*.deb 2>/dev/null | head -n 1)
     [ -n "$deb" ] || fail "no package $package was built"
     debs+=("$deb")
@@ -86,6 +86,11 @@ for program in axd axctl pcx; do
     axsign verify "/usr/bin/$program" >/dev/null || fail "/usr/bin/$program is not signed"
 done
 axsign show /usr/bin/axd | grep -q 'com.corvane.private.rpx.domain-extension.proxy' || fail "axd lacks its entitlement"
+axsign show /usr/bin/annexa-extensions | grep -q 'com.corvane.private.annexa.manager' ||
+    fail "the Extensions panel lacks the manager entitlement"
+appstream-util validate /usr/share/metainfo/com.corvane.annexa.Extensions.metainfo.xml >/dev/null ||
+    fail "the panel's AppStream metadata does not validate"
+desktop-file-validate /usr/share/applications/com.corvane.annexa.Extensions.desktop || fail "the panel's desktop entry does not validate"
 [ -f /var/lib/corvane/vantry/registry.db ] || fail "no system registry"
 [ -d /usr/lib/corvane/Applications ] || fail "no system applications directory"
 libdir=$(dirname "$(find /usr/lib -name 'libannexa.so.1.0.0' | head -n 1)")
@@ -95,7 +100,7 @@ readelf -d "$libdir/libannexa.so.1.0.0" | grep -q 'SONAME.*libannexa.so.1' || fa
 [ -f /usr/share/doc/annexa/README.md.gz ] || [ -f /usr/share/doc/annexa/README.md ] || fail "README is not installed"
 
 echo "== the manual pages render, the completions load"
-for page in $(dpkg -L annexa | grep '/man/man[0-9]/'); do
+for page in $(dpkg -L annexa annexa-extensions | grep '/man/man[0-9]/'); do
     [ -f "$page" ] || continue
     warnings=$(MANWIDTH=80 man --warnings -l "$page" 2>&1 >/dev/null)
     [ -z "$warnings" ] || fail "$page: $warnings"

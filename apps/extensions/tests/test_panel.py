@@ -109,6 +109,10 @@ def platform(tmp_path_factory: pytest.TempPathFactory) -> Iterator[Platform]:
     os.environ["CORVANE_ROOT"] = str(root)
     p = Platform(root)
     (root / "bin").mkdir()
+    # The platform's own extension points, with their names.
+    sdk = pathlib.Path(__file__).resolve().parents[3] / "dist" / "sdk"
+    if sdk.is_dir():
+        shutil.copytree(sdk, root / "usr" / "share" / "corvane" / "sdk")
     p.tool("axsign", "keygen", "--out", str(root / "key"))
     p.tool("axsign", "trust", str(root / "key.pub"))
     axd = p.signed("axd", {"com.corvane.private.rpx.domain-extension.proxy": True, "com.corvane.private.pcx.manager": True})
