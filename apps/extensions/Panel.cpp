@@ -1,5 +1,6 @@
 #include "apps/extensions/Panel.h"
 
+#include <algorithm>
 #include <map>
 #include <memory>
 #include <string>
@@ -89,6 +90,7 @@ void showError(Panel& panel, const std::string& what, const corvane::Error& erro
 }
 
 void reload(Panel& panel);
+void refreshHosts(Panel& panel);
 void openDetails(Panel& panel, const UUID& uuid);
 
 void electionToggled(GtkSwitch* toggle, GParamSpec*, gpointer data) {
@@ -190,6 +192,7 @@ void reload(Panel& panel) {
     bool same = sameLayout(panel.snapshot, *loaded);
     panel.snapshot = std::move(*loaded);
     gtk_widget_set_visible(panel.limited, !panel.snapshot.fullView);
+    refreshHosts(panel);
     if (same && !panel.rows.empty()) {
         update(panel);
     } else {
@@ -212,6 +215,15 @@ void consentToggled(GtkSwitch* toggle, GParamSpec*, gpointer data) {
         panel->updating = true;
         gtk_switch_set_active(toggle, !on);
         panel->updating = false;
+        return;
+    }
+    // The keyboard's network decides its sandbox: the page shows the profile it gets now.
+    auto* plugIn = static_cast<const PlugIn*>(g_object_get_data(G_OBJECT(toggle), "plug-in"));
+    auto* profileRow = static_cast<GtkWidget*>(g_object_get_data(G_OBJECT(toggle), "profile-row"));
+    if (plugIn && profileRow && std::string(service) == corvane::pcx::kKeyboardNetworkService) {
+        auto [profile, why] = Extensions::sandboxProfile(*plugIn, on);
+        adw_preferences_row_set_title(ADW_PREFERENCES_ROW(profileRow), ("Profile " + profile).c_str());
+        adw_action_row_set_subtitle(ADW_ACTION_ROW(profileRow), why.c_str());
     }
 }
 
@@ -252,7 +264,8 @@ void openDetails(Panel& panel, const UUID& uuid) {
             if (s.service == corvane::pcx::kKeyboardNetworkService) networkGranted = s.granted;
     auto [profile, why] = Extensions::sandboxProfile(p, networkGranted);
     GtkWidget* sandbox = group("Sandbox");
-    adw_preferences_group_add(ADW_PREFERENCES_GROUP(sandbox), plainRow("Profile " + profile, why));
+    GtkWidget* profileRow = plainRow("Profile " + profile, why);
+    adw_preferences_group_add(ADW_PREFERENCES_GROUP(sandbox), profileRow);
     adw_preferences_page_add(ADW_PREFERENCES_PAGE(page), ADW_PREFERENCES_GROUP(sandbox));
 
     GtkWidget* rights = group("Entitlements");
@@ -280,6 +293,8 @@ void openDetails(Panel& panel, const UUID& uuid) {
         setLabel(toggle, "Allow " + s.title);
         g_object_set_data_full(G_OBJECT(toggle), "application", g_strdup(p.applicationPath.c_str()), g_free);
         g_object_set_data_full(G_OBJECT(toggle), "service", g_strdup(s.service.c_str()), g_free);
+        g_object_set_data_full(G_OBJECT(toggle), "plug-in", new PlugIn(p), [](gpointer d) { delete static_cast<PlugIn*>(d); });
+        g_object_set_data(G_OBJECT(toggle), "profile-row", profileRow);
         g_signal_connect(toggle, "notify::active", G_CALLBACK(consentToggled), &panel);
         adw_action_row_add_suffix(ADW_ACTION_ROW(row), toggle);
         adw_preferences_group_add(ADW_PREFERENCES_GROUP(privacy), row);
@@ -316,21 +331,43 @@ void explain(Panel& panel) {
     }
 }
 
+// The registered applications as hosts to pick, read again when they may have changed; the one
+// picked stays picked while it is registered.
+void refreshHosts(Panel& panel) {
+    std::vector<Application> hosts = panel.model.applications();
+    bool same = hosts.size() == panel.hosts.size() && std::equal(hosts.begin(), hosts.end(), panel.hosts.begin(), [](auto& a, auto& b) {
+                    return a.path == b.path && a.name == b.name;
+                });
+    if (same && adw_combo_row_get_model(ADW_COMBO_ROW(panel.hostRow))) return;
+    guint chosen = adw_combo_row_get_selected(ADW_COMBO_ROW(panel.hostRow));
+    std::string picked = chosen >= 1 && chosen <= panel.hosts.size() ? panel.hosts[chosen - 1].path : std::string();
+    GtkStringList* names = gtk_string_list_new(nullptr);
+    gtk_string_list_append(names, "This panel (no application)");
+    guint keep = 0;
+    for (size_t i = 0; i < hosts.size(); ++i) {
+        gtk_string_list_append(names, hosts[i].name.c_str());
+        if (hosts[i].path == picked) keep = static_cast<guint>(i + 1);
+    }
+    panel.hosts = std::move(hosts);
+    panel.updating = true;
+    adw_combo_row_set_model(ADW_COMBO_ROW(panel.hostRow), G_LIST_MODEL(names));
+    g_object_unref(names);
+    adw_combo_row_set_selected(ADW_COMBO_ROW(panel.hostRow), keep);
+    panel.updating = false;
+}
+
 GtkWidget* explainPage(Panel& panel) {
     GtkWidget* page = adw_preferences_page_new();
     panel.explanationBox = page;
     GtkWidget* ask = group("Why is it not offered?",
                            "Pick the application that hosts plug-ins, or type the rules a host asks with; "
                            "axd says, for every plug-in, whether the host is offered it and if not, why.");
-    GtkStringList* names = gtk_string_list_new(nullptr);
-    gtk_string_list_append(names, "This panel (no application)");
-    panel.hosts = panel.model.applications();
-    for (const Application& a : panel.hosts) gtk_string_list_append(names, a.name.c_str());
     panel.hostRow = adw_combo_row_new();
     adw_preferences_row_set_title(ADW_PREFERENCES_ROW(panel.hostRow), "Host application");
-    adw_combo_row_set_model(ADW_COMBO_ROW(panel.hostRow), G_LIST_MODEL(names));
+    refreshHosts(panel);
     g_signal_connect(panel.hostRow, "notify::selected", G_CALLBACK(+[](GObject*, GParamSpec*, gpointer data) {
-                         explain(*static_cast<Panel*>(data));
+                         auto& p = *static_cast<Panel*>(data);
+                         if (!p.updating) explain(p);
                      }),
                      &panel);
     adw_preferences_group_add(ADW_PREFERENCES_GROUP(ask), panel.hostRow);

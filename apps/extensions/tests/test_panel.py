@@ -264,5 +264,6 @@ def test_the_panel_shows_elects_follows_and_explains(platform: Platform, tmp_pat
     assert "revoked" in platform.tool("pcx", "list") or platform.tool("pcx", "list") == ""
     act(network)
     eventually(lambda: "com.corvane.pcx.keyboard-network\tgranted" in platform.tool("pcx", "list"), "the network is granted")
+    eventually(lambda: named(app, "Profile plugin"), "the page shows the profile the keyboard gets now")
     process.terminate()
     process.wait(timeout=10)
