@@ -93,12 +93,17 @@ void reload(Panel& panel);
 void refreshHosts(Panel& panel);
 void openDetails(Panel& panel, const UUID& uuid);
 
+// The plug-in a control stands for.
+void attachUuid(GtkWidget* widget, const UUID& uuid) {
+    g_object_set_data_full(G_OBJECT(widget), "uuid", new UUID(uuid), [](gpointer u) { delete static_cast<UUID*>(u); });
+}
+const UUID& attachedUuid(GtkWidget* widget) { return *static_cast<const UUID*>(g_object_get_data(G_OBJECT(widget), "uuid")); }
+
 void electionToggled(GtkSwitch* toggle, GParamSpec*, gpointer data) {
     auto* panel = static_cast<Panel*>(data);
     if (panel->updating) return;
-    auto* uuid = static_cast<const UUID*>(g_object_get_data(G_OBJECT(toggle), "uuid"));
     bool on = gtk_switch_get_active(toggle);
-    if (Status sent = panel->model.setElection(*uuid, on); !sent.ok()) showError(*panel, "The choice was not stored", sent.error());
+    if (Status sent = panel->model.setElection(attachedUuid(GTK_WIDGET(toggle)), on); !sent.ok()) showError(*panel, "The choice was not stored", sent.error());
     // The row shows what axd stored, whatever was asked.
     reload(*panel);
 }
@@ -110,21 +115,21 @@ GtkWidget* plugInRow(Panel& panel, const PlugIn& p) {
     gtk_switch_set_active(GTK_SWITCH(toggle), p.elected());
     setLabel(toggle, "Use " + p.name);
     gtk_widget_set_tooltip_text(toggle, "Offer this plug-in to its hosts");
-    g_object_set_data_full(G_OBJECT(toggle), "uuid", new UUID(p.uuid), [](gpointer u) { delete static_cast<UUID*>(u); });
+    attachUuid(toggle, p.uuid);
     g_signal_connect(toggle, "notify::active", G_CALLBACK(electionToggled), &panel);
     GtkWidget* details = gtk_button_new_from_icon_name("go-next-symbolic");
     gtk_widget_set_valign(details, GTK_ALIGN_CENTER);
     gtk_widget_add_css_class(details, "flat");
     setLabel(details, "Details of " + p.name);
-    g_object_set_data_full(G_OBJECT(details), "uuid", new UUID(p.uuid), [](gpointer u) { delete static_cast<UUID*>(u); });
+    attachUuid(details, p.uuid);
     auto open = +[](GtkWidget* w, gpointer data) {
-        openDetails(*static_cast<Panel*>(data), *static_cast<const UUID*>(g_object_get_data(G_OBJECT(w), "uuid")));
+        openDetails(*static_cast<Panel*>(data), attachedUuid(w));
     };
     g_signal_connect(details, "clicked", G_CALLBACK(open), &panel);
     adw_action_row_add_suffix(ADW_ACTION_ROW(row), toggle);
     adw_action_row_add_suffix(ADW_ACTION_ROW(row), details);
     // Enter on the row, or a click on it, opens its page too.
-    g_object_set_data_full(G_OBJECT(row), "uuid", new UUID(p.uuid), [](gpointer u) { delete static_cast<UUID*>(u); });
+    attachUuid(row, p.uuid);
     gtk_list_box_row_set_activatable(GTK_LIST_BOX_ROW(row), TRUE);
     g_signal_connect(row, "activated", G_CALLBACK(open), &panel);
     panel.rows[p.uuid] = Row{row, toggle};
