@@ -83,9 +83,11 @@ def test_annotations_holds_and_the_watch(platform):
     app = platform.application("Watched", ["One"])
     with annexa.Client() as client, client.watch() as watch:
         (one,) = client.match({"KSExtensionIdentifier": "com.example.watched.one"})
-        assert watch.next(timeout=0) is None
         client.annotate([one], election=1, extension={"colour": "blue"})
-        event = watch.next(timeout=5)
+        # The registry tells axd of the installation on a thread of its own, so the application's
+        # "installed" may still come first.
+        while (event := watch.next(timeout=5)) is not None and event["event"] == "installed":
+            assert event["plugin"]["uuid"] == one.uuid
         assert event is not None and event["event"] == "annotation"
         (again,) = client.match({"KSExtensionIdentifier": "com.example.watched.one"})
         assert again.annotations == {"election": 1, "extension": {"colour": "blue"}}
