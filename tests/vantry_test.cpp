@@ -447,3 +447,56 @@ TEST(Vantry, TheSystemAndTheUserRegistryAreReadAsOne) {
     EXPECT_EQ(st.st_mode & 0777, 0644u);
     EXPECT_FALSE(fs::exists(Registry::systemPath() + "-wal"));
 }
+
+// Records are stored in the binary value encoding; a database whose rows an earlier release wrote
+// as XML property lists reads the same, and a damaged row is no record rather than a crash.
+TEST(Vantry, RecordsWrittenAsPropertyListsReadAsTheBinaryOnes) {
+    Fixture f;
+    auto registry = Registry::open(Registry::defaultPath());
+    auto& r = **registry;
+    ASSERT_TRUE(r.registerBundle(f.app).ok());
+    auto share = r.plugInForPath(f.app + "/PlugIns/Share.appex");
+    ASSERT_TRUE(share);
+    Value binary = share->serialize();
+
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(Registry::defaultPath().c_str(), &db), SQLITE_OK);
+    auto rewrite = [&](const char* table, const std::string& bytes) {
+        sqlite3_stmt* st = nullptr;
+        std::string sql = std::string("UPDATE ") + table + " SET record = ?";
+        ASSERT_EQ(sqlite3_prepare_v2(db, sql.c_str(), -1, &st, nullptr), SQLITE_OK);
+        sqlite3_bind_blob(st, 1, bytes.data(), static_cast<int>(bytes.size()), SQLITE_TRANSIENT);
+        EXPECT_EQ(sqlite3_step(st), SQLITE_DONE);
+        sqlite3_finalize(st);
+    };
+    sqlite3_stmt* st = nullptr;
+    ASSERT_EQ(sqlite3_prepare_v2(db, "SELECT record FROM plugins WHERE path = ?", -1, &st, nullptr), SQLITE_OK);
+    std::string sharePath = share->bundlePath();
+    sqlite3_bind_text(st, 1, sharePath.c_str(), -1, SQLITE_TRANSIENT);
+    ASSERT_EQ(sqlite3_step(st), SQLITE_ROW);
+    std::string stored(static_cast<const char*>(sqlite3_column_blob(st, 0)), sqlite3_column_bytes(st, 0));
+    sqlite3_finalize(st);
+    EXPECT_EQ(stored.substr(0, vantry::kRecordMarker.size()), vantry::kRecordMarker);
+    EXPECT_EQ(*vantry::decodeRecord(stored), binary);
+
+    struct Case {
+        std::string name, plugIn, application;
+        bool readable;
+    };
+    for (const Case& c : std::vector<Case>{
+             {"XML rows of an earlier release", *plist::toXML(binary), *plist::toXML(share->containingApplication()->serialize()), true},
+             {"a marker and garbage", std::string(vantry::kRecordMarker) + "\x0b\xff", std::string(vantry::kRecordMarker), false},
+             {"neither encoding", "not a record", "nor this", false},
+         }) {
+        rewrite("plugins", c.plugIn);
+        rewrite("applications", c.application);
+        r.dropCaches();
+        auto read = r.plugInForUUID(share->uuid());
+        EXPECT_EQ(bool(read), c.readable) << c.name;
+        // The same record, as far as XML carries it (dates in whole seconds).
+        if (read) {
+            EXPECT_EQ(read->serialize(), *plist::parse(*plist::toXML(binary))) << c.name;
+        }
+    }
+    sqlite3_close(db);
+}

@@ -85,7 +85,7 @@ void Store::deliverNewEvents() {
         q.bind(1, lastSeq_);
         while (q && q.step() == SQLITE_ROW) {
             lastSeq_ = q.integer(0);
-            auto list = plist::parse(q.blob(2));
+            auto list = decodeRecord(q.blob(2));
             std::vector<PlugInRecordPtr> records;
             if (list && list->isArray())
                 for (const Value& v : *list->asArray())

@@ -13,11 +13,27 @@
 #include "platform/containers/Containers.h"
 #include "platform/layout/Layout.h"
 #include "platform/plist/Plist.h"
+#include "platform/rpx/Rpx.h"
+#include "platform/rpx/Wire.h"
 #include "platform/vantry/Store.h"
 
 #include <cstring>
 
 namespace corvane::vantry {
+
+std::optional<std::string> encodeRecord(const Value& record) {
+    std::string out(kRecordMarker);
+    if (!rpx::wire::appendElement(out, record)) return std::nullopt;
+    return out;
+}
+
+std::optional<Value> decodeRecord(std::string_view bytes) {
+    if (bytes.substr(0, kRecordMarker.size()) == kRecordMarker)
+        return rpx::wire::decodeValue(bytes.substr(kRecordMarker.size()), {}, rpx::kMaxDepth);
+    auto parsed = plist::parse(bytes);
+    if (!parsed) return std::nullopt;
+    return std::move(*parsed);
+}
 
 namespace {
 
@@ -194,7 +210,7 @@ ApplicationRecordPtr Store::appFromRow(const std::string& appPath) {
     Statement q(db_, "SELECT record FROM applications WHERE path = ?");
     q.bind(1, appPath);
     if (q.step() != SQLITE_ROW) return nullptr;
-    auto v = plist::parse(q.blob(0));
+    auto v = decodeRecord(q.blob(0));
     if (!v) return nullptr;
     auto app = std::make_shared<ApplicationRecord>();
     app->bundlePath_ = appPath;
@@ -216,7 +232,7 @@ PlugInRecordPtr Store::recordFromRow(const std::string& uuidText, std::string_vi
     if (!uuid) return nullptr;
     auto it = byUUID_.find(*uuid);
     if (it != byUUID_.end()) return it->second;
-    auto v = plist::parse(blob);
+    auto v = decodeRecord(blob);
     if (!v) return nullptr;
     if (options_.shared) v = withReadersContainer(std::move(*v));
     ApplicationRecordPtr app = appPath.empty() ? nullptr : appFromRow(appPath);
@@ -304,9 +320,8 @@ Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath,
                   "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
                   " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
     if (!ins) return sqlError("preparing an insert");
-    auto record = plist::toXML(r->serialize());
-    auto ents = plist::toXML(r->entitlements());
-    if (!record || !ents) return refusal("plug-in metadata without property-list form in " + r->bundlePath());
+    auto record = encodeRecord(r->serialize());
+    if (!record) return refusal("plug-in metadata that cannot be recorded in " + r->bundlePath());
     ins.bind(1, r->uuid().string());
     ins.bind(2, r->bundlePath());
     if (appPath.empty()) {
@@ -315,7 +330,8 @@ Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath,
         ins.bind(3, appPath);
     }
     ins.bind(4, r->identifier());
-    ins.bindBlob(5, ents->data(), ents->size());
+    // The entitlements are part of the record; the column of the first schema stays, empty.
+    ins.bindBlob(5, "", 0);
     ins.bindBlob(6, record->data(), record->size());
     for (int k = 0; k < 3; ++k) {
         Subject subject = k == 0 ? Subject{SubjectKind::Text, r->identifier()}
@@ -336,11 +352,11 @@ Status Store::journal(JournalKind kind, const std::vector<PlugInRecordPtr>& reco
     if (records.empty()) return {};
     Array list;
     for (const auto& r : records) list.push_back(r->serialize());
-    auto xml = plist::toXML(Value(std::move(list)));
-    if (!xml) return xml.error();
+    auto encoded = encodeRecord(Value(std::move(list)));
+    if (!encoded) return refusal("plug-in metadata that cannot be journalled");
     Statement ins(db_, "INSERT INTO journal (kind, records, at) VALUES (?, ?, ?)");
     ins.bind(1, static_cast<int64_t>(kind));
-    ins.bindBlob(2, xml->data(), xml->size());
+    ins.bindBlob(2, encoded->data(), encoded->size());
     ins.bind(3, Date::now().wholeSeconds());
     if (ins.step() != SQLITE_DONE) return sqlError("writing the journal");
     Statement prune(db_, "DELETE FROM journal WHERE at < ?");
@@ -383,7 +399,17 @@ void Store::rememberPaths() {
     Statement q(db_, "SELECT path FROM applications UNION SELECT path FROM plugins WHERE app_path IS NULL ORDER BY 1");
     std::string list;
     while (q && q.step() == SQLITE_ROW) list += q.text(0) + "\n";
-    (void)plist::writeFileAtomically(pathsFile(), list, 0644);
+    // Renamed over the old list but not synced: the list is only read to rebuild a damaged
+    // database, the commit it follows is durable on its own (its one fsync), and after a crash the
+    // file holds the old list or the new one whole (the file system writes a file renamed over
+    // another before the rename). A rebuild from the older list misses only what was registered
+    // just before a crash that also damaged the database; syncing the directories registers it again.
+    std::string written = pathsFile() + ".new";
+    int fd = ::open(written.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0644);
+    if (fd < 0) return;
+    bool whole = ::write(fd, list.data(), list.size()) == static_cast<ssize_t>(list.size());
+    ::close(fd);
+    if (!whole || ::rename(written.c_str(), pathsFile().c_str()) != 0) ::unlink(written.c_str());
 }
 
 Status Store::write(const WriteBody& body) {
@@ -464,15 +490,15 @@ Status Store::storeApplication(const ScannedBundle& bundle, Events& events) {
     old.bind(1, path);
     bool appChanged = old.step() != SQLITE_ROW || old.text(0) != bundle.fingerprint;
     if (appChanged) {
-        auto xml = plist::toXML(Value(bundle.record));
-        if (!xml) return xml.error();
+        auto encoded = encodeRecord(Value(bundle.record));
+        if (!encoded) return refusal("application metadata that cannot be recorded in " + path);
         Statement up(db_,
                      "INSERT INTO applications (path, identifier, record, fingerprint) VALUES (?,?,?,?) "
                      "ON CONFLICT(path) DO UPDATE SET identifier = excluded.identifier, "
                      "record = excluded.record, fingerprint = excluded.fingerprint");
         up.bind(1, path);
         up.bind(2, bundle.identifier);
-        up.bindBlob(3, xml->data(), xml->size());
+        up.bindBlob(3, encoded->data(), encoded->size());
         up.bind(4, bundle.fingerprint);
         if (up.step() != SQLITE_DONE) return sqlError("recording an application");
         apps_.erase(path);

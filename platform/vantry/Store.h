@@ -34,6 +34,14 @@ std::optional<std::string> stringAt(const Value& v, std::string_view key);
 // ---- SQLite
 
 // One prepared statement; an empty one (a failed prepare) steps to an error.
+// A record's bytes in the database: the rpx value encoding behind kRecordMarker, which reads
+// without parsing text.
+// Rows written before it are XML property lists; they are still read, and written anew with the
+// bundle's next registration.
+inline constexpr std::string_view kRecordMarker{"\0vr1", 4};
+std::optional<std::string> encodeRecord(const Value& record);
+std::optional<Value> decodeRecord(std::string_view bytes);
+
 struct Statement {
     sqlite3_stmt* s = nullptr;
     Statement(sqlite3* db, const char* sql) { sqlite3_prepare_v2(db, sql, -1, &s, nullptr); }
