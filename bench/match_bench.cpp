@@ -22,6 +22,7 @@
 #include "Annexa/AXDaemonClient.h"
 #include "Annexa/AXUtilities.h"
 #include "bench/Bench.h"
+#include "bench/Corpus.h"
 #include "platform/plist/Plist.h"
 #include "platform/rpx/Rpx.h"
 #include "platform/rpx/Wire.h"
@@ -33,15 +34,13 @@ using namespace corvane;
 
 namespace {
 
-constexpr int kPerApp = 100;
-
 int runMatch(int argc, char** argv) {
     int plugins = 10000;
     int requests = 500;
     int allRepeats = 5;  // more keeps axd busy with "all" long enough to profile it
     for (int i = 1; i + 1 < argc; i += 2) {
         if (std::strcmp(argv[i], "--all-repeats") == 0) allRepeats = std::max(1, std::atoi(argv[i + 1]));
-        if (std::strcmp(argv[i], "--plugins") == 0) plugins = std::max(kPerApp, std::atoi(argv[i + 1]));
+        if (std::strcmp(argv[i], "--plugins") == 0) plugins = std::max(100, std::atoi(argv[i + 1]));
         if (std::strcmp(argv[i], "--requests") == 0) requests = std::atoi(argv[i + 1]);
     }
     // The ping-pong's far end is forked first, before this process has any thread. Its sizes are
@@ -67,42 +66,11 @@ int runMatch(int argc, char** argv) {
     std::string self = std::filesystem::read_symlink("/proc/self/exe");
     std::string bin = self.substr(0, self.rfind('/'));
 
-    // N plug-ins, 100 to an application; every extension point name served by 10 of them; one in
-    // ten elected; every 50th shares its identifier with the one before, at a higher version.
-    int points = plugins / 10;
-    std::vector<std::string> apps;
-    std::vector<std::string> plugInPaths;
-    Dictionary annotations;
-    for (int a = 0; a * kPerApp < plugins; ++a) {
-        std::string app = root + "/Apps/App" + std::to_string(a) + ".app";
-        std::filesystem::create_directories(app + "/PlugIns");
-        (void)plist::writeXMLFile(app + "/Info.plist", dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)}}));
-        for (int p = 0; p < kPerApp && a * kPerApp + p < plugins; ++p) {
-            int n = a * kPerApp + p;
-            bool twin = n % 50 == 1;
-            std::string identifier = "com.bench.plugin" + std::to_string(twin ? n - 1 : n);
-            std::string dir = app + "/PlugIns/P" + std::to_string(p) + ".appex";
-            std::filesystem::create_directories(dir);
-            Value attrs = dict({{"KSExtensionPointName", "point" + std::to_string(n % points)},
-                                {"KSExtensionVersion", twin ? "2.0" : "1.0"}});
-            (void)plist::writeXMLFile(dir + "/Info.plist",
-                                      dict({{"KFBundleIdentifier", identifier},
-                                            {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
-                                                                  {"KSExtensionProtocol", "#Data"},
-                                                                  {"KSExtensionAttributes", attrs}})}}));
-            plugInPaths.push_back(dir);
-            if (n % 10 == 0) annotations[identifier] = dict({{"election", 1}});
-        }
-        apps.push_back(app);
-    }
-    {
-        auto registry = vantry::Registry::open(vantry::Registry::defaultPath());
-        if (!registry) return 1;
-        for (const auto& app : apps)
-            if (!(*registry)->registerBundle(app).ok()) return 1;
-    }
+    axbench::Corpus corpus;
+    if (!axbench::makeCorpus(root, plugins, corpus)) return 1;
+    int points = corpus.points;
     std::string annotationFile = root + "/Annotations";
-    (void)plist::writeXMLFile(annotationFile, dict({{"version", 16}, {"data", Value(annotations)}}));
+    (void)plist::writeXMLFile(annotationFile, dict({{"version", 16}, {"data", Value(corpus.annotations)}}));
 
     pid_t axd = -1;
     std::string axdPath = bin + "/axd";
@@ -203,18 +171,7 @@ int runMatch(int argc, char** argv) {
     size_t scanCount = 0;
     for (int i = 0; i < 3; ++i) {
         auto start = std::chrono::steady_clock::now();
-        std::map<std::string, std::string> best;  // identifier -> highest version
-        for (const auto& dir : plugInPaths) {
-            auto info = plist::readFile(dir + "/Info.plist");
-            if (!info) continue;
-            const std::string* id = (*info)["KFBundleIdentifier"].asString();
-            const std::string* version = (*info)["KSExtension"]["KSExtensionAttributes"]["KSExtensionVersion"].asString();
-            if (!id || !version) continue;
-            auto it = best.find(*id);
-            if (it == best.end() || annexa::compareVersionString(*version, it->second) == annexa::Ordering::Descending)
-                best[*id] = *version;
-        }
-        scanCount = best.size();
+        scanCount = axbench::hostScan(corpus);
         scanSamples.push_back(axbench::microsSince(start) / 1000);
     }
     kill(axd, SIGTERM);
