@@ -156,3 +156,26 @@ TEST(Plist, FailedWriteLeavesTheOldFileAndNoTemporary) {
     stat(path.c_str(), &st);
     EXPECT_EQ(st.st_mode & 0777, 0644u);
 }
+
+// A synced replacement fsyncs the file and its directory; an unsynced one neither, and both leave
+// the new contents whole and nothing beside them.
+TEST(Plist, UnsyncedReplacementWritesWholeWithoutFsyncs) {
+    struct CountingSyncs : plist::FileSystem {
+        int syncs = 0;
+        int syncFile(int fd) override { return ++syncs, FileSystem::syncFile(fd); }
+        int syncDirectory(const std::string& path) override { return ++syncs, FileSystem::syncDirectory(path); }
+    };
+    for (auto [durability, syncs] : {std::pair{plist::Durability::Synced, 2}, std::pair{plist::Durability::Unsynced, 0}}) {
+        axtest::TempDir dir;
+        std::string path = dir / "list";
+        axtest::writeFile(path, "old");
+        CountingSyncs counting;
+        plist::setFileSystem(&counting);
+        corvane::Status written = plist::writeFileAtomically(path, "new list", 0644, durability);
+        plist::setFileSystem(nullptr);
+        ASSERT_TRUE(written.ok());
+        EXPECT_EQ(counting.syncs, syncs);
+        EXPECT_EQ(axtest::readFile(path), "new list");
+        EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.path()), {}), 1);
+    }
+}

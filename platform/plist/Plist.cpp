@@ -287,7 +287,8 @@ int writeAll(FileSystem& fs, int fd, std::string_view bytes) {
 
 }  // namespace
 
-Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode, Durability durability) {
+    bool synced = durability == Durability::Synced;
     FileSystem& fs = fileSystem();
     std::string dir = directoryOf(path);
     std::string base = baseOf(path);
@@ -314,7 +315,7 @@ Status writeFileAtomically(const std::string& path, std::string_view bytes, mode
         return Error::file(e, path, true);
     };
     if (fchmod(fd, mode & ~mask) != 0) return failWith(errno);
-    if ((err = writeAll(fs, fd, bytes)) || (err = fs.syncFile(fd))) return failWith(err);
+    if ((err = writeAll(fs, fd, bytes)) || (synced && (err = fs.syncFile(fd)))) return failWith(err);
     if (unnamed) {
         std::string name = besideTarget(dir, base, write, "new");
         (void)fs.removeFile(name);
@@ -324,6 +325,10 @@ Status writeFileAtomically(const std::string& path, std::string_view bytes, mode
     err = fs.closeFile(fd);
     fd = -1;
     if (err) return failWith(err);
+    if (!synced) {
+        if ((err = fs.renameFile(tmp, path))) return failWith(err);
+        return {};
+    }
     // The old file stays reachable until the directory holds the new name for good, so that a
     // failed directory sync can put it back.
     std::string old = besideTarget(dir, base, write, "old");

@@ -74,7 +74,13 @@ Result<std::string> readWholeFile(const std::string& path);
 // it was (the old file is kept under ".<name>.<pid>-<n>.old" until the directory is synced, and put back when
 // that fails) and no temporary file behind; a process killed meanwhile leaves at most those names,
 // which removeStaleTemporaries clears. The new file gets `mode` (masked by the umask).
-Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666);
+//
+// Unsynced skips both fsyncs: readers still see the old contents or the new whole, and after a
+// crash the file holds one of them (a file renamed over another is written before the rename), but
+// possibly the old one. For files that only repeat what a durable store holds.
+enum class Durability { Synced, Unsynced };
+Status writeFileAtomically(const std::string& path, std::string_view bytes, mode_t mode = 0666,
+                           Durability durability = Durability::Synced);
 
 // Removes what writes to `path` killed half-way may have left beside it (".<name>.*"); for the one
 // writer of a file, at its start.

@@ -399,17 +399,11 @@ void Store::rememberPaths() {
     Statement q(db_, "SELECT path FROM applications UNION SELECT path FROM plugins WHERE app_path IS NULL ORDER BY 1");
     std::string list;
     while (q && q.step() == SQLITE_ROW) list += q.text(0) + "\n";
-    // Renamed over the old list but not synced: the list is only read to rebuild a damaged
-    // database, the commit it follows is durable on its own (its one fsync), and after a crash the
-    // file holds the old list or the new one whole (the file system writes a file renamed over
-    // another before the rename). A rebuild from the older list misses only what was registered
-    // just before a crash that also damaged the database; syncing the directories registers it again.
-    std::string written = pathsFile() + ".new";
-    int fd = ::open(written.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0644);
-    if (fd < 0) return;
-    bool whole = ::write(fd, list.data(), list.size()) == static_cast<ssize_t>(list.size());
-    ::close(fd);
-    if (!whole || ::rename(written.c_str(), pathsFile().c_str()) != 0) ::unlink(written.c_str());
+    // Not synced: the list is only read to rebuild a damaged database, and the commit it follows
+    // is durable on its own (its one fsync). After a crash the file holds the old list or the new
+    // one; a rebuild from the older list misses only what was registered just before a crash that
+    // also damaged the database, and syncing the directories registers it again.
+    (void)plist::writeFileAtomically(pathsFile(), list, 0644, plist::Durability::Unsynced);
 }
 
 Status Store::write(const WriteBody& body) {
