@@ -236,9 +236,12 @@ Result<std::vector<Explanation>> Extensions::explain(const std::string& hostPath
 
 std::vector<Application> Extensions::applications() {
     std::vector<Application> out;
-    auto registry = corvane::vantry::Registry::openDefault();
-    if (!registry) return out;
-    for (const auto& app : (*registry)->installedApplications()) {
+    if (!registry_) {
+        auto opened = corvane::vantry::Registry::openDefault();
+        if (!opened) return out;
+        registry_ = std::move(*opened);
+    }
+    for (const auto& app : registry_->installedApplications()) {
         if (app->isPlaceholder()) continue;
         std::string path = app->bundlePath();
         out.push_back({app->localizedName().value_or(path.substr(path.rfind('/') + 1)), path});

@@ -17,6 +17,7 @@
 
 #include "Annexa/AXDaemonClient.h"
 #include "platform/value/Value.h"
+#include "platform/vantry/Vantry.h"
 
 namespace annexa::extensions {
 
@@ -103,6 +104,8 @@ public:
 
 private:
     AXDaemonClient client_;
+    // Opened once, on first use: it follows other writers' changes itself.
+    std::unique_ptr<corvane::vantry::Registry> registry_;
     struct Watch;
     std::unique_ptr<Watch> watch_;
 };
