@@ -6,6 +6,7 @@
 #include "Annexa/AXSandboxExtension.h"
 #include "platform/layout/Layout.h"
 #include "platform/rpx/Wire.h"
+#include "platform/sandbox/Sandbox.h"
 
 namespace annexa {
 
@@ -152,8 +153,15 @@ Dictionary AXDPlugIn::issueResourceExtensions(const Value& resources) const {
     for (const Value& entry : list) {
         const std::string* name = entry.asString();
         if (!name) continue;
-        std::string resource = *name == "." ? path() : path() + "/" + *name;
-        if (auto token = issueReadExtensionForURL(resource)) {
+        // The bundle itself is the registry's path, resolved when it was registered: no look at
+        // the file system for it (the broker refuses the token should a link stand on it since).
+        // A named resource may lead anywhere, and is resolved now.
+        bool bundle = *name == ".";
+        std::string resource = bundle ? path() : path() + "/" + *name;
+        auto token = bundle ? corvane::sandbox::issueFileReadExtension(corvane::sandbox::kReadOnlyClass, resource,
+                                                                        corvane::sandbox::kResolvedPath)
+                            : issueReadExtensionForURL(resource);
+        if (token) {
             result.insert_or_assign(*name, Value(*token));
         } else {
             log::info(logOps(), "failed to make extension for %@ in plug-in at %@: %{public}s", resource, path(),

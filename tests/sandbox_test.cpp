@@ -115,10 +115,47 @@ TEST(Sandbox, TheBrokerInAnotherProcessGrantsExactlyTheTokensPath) {
     std::string altered = token;
     altered[altered.size() - 1] = altered.back() == 'a' ? 'b' : 'a';
     EXPECT_EQ(sb::consumeExtension(altered), -1);
-    // A symbolic link put in the granted file's place is not followed.
+    // A symbolic link put in the granted file's place is not followed, nor one put in place of a
+    // directory on its way.
     std::filesystem::remove(root / "granted.txt");
     std::filesystem::create_symlink(root / "bundle/Info.plist", root / "granted.txt");
     EXPECT_EQ(sb::consumeExtension(token), -1);
+    std::string throughLink = *sb::issueFileReadExtension(sb::kReadOnlyClass, root / "bundle/Info.plist", sb::kCanonicalPath);
+    std::filesystem::rename(root / "bundle", root / "elsewhere");
+    std::filesystem::create_directory_symlink(root / "elsewhere", root / "bundle");
+    EXPECT_EQ(sb::consumeExtension(throughLink), -1);
+}
+
+TEST(Sandbox, AResolvedPathIsGrantedAsGivenOnlyWhenPlain) {
+    axtest::PlatformRoot root;
+    std::string missing = root / "not/there/yet";  // not looked at
+    struct Case {
+        std::string path;
+        bool granted;
+    } cases[] = {
+        {missing, true},
+        {"/", true},
+        {"", false},
+        {"relative/path", false},
+        {"/a/../b", false},
+        {"/a/./b", false},
+        {"/a//b", false},
+        {"/a/b/", false},
+        {"/a/..", false},
+        {std::string("/a\0b", 4), false},
+    };
+    for (const auto& c : cases) {
+        auto token = sb::issueFileReadExtension(sb::kReadOnlyClass, c.path, sb::kResolvedPath);
+        ASSERT_EQ(static_cast<bool>(token), c.granted) << c.path;
+        if (!token) {
+            EXPECT_EQ(token.error().code, EINVAL) << c.path;
+            continue;
+        }
+        auto parsed = sb::parseToken(*token);
+        ASSERT_TRUE(parsed) << c.path;
+        EXPECT_EQ(parsed->path, c.path);
+        EXPECT_TRUE(sb::verifyToken(*parsed));
+    }
 }
 
 TEST(Sandbox, ConfinementIsDetected) {

@@ -1,8 +1,10 @@
 #include "platform/sandbox/Sandbox.h"
 
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <sodium.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -115,12 +117,40 @@ std::string nsLink(const std::string& proc, const char* ns) {
     return std::string(buf, static_cast<size_t>(n));
 }
 
+// Absolute, with no empty, "." or ".." component: a path as a resolution gives it.
+bool isPlainAbsolutePath(const std::string& path) {
+    if (path.empty() || path[0] != '/' || path.find('\0') != std::string::npos) return false;
+    if (path == "/") return true;
+    size_t at = 1;
+    for (;;) {
+        size_t end = path.find('/', at);
+        std::string_view part(path.data() + at, (end == std::string::npos ? path.size() : end) - at);
+        if (part.empty() || part == "." || part == "..") return false;
+        if (end == std::string::npos) return true;
+        at = end + 1;
+    }
+}
+
+// Opens the token's path read-only, refusing a symbolic link anywhere on it: the path was canonical
+// when the token was issued, so a link there now was put in place since. Kernels without openat2
+// check the last component only.
+int openGrantedPath(const std::string& path) {
+    open_how how{};
+    how.flags = O_RDONLY | O_CLOEXEC | O_NOFOLLOW;
+    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+    long fd = ::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how);
+    if (fd < 0 && errno == ENOSYS) return ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+    return static_cast<int>(fd);
+}
+
 }  // namespace
 
 Result<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path, unsigned flags) {
     if (!extensionClass || std::strcmp(extensionClass, kReadOnlyClass) != 0) return Error::posix(EINVAL);
     std::string target = path;
-    if (flags & kCanonicalPath) {
+    if (flags & kResolvedPath) {
+        if (!isPlainAbsolutePath(path)) return Error::posix(EINVAL);
+    } else if (flags & kCanonicalPath) {
         auto canonical = layout::canonicalPath(path);
         if (!canonical) return Error::posix(errno);
         target = *canonical;
@@ -205,9 +235,7 @@ Result<std::unique_ptr<Broker>> Broker::start(dispatch::QueuePtr queue) {
             log::notice(sandboxLog(), "refused a sandbox token from pid %d", connection.pid());
             return dict({{"error", "invalid token"}});
         }
-        // The path was canonical when the token was issued: refuse to follow a symbolic link put
-        // in its place since.
-        int fd = ::open(token->path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+        int fd = openGrantedPath(token->path);
         if (fd < 0) return dict({{"error", std::string(std::strerror(errno))}});
         return dict({{"fd", Value(std::make_shared<FileDescriptor>(fd))}});
     });

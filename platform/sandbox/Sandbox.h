@@ -27,10 +27,16 @@ namespace corvane::sandbox {
 inline constexpr const char* kReadOnlyClass = "com.corvane.sandbox.read-only";
 // Resolve the path to its canonical form (symbolic links, "." and "..") before granting.
 inline constexpr unsigned kCanonicalPath = 1;
+// The path is already canonical: resolved by the caller when it recorded it (the registry resolves
+// a bundle's path at registration). Granted as given without a look at the file system; it must be
+// absolute with no "." or ".." component. Should a symbolic link stand anywhere on it by the time
+// the token is consumed, the broker refuses it.
+inline constexpr unsigned kResolvedPath = 2;
 inline constexpr const char* kBrokerEndpoint = "com.corvane.sandbox";
 
 // Issues a token. Refused with a POSIX error when the class is unknown (EINVAL), the path cannot be
-// resolved or does not exist (the system's error), or this user has no token key (EACCES).
+// resolved or does not exist (the system's error; not looked at with kResolvedPath, where a path
+// that is not absolute and plain is EINVAL), or this user has no token key (EACCES).
 Result<std::string> issueFileReadExtension(const char* extensionClass, const std::string& path, unsigned flags);
 
 struct Token {
