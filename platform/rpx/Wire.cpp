@@ -426,7 +426,8 @@ private:
                     if (!key) return std::nullopt;
                     auto e = element(depth + 1);
                     if (!e) return std::nullopt;
-                    d.insert_or_assign(std::move(*key), std::move(*e));
+                    // Keys come sorted from an encoder of maps: each goes at the end.
+                    d.insert_or_assign(d.end(), std::move(*key), std::move(*e));
                 }
                 return Value(std::move(d));
             }
