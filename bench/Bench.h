@@ -4,14 +4,17 @@
 #pragma once
 
 #include <sched.h>
+#include <signal.h>
 #include <spawn.h>
 #include <sys/types.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <string>
 #include <vector>
@@ -86,6 +89,38 @@ inline bool readFull(int fd, char* p, size_t n) {
         if (::write(fd, out.data(), out.size()) != static_cast<ssize_t>(out.size())) break;
     _exit(0);
 }
+
+// Whether the arguments hold `flag` (a flag without a value).
+inline bool hasFlag(int argc, char** argv, const char* flag) {
+    for (int i = 1; i < argc; ++i)
+        if (std::strcmp(argv[i], flag) == 0) return true;
+    return false;
+}
+
+// "--busy": the figures under load. While it lives, a process spins on CPU 1, the core the daemons
+// and the far ends of ping-pongs are pinned to, at the same priority as they are.
+class BusyCore {
+public:
+    explicit BusyCore(bool busy) {
+        if (!busy) return;
+        pid_ = fork();
+        if (pid_ == 0) {
+            pinTo(1);
+            for (;;) __asm__ volatile("");
+        }
+        if (pid_ < 0) pid_ = 0;
+    }
+    ~BusyCore() {
+        if (pid_ <= 0) return;
+        kill(pid_, SIGKILL);
+        waitpid(pid_, nullptr, 0);
+    }
+    BusyCore(const BusyCore&) = delete;
+    BusyCore& operator=(const BusyCore&) = delete;
+
+private:
+    pid_t pid_ = 0;
+};
 
 }  // namespace axbench
 

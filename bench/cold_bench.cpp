@@ -25,11 +25,15 @@ namespace {
 
 struct ColdFigures {
     double coldMs = 0, scanMs = 0;
+    // Parts of coldMs: until the reply had arrived whole, the client's decoding of it, and the
+    // client's freeing of what it decoded.
+    double replyMs = 0, decodeMs = 0, freeMs = 0;
     size_t forms = 0, scanned = 0;
 };
 
-// Three cold starts and three warm scans of one corpus of `plugins`; medians.
-bool measure(int plugins, const std::string& bin, ColdFigures& out) {
+// Three cold starts and three warm scans of one corpus of `plugins`; medians. With `busy`, the
+// other core spins throughout the measurements (not while the corpus is made).
+bool measure(int plugins, const std::string& bin, bool busy, ColdFigures& out) {
     char tmpl[] = "/tmp/axbench-cold.XXXXXX";
     std::string root = mkdtemp(tmpl);
     setenv("CORVANE_ROOT", root.c_str(), 1);
@@ -39,7 +43,8 @@ bool measure(int plugins, const std::string& bin, ColdFigures& out) {
     (void)plist::writeXMLFile(annotationFile, dict({{"version", 16}, {"data", Value(corpus.annotations)}}));
     std::string endpoint = rpx::endpointPath(annexa::kDefaultServiceName);
 
-    std::vector<double> cold, scan;
+    std::vector<double> cold, scan, replied, decoded, freed;
+    axbench::BusyCore load(busy);
     for (int run = 0; run < 3; ++run) {
         auto start = std::chrono::steady_clock::now();
         axbench::pinTo(1);  // the daemon on the other core
@@ -50,6 +55,8 @@ bool measure(int plugins, const std::string& bin, ColdFigures& out) {
         {
             annexa::AXDaemonClient client;
             auto reply = client.wait([&](auto done) { client.matchPlugIns(Value(), 0, done); });
+            auto arrived = std::chrono::steady_clock::now();
+            replied.push_back(axbench::microsSince(start) / 1000);
             const Array* forms = reply.value[annexa::message::kMatches].asArray();
             if (!reply.ok() || !forms) {
                 kill(axd, SIGKILL);
@@ -58,6 +65,10 @@ bool measure(int plugins, const std::string& bin, ColdFigures& out) {
             // Read completely: every form decoded, as a host that lists them does.
             for (const Value& form : *forms) (void)form["identifier"].asString(), (void)form["version"];
             out.forms = forms->size();
+            decoded.push_back(axbench::microsSince(arrived) / 1000);
+            auto read = std::chrono::steady_clock::now();
+            reply = {};
+            freed.push_back(axbench::microsSince(read) / 1000);
         }
         cold.push_back(axbench::microsSince(start) / 1000);
         kill(axd, SIGTERM);
@@ -74,28 +85,36 @@ bool measure(int plugins, const std::string& bin, ColdFigures& out) {
     std::filesystem::remove_all(root, ignored);
     out.coldMs = axbench::percentile(cold, 50);
     out.scanMs = axbench::percentile(scan, 50);
+    out.replyMs = axbench::percentile(replied, 50);
+    out.decodeMs = axbench::percentile(decoded, 50);
+    out.freeMs = axbench::percentile(freed, 50);
     return true;
 }
 
 int runCold(int argc, char** argv) {
     int plugins = 10000;
-    for (int i = 1; i + 1 < argc; i += 2)
+    for (int i = 1; i + 1 < argc; ++i)
         if (std::strcmp(argv[i], "--plugins") == 0) plugins = std::max(1000, std::atoi(argv[i + 1]));
+    bool busy = axbench::hasFlag(argc, argv, "--busy");
     setenv("CORVANE_LOG", "error", 1);
     axbench::pinTo(0);
     std::string self = std::filesystem::read_symlink("/proc/self/exe");
     std::string bin = self.substr(0, self.rfind('/'));
     ColdFigures small, large;
-    if (!measure(1000, bin, small) || !measure(plugins, bin, large)) {
+    if (!measure(1000, bin, busy, small) || !measure(plugins, bin, busy, large)) {
         std::fprintf(stderr, "axbench cold: axd gave no answer with every plug-in\n");
         return 1;
     }
     double perSmall = small.coldMs * 1000 / 1000, perLarge = large.coldMs * 1000 / plugins;
-    std::printf("at 1000: cold %.1f ms (%zu forms), host scan %.1f ms; at %d: cold %.1f ms (%zu forms), host scan %.1f ms\n",
-                small.coldMs, small.forms, small.scanMs, plugins, large.coldMs, large.forms, large.scanMs);
-    std::printf("RESULT cold n=%d cold_ms=%.1f scan_ms=%.1f ratio=%.2f per_plugin_us=%.1f per_plugin_1000_us=%.1f "
-                "growth=%.2f\n",
-                plugins, large.coldMs, large.scanMs, large.coldMs / large.scanMs, perLarge, perSmall, perLarge / perSmall);
+    std::printf("at 1000: cold %.1f ms (%zu forms), host scan %.1f ms\n", small.coldMs, small.forms, small.scanMs);
+    std::printf("at %d: cold %.1f ms (%zu forms): the reply whole after %.1f ms, the client's decoding %.1f ms, its "
+                "freeing %.1f ms; host scan %.1f ms%s\n",
+                plugins, large.coldMs, large.forms, large.replyMs, large.decodeMs, large.freeMs, large.scanMs,
+                busy ? " (the other core busy)" : "");
+    std::printf("RESULT cold n=%d busy=%d cold_ms=%.1f scan_ms=%.1f ratio=%.2f per_plugin_us=%.1f "
+                "per_plugin_1000_us=%.1f growth=%.2f reply_ms=%.1f decode_ms=%.1f free_ms=%.1f\n",
+                plugins, busy ? 1 : 0, large.coldMs, large.scanMs, large.coldMs / large.scanMs, perLarge, perSmall,
+                perLarge / perSmall, large.replyMs, large.decodeMs, large.freeMs);
     return 0;
 }
 

@@ -11,6 +11,7 @@
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -32,9 +33,10 @@ constexpr size_t kPingBytes = 160;
 
 int readyBench(int argc, char** argv) {
     int requests = 300;
-    for (int i = 1; i + 1 < argc; i += 2) {
+    for (int i = 1; i + 1 < argc; ++i) {
         if (std::strcmp(argv[i], "--requests") == 0) requests = std::atoi(argv[i + 1]);
     }
+    bool busy = axbench::hasFlag(argc, argv, "--busy");
     // The ping-pong's far end, forked before this process has any thread.
     int pair[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return 1;
@@ -81,6 +83,8 @@ int readyBench(int argc, char** argv) {
         return 1;
     }
     UUID uuid = record->uuid();
+    std::optional<axbench::BusyCore> load;
+    load.emplace(busy);
     std::vector<double> ready;
     for (int i = 0; i < requests + 20; ++i) {
         auto start = std::chrono::steady_clock::now();
@@ -100,6 +104,7 @@ int readyBench(int argc, char** argv) {
         axbench::readFull(pair[0], in.data(), in.size());
         if (i >= 200) ping.push_back(axbench::microsSince(start));
     }
+    load.reset();
     close(pair[0]);
     waitpid(echoPid, nullptr, 0);
     for (pid_t pid : {daemon, spawnd}) {
@@ -109,8 +114,9 @@ int readyBench(int argc, char** argv) {
     fs::remove_all(root);
     std::printf("%d warm readies of one plug-in (axd -> spawnd registration each time), ping-pong of %zu bytes\n",
                 requests, kPingBytes);
-    std::printf("RESULT ready p50_us=%.0f p99_us=%.0f pingpong_p50_us=%.0f\n", axbench::percentile(ready, 50),
-                axbench::percentile(ready, 99), axbench::percentile(ping, 50));
+    double readyP50 = axbench::percentile(ready, 50), pingP50 = axbench::percentile(ping, 50);
+    std::printf("RESULT ready busy=%d p50_us=%.0f p99_us=%.0f pingpong_p50_us=%.0f ratio=%.2f\n", busy ? 1 : 0, readyP50,
+                axbench::percentile(ready, 99), pingP50, readyP50 / pingP50);
     return 0;
 }
 

@@ -21,8 +21,9 @@ constexpr int kPerApp = 100;
 
 int runRegistry(int argc, char** argv) {
     int plugins = 10000;
-    for (int i = 1; i + 1 < argc; i += 2)
+    for (int i = 1; i + 1 < argc; ++i)
         if (std::strcmp(argv[i], "--plugins") == 0) plugins = std::max(kPerApp, std::atoi(argv[i + 1]));
+    bool busy = axbench::hasFlag(argc, argv, "--busy");
     char tmpl[] = "/tmp/axbench-registry.XXXXXX";
     std::string root = mkdtemp(tmpl);
     setenv("CORVANE_ROOT", root.c_str(), 1);
@@ -58,6 +59,8 @@ int runRegistry(int argc, char** argv) {
         return 1;
     }
     auto& registry = **opened;
+    axbench::pinTo(0);
+    axbench::BusyCore load(busy);
     auto start = std::chrono::steady_clock::now();
     for (const auto& app : apps) {
         if (corvane::Status registered = registry.registerBundle(app); !registered.ok()) {
@@ -113,8 +116,8 @@ int runRegistry(int argc, char** argv) {
     std::printf("database on disk: %.1f MB\n", databaseMB);
     std::printf("lookup by UUID (uncached): p50 %.1f us; by path: p50 %.1f us\n", uuidP50, pathP50);
     std::printf("query for one extension point (10 answers, uncached): p50 %.1f us\n", queryP50);
-    std::printf("RESULT registry n=%zu register_s=%.2f db_mb=%.1f uuid_us=%.1f path_us=%.1f query10_us=%.1f\n", all.size(),
-                registerSeconds, databaseMB, uuidP50, pathP50, queryP50);
+    std::printf("RESULT registry n=%zu busy=%d register_s=%.2f db_mb=%.1f uuid_us=%.1f path_us=%.1f query10_us=%.1f\n",
+                all.size(), busy ? 1 : 0, registerSeconds, databaseMB, uuidP50, pathP50, queryP50);
     return 0;
 }
 
