@@ -477,25 +477,44 @@ TEST(Vantry, RecordsWrittenAsPropertyListsReadAsTheBinaryOnes) {
     std::string stored(static_cast<const char*>(sqlite3_column_blob(st, 0)), sqlite3_column_bytes(st, 0));
     sqlite3_finalize(st);
     EXPECT_EQ(stored.substr(0, vantry::kRecordMarker.size()), vantry::kRecordMarker);
-    EXPECT_EQ(*vantry::decodeRecord(stored), binary);
+    // The row names the application: its record is not kept again with every plug-in.
+    Value row = *vantry::decodeRecord(stored);
+    EXPECT_FALSE(row.has("application"));
+    EXPECT_EQ(row["info"], binary["info"]);  // the SDK's canonical form changed the plug-in dictionary
 
+    // A plug-in dictionary that is the Info.plist's own is kept once, and read back in both places.
+    Dictionary fields = *binary.asDictionary();
+    Dictionary info = *binary["info"].asDictionary();
+    info["KSExtension"] = binary["plugin"];
+    fields["info"] = Value(info);
+    Value same(fields);
+    Dictionary leanInfo = info;
+    leanInfo.erase("KSExtension");
+    Dictionary lean = fields;
+    lean["info"] = Value(leanInfo);
+    lean["infoLacksPlugIn"] = Value(true);
+
+    std::string application = *vantry::encodeRecord(share->containingApplication()->serialize());
     struct Case {
         std::string name, plugIn, application;
-        bool readable;
+        Value read;  // null: no record
     };
     for (const Case& c : std::vector<Case>{
-             {"XML rows of an earlier release", *plist::toXML(binary), *plist::toXML(share->containingApplication()->serialize()), true},
-             {"a marker and garbage", std::string(vantry::kRecordMarker) + "\x0b\xff", std::string(vantry::kRecordMarker), false},
-             {"neither encoding", "not a record", "nor this", false},
+             {"what this release wrote", stored, application, binary},
+             {"XML rows of an earlier release", *plist::toXML(binary), *plist::toXML(share->containingApplication()->serialize()),
+              *plist::parse(*plist::toXML(binary))},  // as far as XML carries it (dates in whole seconds)
+             {"a binary row of an earlier release, the application inside", *vantry::encodeRecord(binary), application, binary},
+             {"the plug-in dictionary kept once", *vantry::encodeRecord(Value(lean)), application, same},
+             {"a marker and garbage", std::string(vantry::kRecordMarker) + "\x0b\xff", std::string(vantry::kRecordMarker), Value()},
+             {"neither encoding", "not a record", "nor this", Value()},
          }) {
         rewrite("plugins", c.plugIn);
         rewrite("applications", c.application);
         r.dropCaches();
         auto read = r.plugInForUUID(share->uuid());
-        EXPECT_EQ(bool(read), c.readable) << c.name;
-        // The same record, as far as XML carries it (dates in whole seconds).
+        ASSERT_EQ(bool(read), !c.read.isNull()) << c.name;
         if (read) {
-            EXPECT_EQ(read->serialize(), *plist::parse(*plist::toXML(binary))) << c.name;
+            EXPECT_EQ(read->serialize(), c.read) << c.name;
         }
     }
     sqlite3_close(db);

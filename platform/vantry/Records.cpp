@@ -39,6 +39,27 @@ Value PlugInRecord::serialize() const {
     return Value(std::move(d));
 }
 
+namespace {
+
+// The mark of an Info.plist stored without its plug-in dictionary ("KSExtension").
+constexpr const char* kInfoLacksPlugIn = "infoLacksPlugIn";
+
+}  // namespace
+
+Value PlugInRecord::storedForm(bool withApplication) const {
+    Value whole = serialize();
+    Dictionary d = *whole.asDictionary();
+    if (!withApplication) d.erase("application");
+    const Value* own = info_.find("KSExtension");
+    if (own && *own == plugin_) {
+        Dictionary lean = *info_.asDictionary();
+        lean.erase("KSExtension");
+        d["info"] = Value(std::move(lean));
+        d[kInfoLacksPlugIn] = Value(true);
+    }
+    return Value(std::move(d));
+}
+
 PlugInRecordPtr PlugInRecord::deserialize(const Value& v, ApplicationRecordPtr application) {
     auto uuid = UUID::parse(stringAt(v, "uuid").value_or(""));
     auto path = stringAt(v, "path");
@@ -52,6 +73,11 @@ PlugInRecordPtr PlugInRecord::deserialize(const Value& v, ApplicationRecordPtr a
     r->bundleVersion_ = stringAt(v, "version").value_or("");
     r->plugin_ = v["plugin"];
     r->info_ = v["info"];
+    if (v[kInfoLacksPlugIn].isTrue() && r->info_.isDictionary()) {
+        Dictionary info = *r->info_.asDictionary();
+        info.insert_or_assign("KSExtension", r->plugin_);
+        r->info_ = Value(std::move(info));
+    }
     r->entitlements_ = v["entitlements"].isDictionary() ? v["entitlements"] : Value(Dictionary{});
     if (const Date* d = v["registered"].asDate()) r->registered_ = *d;
     r->system_ = v["system"].isTrue();

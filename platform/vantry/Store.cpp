@@ -320,7 +320,7 @@ Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath,
                   "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
                   " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
     if (!ins) return sqlError("preparing an insert");
-    auto record = encodeRecord(r->serialize());
+    auto record = encodeRecord(r->storedForm(false));
     if (!record) return refusal("plug-in metadata that cannot be recorded in " + r->bundlePath());
     ins.bind(1, r->uuid().string());
     ins.bind(2, r->bundlePath());
@@ -351,7 +351,7 @@ Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath,
 Status Store::journal(JournalKind kind, const std::vector<PlugInRecordPtr>& records) {
     if (records.empty()) return {};
     Array list;
-    for (const auto& r : records) list.push_back(r->serialize());
+    for (const auto& r : records) list.push_back(r->storedForm(true));
     auto encoded = encodeRecord(Value(std::move(list)));
     if (!encoded) return refusal("plug-in metadata that cannot be journalled");
     Statement ins(db_, "INSERT INTO journal (kind, records, at) VALUES (?, ?, ?)");

@@ -58,8 +58,14 @@ public:
     // The value of a key in the attributes, the plug-in dictionary, or the whole Info.plist.
     Value lookup(Scope scope, std::string_view key) const;
 
-    // All of the record as one dictionary (the journal keeps uninstalled records this way).
+    // All of the record as one dictionary.
     Value serialize() const;
+    // As the database keeps it: serialize() without what is there twice. The Info.plist leaves out
+    // its plug-in dictionary when that is the record's own (as it is unless the extension point's
+    // SDK or the canonical form changed it), and a mark says to put it back; a row of the plug-ins
+    // table leaves out the application, which the row names (the journal keeps it).
+    Value storedForm(bool withApplication) const;
+    // Reads either form.
     static PlugInRecordPtr deserialize(const Value& v, ApplicationRecordPtr application);
     std::string description() const;
 
