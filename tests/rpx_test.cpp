@@ -249,6 +249,7 @@ TEST(RpxWire, LargeFramesDecodeTheirElementsOnFirstLookWithTheSameResult) {
     for (int i = 0; i < 200; ++i) {
         forms.push_back(dict({{"identifier", "com.example.plugin" + std::to_string(i)},
                               {"path", std::string(600, 'p')},
+                              {"info", dict({{"text", std::string(200, 'i')}})},
                               {"nested", dict({{"list", Value(Array{Value(1), Value("two"), Value(3.5)})}})}}));
     }
     forms.push_back(dict({{"small", true}}));
@@ -266,6 +267,9 @@ TEST(RpxWire, LargeFramesDecodeTheirElementsOnFirstLookWithTheSameResult) {
     ASSERT_TRUE(got);
     EXPECT_TRUE((*got)[0].encoding()) << "a large element of it stays encoded in turn";
     EXPECT_FALSE(got->back().encoding()) << "a small one is decoded at once";
+    const Value& form = (*got)[0];
+    EXPECT_TRUE(form["info"].encoding()) << "an entry of a kept element from 128 bytes on stays encoded too";
+    EXPECT_FALSE(form["nested"].encoding()) << "a smaller entry is decoded with its element";
     EXPECT_EQ((*got)[0].kind(), Value::Kind::Dictionary);
     EXPECT_EQ((*got)[0].kindsInside() & (1u << static_cast<unsigned>(Value::Kind::Null)), 0u);
     EXPECT_EQ(f.body, body);

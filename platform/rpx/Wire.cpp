@@ -180,20 +180,25 @@ inline bool isAscii(std::string_view s) {
 }
 
 // Array elements and dictionary values of at least this many bytes in a large frame are decoded
-// when first looked at.
+// when first looked at; at the deepest level kept so (the entries of each form of a "match"
+// reply: its Info.plist, its plug-in dictionary, its read tokens), from a smaller size, so that
+// a host that reads a form's identifier and name does not build the rest.
 constexpr size_t kLazyElementBytes = 512;
+constexpr size_t kLazyInnerElementBytes = 128;
 // Frames from this size on are decoded lazily (their payload is kept for the elements). A frame of
 // a few large elements already gains: a host that asks for ten plug-ins and looks at one of them
 // decodes one.
 constexpr size_t kLazyFrameBytes = 4 * 1024;
 
 Value decodeValidated(const Value::Encoding& encoding);
+template <size_t Levels>
 Value decodeKeepingElements(const Value::Encoding& encoding);
 
 // How deep below a frame's body values may be kept encoded: the body's own values (a reply's
-// "matches") and their elements (each form). Every level of keeping walks the kept bytes once more
-// to check them, so the levels are few: what a peer sends costs a bounded number of walks.
-constexpr size_t kLazyLevels = 2;
+// "matches"), their elements (each form) and theirs (a form's entries). Every level of keeping
+// walks the kept bytes once more to check them, so the levels are few: what a peer sends costs a
+// bounded number of walks.
+constexpr size_t kLazyLevels = 3;
 
 class Decoder {
 public:
@@ -343,7 +348,8 @@ private:
         size_t start = pos_;
         auto shape = skip(depth);
         if (!shape) return std::nullopt;
-        if (pos_ - start < kLazyElementBytes || (shape->kinds & bit(Value::Kind::Fd))) {
+        size_t least = depth < lazyLevels_ ? kLazyElementBytes : kLazyInnerElementBytes;
+        if (pos_ - start < least || (shape->kinds & bit(Value::Kind::Fd))) {
             pos_ = start;
             return value(depth);
         }
@@ -352,8 +358,18 @@ private:
                                .bytes = s_.substr(start, pos_ - start),
                                .nesting = shape->nesting,
                                .kindsInside = shape->kinds,
-                               .decode = depth < lazyLevels_ ? decodeKeepingElements : decodeValidated,
+                               .decode = decoderKeeping(lazyLevels_ - depth),
                                .pieces = nullptr});
+    }
+
+    // The decoder of an element kept encoded, which keeps its own elements encoded down to
+    // `levels` more levels.
+    static Value (*decoderKeeping(size_t levels))(const Value::Encoding&) {
+        switch (levels) {
+            case 0: return decodeValidated;
+            case 1: return decodeKeepingElements<1>;
+            default: return decodeKeepingElements<2>;
+        }
     }
 
     std::optional<Value> value(size_t depth) {
@@ -457,9 +473,10 @@ Value decodeJoined(const Value::Encoding& encoding) {
     return v ? std::move(*v) : Value();
 }
 
-// Decodes a value of the frame's body, keeping its own large elements encoded in turn.
+// Decodes a value kept encoded, keeping its own large elements encoded in turn, down to `Levels`.
+template <size_t Levels>
 Value decodeKeepingElements(const Value::Encoding& encoding) {
-    auto v = Decoder(encoding.bytes, kNoFds, SIZE_MAX, encoding.buffer, 1).all();
+    auto v = Decoder(encoding.bytes, kNoFds, SIZE_MAX, encoding.buffer, Levels).all();
     return v ? std::move(*v) : Value();
 }
 
