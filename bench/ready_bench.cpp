@@ -11,7 +11,6 @@
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
-#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -83,8 +82,7 @@ int readyBench(int argc, char** argv) {
         return 1;
     }
     UUID uuid = record->uuid();
-    std::optional<axbench::BusyCore> load;
-    load.emplace(busy);
+    axbench::BusyCore load(busy);
     std::vector<double> ready;
     for (int i = 0; i < requests + 20; ++i) {
         auto start = std::chrono::steady_clock::now();
@@ -104,7 +102,6 @@ int readyBench(int argc, char** argv) {
         axbench::readFull(pair[0], in.data(), in.size());
         if (i >= 200) ping.push_back(axbench::microsSince(start));
     }
-    load.reset();
     close(pair[0]);
     waitpid(echoPid, nullptr, 0);
     for (pid_t pid : {daemon, spawnd}) {
