@@ -142,7 +142,7 @@ Status checkBundle(const std::string& given) {
     return {};
 }
 
-Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool makeContainer) {
+Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool recordContainer) {
     auto read = readPlugInInfo(path);
     if (!read) return read.error();
     const Value& info = *read;
@@ -158,10 +158,11 @@ Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool makeContainer) {
     s.entitlements = codesign::entitlementsOfBundle(path);
     s.system = layout::isBeneath(path, layout::systemRoot());
     if (!(s.plugin["KSExtensionProtocol"] == Value("#Data"))) {
-        auto container = makeContainer ? containers::lookupDataContainer(containers::kPlugInDataClass, s.identifier, true)
-                                       : containers::dataContainerPath(containers::kPlugInDataClass, s.identifier);
+        // Only named here: the service manager makes the container when it first launches the
+        // plug-in, so registering thousands of plug-ins creates no directory.
+        auto container = containers::dataContainerPath(containers::kPlugInDataClass, s.identifier);
         if (!container) return refusal("no data container for " + path + ": " + container.error().description());
-        if (makeContainer) s.container = *container;
+        if (recordContainer) s.container = *container;
     }
     LocalizedNames names = localizedNames(path, info);
     s.name = names.display;

@@ -111,9 +111,10 @@ Result<Value> readPlugInInfo(const std::string& path);
 // unreadable (a FIFO, a link, too large), malformed (with the parser's place), or no dictionary.
 Result<Value> readInfoDictionary(const std::string& bundlePath);
 // Reads one plug-in bundle. Refused when it cannot be read or has no identifier. With
-// `makeContainer` the registering user's data container is made and recorded; without, the
-// identifier is only checked to name one (each reader of a shared registry has its own).
-Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool makeContainer = true);
+// `recordContainer` the path of the registering user's data container is recorded (it is made at
+// the plug-in's first launch); without, the identifier is only checked to name one (each reader of
+// a shared registry has its own).
+Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool recordContainer = true);
 // The plug-in bundles under an application's PlugIns/, canonical and in order; refused on a link
 // loop or an unreadable entry.
 Result<std::vector<std::string>> plugInPathsOf(const std::string& appPath);
