@@ -140,6 +140,24 @@ TEST(Vantry, RegisterReadBackUnregisterWithAnObserverInAnotherProcess) {
     EXPECT_TRUE(r.installedPlugIns().empty());
 }
 
+// An observer that was stopped while a bundle came and went gets both events, with the records,
+// though the installed plug-ins' rows are gone by the time it reads them.
+TEST(Vantry, AnObserverAwayWhileABundleCameAndWentGetsBothEvents) {
+    Fixture f;
+    axtest::Process watch({axtest::binary("vantry"), "watch"});
+    ASSERT_TRUE(watch.waitForOut("watching")) << watch.err();
+    watch.signal(SIGSTOP);
+    ASSERT_EQ(f.vantry({"register", f.app}).status, 0);
+    ASSERT_EQ(f.vantry({"unregister", f.app}).status, 0);
+    watch.signal(SIGCONT);
+    ASSERT_TRUE(watch.waitForOut("uninstall event: 3 plug-in(s)")) << watch.out();
+    std::string out = watch.out();
+    size_t install = out.find("install event: 3 plug-in(s)");
+    ASSERT_NE(install, std::string::npos) << out;
+    EXPECT_LT(install, out.find("uninstall event")) << out;
+    EXPECT_EQ(countOf(out, " com.example.share " + f.app + "/PlugIns/Share.appex"), 2u) << out;
+}
+
 // The indexed columns hold versionKey(text), so an index lookup finds exactly the texts that the
 // exact test's numeric-aware comparison calls equal.
 TEST(Vantry, TheIndexKeyIsEqualExactlyWhereTheVersionComparisonIs) {

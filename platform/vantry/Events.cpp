@@ -73,25 +73,55 @@ void Store::startWatcher() {
     watcherId_.store(watcher_.get_id());
 }
 
+std::vector<JournalEntry> Store::newJournalEntries() {
+    std::vector<JournalEntry> entries;
+    std::vector<Array> named;  // per install entry, what it names: UUIDs (records, before this release)
+    std::unordered_map<std::string, PlugInRecordPtr> removed;
+    // One read transaction: an installed plug-in whose row is gone was removed by a later entry
+    // that this read sees too, and which keeps its record.
+    if (!exec("BEGIN").ok()) return entries;
+    Statement q(db_, "SELECT seq, kind, records FROM journal WHERE seq > ? ORDER BY seq");
+    q.bind(1, lastSeq_);
+    while (q && q.step() == SQLITE_ROW) {
+        lastSeq_ = q.integer(0);
+        JournalEntry entry{static_cast<JournalKind>(q.integer(1)), {}};
+        auto list = decodeRecord(q.blob(2));
+        Array items = list && list->isArray() ? *list->asArray() : Array{};
+        if (entry.kind == JournalKind::Uninstall) {
+            for (const Value& v : items) {
+                if (auto r = PlugInRecord::deserialize(v, nullptr)) {
+                    removed.emplace(r->uuid().string(), r);
+                    entry.records.push_back(std::move(r));
+                }
+            }
+            items.clear();
+        }
+        named.push_back(std::move(items));
+        entries.push_back(std::move(entry));
+    }
+    q.reset();
+    for (size_t i = 0; i < entries.size(); ++i) {
+        for (const Value& v : named[i]) {
+            PlugInRecordPtr r;
+            if (const std::string* uuid = v.asString()) {
+                r = recordByUUIDText(*uuid);
+                if (auto gone = removed.find(*uuid); !r && gone != removed.end()) r = gone->second;
+            } else {
+                r = PlugInRecord::deserialize(v, nullptr);
+            }
+            if (r) entries[i].records.push_back(std::move(r));
+        }
+    }
+    (void)exec("COMMIT");
+    return entries;
+}
+
 void Store::deliverNewEvents() {
-    struct Entry {
-        JournalKind kind;
-        std::vector<PlugInRecordPtr> records;
-    };
-    std::vector<Entry> entries;
+    std::vector<JournalEntry> entries;
     {
         MutexLock lock(mutex_);
-        Statement q(db_, "SELECT seq, kind, records FROM journal WHERE seq > ? ORDER BY seq");
-        q.bind(1, lastSeq_);
-        while (q && q.step() == SQLITE_ROW) {
-            lastSeq_ = q.integer(0);
-            auto list = decodeRecord(q.blob(2));
-            std::vector<PlugInRecordPtr> records;
-            if (list && list->isArray())
-                for (const Value& v : *list->asArray())
-                    if (auto r = PlugInRecord::deserialize(v, nullptr)) records.push_back(r);
-            entries.push_back(Entry{static_cast<JournalKind>(q.integer(1)), std::move(records)});
-        }
+        checkFreshness();
+        entries = newJournalEntries();
     }
     MutexLock round(deliveryMutex_);
     for (const auto& entry : entries) {

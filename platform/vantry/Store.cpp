@@ -350,8 +350,11 @@ Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath,
 
 Status Store::journal(JournalKind kind, const std::vector<PlugInRecordPtr>& records) {
     if (records.empty()) return {};
+    // An uninstalled plug-in's row is gone with this transaction: its entry keeps the record. An
+    // installed one's row holds it; its entry names it by UUID (newJournalEntries).
     Array list;
-    for (const auto& r : records) list.push_back(r->storedForm(true));
+    for (const auto& r : records)
+        list.push_back(kind == JournalKind::Uninstall ? r->storedForm(true) : Value(r->uuid().string()));
     auto encoded = encodeRecord(Value(std::move(list)));
     if (!encoded) return refusal("plug-in metadata that cannot be journalled");
     Statement ins(db_, "INSERT INTO journal (kind, records, at) VALUES (?, ?, ?)");

@@ -152,6 +152,12 @@ struct Events {
 // The kind of a journal entry, as stored.
 enum class JournalKind : int64_t { Install = 1, Uninstall = 2 };
 
+// A journal entry as observers get it.
+struct JournalEntry {
+    JournalKind kind;
+    std::vector<PlugInRecordPtr> records;
+};
+
 // A plug-in row as registration compares it.
 struct StoredPlugIn {
     std::string uuid;
@@ -258,6 +264,8 @@ private:
     std::vector<std::string> registeredPathsLocked() REQUIRES(mutex_);
 
     void startWatcher() REQUIRES(observersMutex_);
+    // The journal's entries after the last one read, with their records.
+    std::vector<JournalEntry> newJournalEntries() REQUIRES(mutex_);
     void deliverNewEvents() EXCLUDES(mutex_, observersMutex_);
 
     const std::string path_;
