@@ -133,14 +133,15 @@ std::optional<std::string> Bundle::property(int number) const {
     switch (number) {
         case kPropertyBundlePath:
         case kPropertySupportPath: return path_;
-        case kPropertyExecutablePath: {
-            Value info = infoDictionary();
-            const std::string* named = info["KFBundleExecutable"].asString();
-            if (!named || named->empty() || named->find('/') != std::string::npos) return std::nullopt;
-            return path_ + "/" + *named;
-        }
+        case kPropertyExecutablePath: return executablePathIn(path_, infoDictionary());
         default: return std::nullopt;
     }
+}
+
+std::optional<std::string> executablePathIn(const std::string& bundlePath, const Value& info) {
+    const std::string* named = info["KFBundleExecutable"].asString();
+    if (!named || named->empty() || named->find('/') != std::string::npos) return std::nullopt;
+    return bundlePath + "/" + *named;
 }
 
 Value Bundle::infoDictionary() const {

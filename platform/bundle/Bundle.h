@@ -57,6 +57,10 @@ private:
     mutable std::optional<Value> info_ GUARDED_BY(mutex_);
 };
 
+// The executable that the Info.plist `info` names in the bundle at `bundlePath`: its
+// "KFBundleExecutable", which must be a plain file name; nullopt when it names none.
+std::optional<std::string> executablePathIn(const std::string& bundlePath, const Value& info);
+
 // Reads the Info.plist of the bundle directory `path` without caching anything (null when it
 // cannot be read; readPropertyListOfBundle says why).
 Value readInfoPlist(const std::string& path);

@@ -344,12 +344,19 @@ Verification verifyExecutable(const std::string& path) {
 Verification verifyBundle(const std::string& bundlePath) {
     auto b = bundle::Bundle::openPath(bundlePath);
     if (!b) return invalid(bundlePath, "not a bundle");
-    if (auto exe = b->property(bundle::kPropertyExecutablePath)) return verifyExecutable(*exe);
-    return verifyContents(*b->property(bundle::kPropertyBundlePath));
+    return verifyBundle(*b->property(bundle::kPropertyBundlePath), b->infoDictionary());
+}
+
+Verification verifyBundle(const std::string& canonicalPath, const Value& info) {
+    if (auto exe = bundle::executablePathIn(canonicalPath, info)) return verifyExecutable(*exe);
+    return verifyContents(canonicalPath);
 }
 
 Value entitlementsOfExecutable(const std::string& path) { return verifyExecutable(path).entitlements; }
 Value entitlementsOfBundle(const std::string& bundlePath) { return verifyBundle(bundlePath).entitlements; }
+Value entitlementsOfBundle(const std::string& canonicalPath, const Value& info) {
+    return verifyBundle(canonicalPath, info).entitlements;
+}
 
 namespace {
 

@@ -41,9 +41,12 @@ struct Verification {
 Verification verifyExecutable(const std::string& path);
 // The verification of a bundle's executable, or of its contents when it has none.
 Verification verifyBundle(const std::string& bundlePath);
+// The same for a bundle at a canonical path whose Info.plist the caller has read (`info`).
+Verification verifyBundle(const std::string& canonicalPath, const Value& info);
 // The verified entitlements (a dictionary, empty when there are none).
 Value entitlementsOfExecutable(const std::string& path);
 Value entitlementsOfBundle(const std::string& bundlePath);
+Value entitlementsOfBundle(const std::string& canonicalPath, const Value& info);
 
 // Why code its signature does not cover may run in the process `pid` (whose executable is the file
 // `exe`), or nothing: it was started with LD_PRELOAD, LD_LIBRARY_PATH or LD_AUDIT, or it has an

@@ -105,16 +105,23 @@ Result<Value> readPlugInInfo(const std::string& path) {
 Result<std::vector<std::string>> plugInPathsOf(const std::string& appPath) {
     std::vector<std::string> paths;
     std::string plugInsDir = appPath + "/PlugIns";
-    DIR* d = opendir(plugInsDir.c_str());
+    auto canonicalDir = layout::canonicalPath(plugInsDir);
+    DIR* d = canonicalDir ? opendir(canonicalDir->c_str()) : nullptr;
     if (!d) return paths;
-    std::vector<std::string> names;
+    // A directory entry of the canonical PlugIns/ is canonical as it is; a link (or an entry whose
+    // type the file system does not say) is resolved.
+    std::vector<std::pair<std::string, bool>> names;
     while (struct dirent* e = readdir(d)) {
         std::string n = e->d_name;
-        if (n.size() > 6 && n.substr(n.size() - 6) == ".appex") names.push_back(n);
+        if (n.size() > 6 && n.substr(n.size() - 6) == ".appex") names.emplace_back(n, e->d_type == DT_DIR);
     }
     closedir(d);
     std::sort(names.begin(), names.end());
-    for (const auto& n : names) {
+    for (const auto& [n, directory] : names) {
+        if (directory) {
+            paths.push_back(*canonicalDir + "/" + n);
+            continue;
+        }
         auto p = layout::canonicalPath(plugInsDir + "/" + n);
         if (!p) {
             return refusal((errno == ELOOP ? "symbolic link loop under PlugIns/: " : "unreadable plug-in: ") +
@@ -155,7 +162,7 @@ Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool recordContainer) 
     auto resolved = sdk::resolve(info);
     s.info = resolved.info;
     s.plugin = resolved.plugin;
-    s.entitlements = codesign::entitlementsOfBundle(path);
+    s.entitlements = codesign::entitlementsOfBundle(path, info);
     s.system = layout::isBeneath(path, layout::systemRoot());
     if (!(s.plugin["KSExtensionProtocol"] == Value("#Data"))) {
         // Only named here: the service manager makes the container when it first launches the
