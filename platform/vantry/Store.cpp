@@ -97,6 +97,7 @@ Store::~Store() {
     {
         MutexLock lock(mutex_);
         dataVersion_.reset();
+        kept_.clear();
     }
     sqlite3_close_v2(db_);
 }
@@ -111,6 +112,12 @@ Error Store::sqlError(const char* what) const {
     if (rc == SQLITE_CORRUPT || rc == SQLITE_NOTADB)
         text = "registry database " + path_ + " is damaged (" + sqlite3_errmsg(db_) + "); run `vantry rebuild`";
     return Error{kDomain, rc, text};
+}
+
+StatementUse Store::kept(const char* sql) {
+    auto& statement = kept_[sql];
+    if (!statement) statement = std::make_unique<Statement>(db_, sql, SQLITE_PREPARE_PERSISTENT);
+    return StatementUse(*statement);
 }
 
 Status Store::exec(const char* sql) {
@@ -316,35 +323,35 @@ uint64_t Store::contentVersion() {
 // ---- registration
 
 Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint) {
-    Statement ins(db_,
-                  "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
-                  " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
+    StatementUse ins = kept(
+        "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
+        " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
     if (!ins) return sqlError("preparing an insert");
     auto record = encodeRecord(r->storedForm(false));
     if (!record) return refusal("plug-in metadata that cannot be recorded in " + r->bundlePath());
-    ins.bind(1, r->uuid().string());
-    ins.bind(2, r->bundlePath());
+    ins->bind(1, r->uuid().string());
+    ins->bind(2, r->bundlePath());
     if (appPath.empty()) {
-        ins.bindNull(3);
+        ins->bindNull(3);
     } else {
-        ins.bind(3, appPath);
+        ins->bind(3, appPath);
     }
-    ins.bind(4, r->identifier());
+    ins->bind(4, r->identifier());
     // The entitlements are part of the record; the column of the first schema stays, empty.
-    ins.bindBlob(5, "", 0);
-    ins.bindBlob(6, record->data(), record->size());
+    ins->bindBlob(5, "", 0);
+    ins->bindBlob(6, record->data(), record->size());
     for (int k = 0; k < 3; ++k) {
         Subject subject = k == 0 ? Subject{SubjectKind::Text, r->identifier()}
                                  : subjectOf(r->pluginDictionary(), r->infoDictionary(), kIndexedKeys[k].key);
-        ins.bind(7 + 2 * k, static_cast<int64_t>(subject.kind));
+        ins->bind(7 + 2 * k, static_cast<int64_t>(subject.kind));
         if (subject.kind == SubjectKind::Text) {
-            ins.bind(8 + 2 * k, versionKey(subject.text));
+            ins->bind(8 + 2 * k, versionKey(subject.text));
         } else {
-            ins.bindNull(8 + 2 * k);
+            ins->bindNull(8 + 2 * k);
         }
     }
-    ins.bind(13, fingerprint);
-    if (ins.step() != SQLITE_DONE) return sqlError("recording a plug-in");
+    ins->bind(13, fingerprint);
+    if (ins->step() != SQLITE_DONE) return sqlError("recording a plug-in");
     return {};
 }
 
@@ -384,9 +391,9 @@ PlugInRecordPtr Store::recordByUUIDText(const std::string& uuid) {
 }
 
 Status Store::deletePlugIn(const std::string& uuid) {
-    Statement del(db_, "DELETE FROM plugins WHERE uuid = ?");
-    del.bind(1, uuid);
-    if (del.step() != SQLITE_DONE) return sqlError("removing a plug-in");
+    StatementUse del = kept("DELETE FROM plugins WHERE uuid = ?");
+    del->bind(1, uuid);
+    if (del->step() != SQLITE_DONE) return sqlError("removing a plug-in");
     return {};
 }
 

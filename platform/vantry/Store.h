@@ -44,7 +44,7 @@ std::optional<Value> decodeRecord(std::string_view bytes);
 
 struct Statement {
     sqlite3_stmt* s = nullptr;
-    Statement(sqlite3* db, const char* sql) { sqlite3_prepare_v2(db, sql, -1, &s, nullptr); }
+    Statement(sqlite3* db, const char* sql, unsigned flags = 0) { sqlite3_prepare_v3(db, sql, -1, flags, &s, nullptr); }
     ~Statement() { sqlite3_finalize(s); }
     Statement(const Statement&) = delete;
     Statement& operator=(const Statement&) = delete;
@@ -64,6 +64,24 @@ struct Statement {
         return {static_cast<const char*>(sqlite3_column_blob(s, i)), static_cast<size_t>(sqlite3_column_bytes(s, i))};
     }
     int64_t integer(int i) const { return sqlite3_column_int64(s, i); }
+};
+
+// One use of a statement the store keeps prepared: when the use ends it is reset and its
+// bindings cleared, so that it holds no read transaction meanwhile.
+class StatementUse {
+public:
+    explicit StatementUse(Statement& statement) : statement_(statement) {}
+    ~StatementUse() {
+        statement_.reset();
+        sqlite3_clear_bindings(statement_.s);
+    }
+    StatementUse(const StatementUse&) = delete;
+    StatementUse& operator=(const StatementUse&) = delete;
+    Statement* operator->() const { return &statement_; }
+    explicit operator bool() const { return bool(statement_); }
+
+private:
+    Statement& statement_;
 };
 
 // ---- indexed keys and the numeric-aware key
@@ -110,7 +128,7 @@ Result<Value> readPlugInInfo(const std::string& path);
 // The bundle's Info.plist as a dictionary, or a refusal that says what is wrong and where: missing,
 // unreadable (a FIFO, a link, too large), malformed (with the parser's place), or no dictionary.
 Result<Value> readInfoDictionary(const std::string& bundlePath);
-// Reads one plug-in bundle. Refused when it cannot be read or has no identifier. With
+// Reads one plug-in bundle at a canonical path. Refused when it cannot be read or has no identifier. With
 // `recordContainer` the path of the registering user's data container is recorded (it is made at
 // the plug-in's first launch); without, the identifier is only checked to name one (each reader of
 // a shared registry has its own).
@@ -223,6 +241,8 @@ private:
     std::string pathsFile() const { return path_ + ".paths"; }
 
     Error sqlError(const char* what) const;
+    // The statement of `sql` (a literal: kept by its address), prepared at its first use.
+    StatementUse kept(const char* sql) REQUIRES(mutex_);
     Status exec(const char* sql);
     Result<int> schemaVersion();
     // For a reader that may not migrate: the schema must be this release's.
@@ -279,6 +299,7 @@ private:
     // Answers of queries by their SQL and arguments; a few hundred at most.
     std::unordered_map<std::string, Rows> rows_ GUARDED_BY(mutex_);
     std::unique_ptr<Statement> dataVersion_ GUARDED_BY(mutex_);
+    std::unordered_map<const char*, std::unique_ptr<Statement>> kept_ GUARDED_BY(mutex_);
     // Announcements of other writers' commits (the wake file), and when the data version was
     // last asked.
     std::unique_ptr<notify::ChangeWatch> commits_ GUARDED_BY(mutex_);
