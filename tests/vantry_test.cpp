@@ -495,9 +495,13 @@ TEST(Vantry, RecordsWrittenAsPropertyListsReadAsTheBinaryOnes) {
     std::string stored(static_cast<const char*>(sqlite3_column_blob(st, 0)), sqlite3_column_bytes(st, 0));
     sqlite3_finalize(st);
     EXPECT_EQ(stored.substr(0, vantry::kRecordMarker.size()), vantry::kRecordMarker);
-    // The row names the application: its record is not kept again with every plug-in.
+    // The row keeps nothing its columns hold or reading derives: the application (app_path names
+    // it), the UUID, path and identifier, the data container, and the identifiers and version
+    // that the Info.plist says.
     Value row = *vantry::decodeRecord(stored);
-    EXPECT_FALSE(row.has("application"));
+    for (const char* key : {"application", "uuid", "path", "identifier", "container", "bundleIdentifier",
+                            "originalIdentifier", "version"})
+        EXPECT_FALSE(row.has(key)) << key;
     EXPECT_EQ(row["info"], binary["info"]);  // the SDK's canonical form changed the plug-in dictionary
 
     // A plug-in dictionary that is the Info.plist's own is kept once, and read back in both places.

@@ -89,7 +89,8 @@ std::vector<JournalEntry> Store::newJournalEntries() {
         Array items = list && list->isArray() ? *list->asArray() : Array{};
         if (entry.kind == JournalKind::Uninstall) {
             for (const Value& v : items) {
-                if (auto r = PlugInRecord::deserialize(v, nullptr)) {
+                if (auto r = PlugInRecord::read(v, nullptr, {})) {
+                    nameReadersContainer(*r);
                     removed.emplace(r->uuid().string(), r);
                     entry.records.push_back(std::move(r));
                 }
@@ -107,7 +108,7 @@ std::vector<JournalEntry> Store::newJournalEntries() {
                 r = recordByUUIDText(*uuid);
                 if (auto gone = removed.find(*uuid); !r && gone != removed.end()) r = gone->second;
             } else {
-                r = PlugInRecord::deserialize(v, nullptr);
+                r = PlugInRecord::deserialize(v, nullptr);  // an entry of an earlier release
             }
             if (r) entries[i].records.push_back(std::move(r));
         }

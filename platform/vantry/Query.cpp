@@ -75,7 +75,7 @@ std::vector<PlugInRecordPtr> Store::query(
     {
         MutexLock lock(mutex_);
         checkFreshness();
-        rows = rowsOf("SELECT uuid, record, ifnull(app_path, '') FROM plugins " + where +
+        rows = rowsOf(std::string(kRecordColumns) + where +
                           " ORDER BY path",
                       args);
     }

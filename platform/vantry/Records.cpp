@@ -44,12 +44,23 @@ namespace {
 // The mark of an Info.plist stored without its plug-in dictionary ("KSExtension").
 constexpr const char* kInfoLacksPlugIn = "infoLacksPlugIn";
 
+// What reading derives for the fields a stored form leaves out when they are so.
+std::string infoText(const Value& info, const char* key) { return stringAt(info, key).value_or(""); }
+std::string originalIdentifierOf(const std::string& bundleIdentifier, const std::string& identifier) {
+    return bundleIdentifier.empty() ? identifier : bundleIdentifier;
+}
+
 }  // namespace
 
-Value PlugInRecord::storedForm(bool withApplication) const {
+Value PlugInRecord::storedForm(StoredIn where) const {
     Value whole = serialize();
     Dictionary d = *whole.asDictionary();
-    if (!withApplication) d.erase("application");
+    if (where == StoredIn::Table)
+        for (const char* key : {"application", "uuid", "path", "identifier"}) d.erase(key);
+    d.erase("container");
+    if (bundleIdentifier_ == infoText(info_, "KFBundleIdentifier")) d.erase("bundleIdentifier");
+    if (bundleVersion_ == infoText(info_, "KFBundleVersion")) d.erase("version");
+    if (originalIdentifier_ == originalIdentifierOf(bundleIdentifier_, identifier_)) d.erase("originalIdentifier");
     const Value* own = info_.find("KSExtension");
     if (own && *own == plugin_) {
         Dictionary lean = *info_.asDictionary();
@@ -60,17 +71,23 @@ Value PlugInRecord::storedForm(bool withApplication) const {
     return Value(std::move(d));
 }
 
-PlugInRecordPtr PlugInRecord::deserialize(const Value& v, ApplicationRecordPtr application) {
-    auto uuid = UUID::parse(stringAt(v, "uuid").value_or(""));
-    auto path = stringAt(v, "path");
-    if (!uuid || !path) return nullptr;
+PlugInRecordPtr PlugInRecord::deserialize(const Value& v, ApplicationRecordPtr application, const Columns& columns) {
+    return read(v, std::move(application), columns);
+}
+
+std::shared_ptr<PlugInRecord> PlugInRecord::read(const Value& v, ApplicationRecordPtr application,
+                                                 const Columns& columns) {
+    auto text = [&](const char* key, std::string_view column) {
+        auto stored = stringAt(v, key);
+        return stored ? *stored : std::string(column);
+    };
+    auto uuid = UUID::parse(text("uuid", columns.uuid));
+    std::string path = text("path", columns.path);
+    if (!uuid || path.empty()) return nullptr;
     auto r = std::make_shared<PlugInRecord>();
     r->uuid_ = *uuid;
-    r->bundlePath_ = *path;
-    r->identifier_ = stringAt(v, "identifier").value_or("");
-    r->bundleIdentifier_ = stringAt(v, "bundleIdentifier").value_or("");
-    r->originalIdentifier_ = stringAt(v, "originalIdentifier").value_or("");
-    r->bundleVersion_ = stringAt(v, "version").value_or("");
+    r->bundlePath_ = std::move(path);
+    r->identifier_ = text("identifier", columns.identifier);
     r->plugin_ = v["plugin"];
     r->info_ = v["info"];
     if (v[kInfoLacksPlugIn].isTrue() && r->info_.isDictionary()) {
@@ -78,6 +95,10 @@ PlugInRecordPtr PlugInRecord::deserialize(const Value& v, ApplicationRecordPtr a
         info.insert_or_assign("KSExtension", r->plugin_);
         r->info_ = Value(std::move(info));
     }
+    r->bundleIdentifier_ = stringAt(v, "bundleIdentifier").value_or(infoText(r->info_, "KFBundleIdentifier"));
+    r->bundleVersion_ = stringAt(v, "version").value_or(infoText(r->info_, "KFBundleVersion"));
+    r->originalIdentifier_ =
+        stringAt(v, "originalIdentifier").value_or(originalIdentifierOf(r->bundleIdentifier_, r->identifier_));
     r->entitlements_ = v["entitlements"].isDictionary() ? v["entitlements"] : Value(Dictionary{});
     if (const Date* d = v["registered"].asDate()) r->registered_ = *d;
     r->system_ = v["system"].isTrue();

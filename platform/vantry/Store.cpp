@@ -203,7 +203,7 @@ Store::Rows Store::rowsOf(const std::string& sql, const std::vector<std::string>
     for (size_t i = 0; i < args.size(); ++i) q.bind(static_cast<int>(i + 1), args[i]);
     auto rows = std::make_shared<std::vector<PlugInRecordPtr>>();
     while (q && q.step() == SQLITE_ROW) {
-        if (auto record = recordFromRow(q.text(0), q.blob(1), q.text(2))) rows->push_back(std::move(record));
+        if (auto record = recordFromRow(q)) rows->push_back(std::move(record));
     }
     // Hosts ask a handful of different questions; a flood of distinct ones must not grow memory.
     if (rows_.size() >= 256) rows_.clear();
@@ -234,34 +234,33 @@ ApplicationRecordPtr Store::appFromRow(const std::string& appPath) {
     return app;
 }
 
-PlugInRecordPtr Store::recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath) {
-    auto uuid = UUID::parse(uuidText);
+PlugInRecordPtr Store::recordFromRow(const Statement& row) {
+    auto uuid = UUID::parse(row.text(0));
     if (!uuid) return nullptr;
     auto it = byUUID_.find(*uuid);
     if (it != byUUID_.end()) return it->second;
-    auto v = decodeRecord(blob);
+    auto v = decodeRecord(row.blob(1));
     if (!v) return nullptr;
-    if (options_.shared) v = withReadersContainer(std::move(*v));
+    std::string appPath = row.text(2), path = row.text(3), identifier = row.text(4);
     ApplicationRecordPtr app = appPath.empty() ? nullptr : appFromRow(appPath);
-    auto r = PlugInRecord::deserialize(*v, app);
-    if (r) byUUID_[*uuid] = r;
+    auto r = PlugInRecord::read(*v, app, {row.text(0), path, identifier});
+    if (!r) return nullptr;
+    nameReadersContainer(*r);
+    byUUID_[*uuid] = r;
     return r;
 }
 
-Value Store::withReadersContainer(Value serialized) {
-    const Dictionary* fields = serialized.asDictionary();
-    if (!fields || serialized["plugin"]["KSExtensionProtocol"] == Value("#Data")) return serialized;
-    auto container = containers::dataContainerPath(containers::kPlugInDataClass, stringAt(serialized, "identifier").value_or(""));
-    if (!container) return serialized;
-    Dictionary d = *fields;
-    d["container"] = Value(*container);
-    return Value(std::move(d));
+void Store::nameReadersContainer(PlugInRecord& r) {
+    r.container_.reset();
+    if (r.plugin_["KSExtensionProtocol"] == Value("#Data")) return;
+    if (auto container = containers::dataContainerPath(containers::kPlugInDataClass, r.identifier_))
+        r.container_ = *container;
 }
 
 std::vector<PlugInRecordPtr> Store::selectPlugIns(const std::string& where, const std::vector<std::string>& args) {
     MutexLock lock(mutex_);
     checkFreshness();
-    return *rowsOf("SELECT uuid, record, ifnull(app_path, '') FROM plugins " + where, args);
+    return *rowsOf(std::string(kRecordColumns) + where, args);
 }
 
 std::vector<PlugInRecordPtr> Store::plugInsOf(const std::string& appPath) {
@@ -327,7 +326,7 @@ Status Store::insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath,
         "INSERT INTO plugins (uuid, path, app_path, identifier, entitlements, record, k_id_kind, k_id,"
         " k_point_kind, k_point, k_name_kind, k_name, fingerprint) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?)");
     if (!ins) return sqlError("preparing an insert");
-    auto record = encodeRecord(r->storedForm(false));
+    auto record = encodeRecord(r->storedForm(PlugInRecord::StoredIn::Table));
     if (!record) return refusal("plug-in metadata that cannot be recorded in " + r->bundlePath());
     ins->bind(1, r->uuid().string());
     ins->bind(2, r->bundlePath());
@@ -361,7 +360,7 @@ Status Store::journal(JournalKind kind, const std::vector<PlugInRecordPtr>& reco
     // installed one's row holds it; its entry names it by UUID (newJournalEntries).
     Array list;
     for (const auto& r : records)
-        list.push_back(kind == JournalKind::Uninstall ? r->storedForm(true) : Value(r->uuid().string()));
+        list.push_back(kind == JournalKind::Uninstall ? r->storedForm(PlugInRecord::StoredIn::Journal) : Value(r->uuid().string()));
     auto encoded = encodeRecord(Value(std::move(list)));
     if (!encoded) return refusal("plug-in metadata that cannot be journalled");
     Statement ins(db_, "INSERT INTO journal (kind, records, at) VALUES (?, ?, ?)");
@@ -384,10 +383,10 @@ std::map<std::string, StoredPlugIn> Store::existing(const char* where, const std
 }
 
 PlugInRecordPtr Store::recordByUUIDText(const std::string& uuid) {
-    Statement q(db_, "SELECT uuid, record, ifnull(app_path, '') FROM plugins WHERE uuid = ?");
+    Statement q(db_, (std::string(kRecordColumns) + "WHERE uuid = ?").c_str());
     q.bind(1, uuid);
     if (q.step() != SQLITE_ROW) return nullptr;
-    return recordFromRow(q.text(0), q.blob(1), q.text(2));
+    return recordFromRow(q);
 }
 
 Status Store::deletePlugIn(const std::string& uuid) {

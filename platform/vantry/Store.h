@@ -42,6 +42,10 @@ inline constexpr std::string_view kRecordMarker{"\0vr1", 4};
 std::optional<std::string> encodeRecord(const Value& record);
 std::optional<Value> decodeRecord(std::string_view bytes);
 
+// What a read of plug-in records selects, before its condition: the columns recordFromRow reads.
+inline constexpr std::string_view kRecordColumns =
+    "SELECT uuid, record, ifnull(app_path, ''), path, identifier FROM plugins ";
+
 struct Statement {
     sqlite3_stmt* s = nullptr;
     Statement(sqlite3* db, const char* sql, unsigned flags = 0) { sqlite3_prepare_v3(db, sql, -1, flags, &s, nullptr); }
@@ -253,15 +257,14 @@ private:
     void forgetRecords() REQUIRES(mutex_);
     // One row of a query's answer, as the query's filter sees it.
     using Rows = std::shared_ptr<const std::vector<PlugInRecordPtr>>;
-    // The records of a SELECT of uuid, record and app path (in that order), from memory while the
-    // database has not changed. A record carries the identifier and entitlements that the table
-    // keeps beside it for its indexes.
+    // The records of a SELECT of kRecordColumns, from memory while the database has not changed.
     Rows rowsOf(const std::string& sql, const std::vector<std::string>& args) REQUIRES(mutex_);
     ApplicationRecordPtr appFromRow(const std::string& appPath) REQUIRES(mutex_);
-    // A shared registry's record names no container; each reader's is its own.
-    static Value withReadersContainer(Value serialized);
-    PlugInRecordPtr recordFromRow(const std::string& uuidText, std::string_view blob, const std::string& appPath)
-        REQUIRES(mutex_);
+    // The record of a row of kRecordColumns.
+    PlugInRecordPtr recordFromRow(const Statement& row) REQUIRES(mutex_);
+    // A record names no data container as stored; each reader's is its own (a shared registry
+    // has many readers).
+    static void nameReadersContainer(PlugInRecord& r);
     Status insertPlugIn(const PlugInRecordPtr& r, const std::string& appPath, const std::string& fingerprint)
         REQUIRES(mutex_);
     Status journal(JournalKind kind, const std::vector<PlugInRecordPtr>& records) REQUIRES(mutex_);

@@ -60,16 +60,29 @@ public:
 
     // All of the record as one dictionary.
     Value serialize() const;
-    // As the database keeps it: serialize() without what is there twice. The Info.plist leaves out
-    // its plug-in dictionary when that is the record's own (as it is unless the extension point's
-    // SDK or the canonical form changed it), and a mark says to put it back; a row of the plug-ins
-    // table leaves out the application, which the row names (the journal keeps it).
-    Value storedForm(bool withApplication) const;
-    // Reads either form.
-    static PlugInRecordPtr deserialize(const Value& v, ApplicationRecordPtr application);
+    // Where a stored form is kept: a row of the plug-ins table, whose columns hold the UUID, path
+    // and identifier and name the application, or a journal entry, which must stand alone.
+    enum class StoredIn { Table, Journal };
+    // As the database keeps it: serialize() without what is there twice or follows from the rest.
+    // The Info.plist leaves out its plug-in dictionary when that is the record's own (as it is
+    // unless the extension point's SDK or the canonical form changed it), and a mark says to put
+    // it back. The bundle identifier, version and original identifier are left out when they are
+    // what reading derives from the rest; the data container always is (each reader's follows
+    // from the identifier). A row also leaves out what its columns hold.
+    Value storedForm(StoredIn where) const;
+    // What a table row keeps beside its stored form.
+    struct Columns {
+        std::string_view uuid, path, identifier;
+    };
+    // Reads either form, or serialize()'s (a form without a data container leaves it to the
+    // reader to name).
+    static PlugInRecordPtr deserialize(const Value& v, ApplicationRecordPtr application, const Columns& columns = {});
     std::string description() const;
 
 private:
+    // deserialize(), the record still to be completed by its reader.
+    static std::shared_ptr<PlugInRecord> read(const Value& v, ApplicationRecordPtr application, const Columns& columns);
+
     friend class Store;
     friend PlugInRecordPtr makeRecord(const struct ScannedPlugIn& s, const ApplicationRecordPtr& app);
     UUID uuid_;
