@@ -7,6 +7,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <array>
 #include <cerrno>
 #include <climits>
 #include <cstdio>
@@ -34,19 +35,27 @@ std::string keyPath() { return layout::userDataDir() + "/sandbox/token.key"; }
 
 std::optional<Bytes> readOrMakeKey(const std::string& path);
 
-// The key of the current platform root, read once per process: a daemon issues a read token for
-// nearly every plug-in of a discovery reply.
-std::optional<Bytes> secretKey() {
+// The key of the current platform root, read once per process (a daemon issues a read token for
+// nearly every plug-in of a discovery reply), with the MAC's state after the key: each token's MAC
+// then hashes only its own message.
+struct TokenKey {
+    Bytes key;
+    crypto_auth_hmacsha512256_state keyed;
+};
+
+const TokenKey* secretKey() {
     static Mutex mutex;
-    static auto* known = new std::map<std::string, Bytes>();  // for the process's life
-    if (sodium_init() < 0) return std::nullopt;
+    static auto* known = new std::map<std::string, TokenKey>();  // for the process's life
+    if (sodium_init() < 0) return nullptr;
     std::string path = keyPath();
     MutexLock lock(mutex);
     auto it = known->find(path);
-    if (it != known->end()) return it->second;
+    if (it != known->end()) return &it->second;
     auto key = readOrMakeKey(path);
-    if (key) known->emplace(path, *key);
-    return key;
+    if (!key) return nullptr;
+    TokenKey made{*key, {}};
+    crypto_auth_hmacsha512256_init(&made.keyed, made.key.data(), made.key.size());
+    return &known->emplace(path, std::move(made)).first->second;
 }
 
 // The user's secret key, made on first use. Two processes making it at once agree: the file is
@@ -79,15 +88,15 @@ std::optional<Bytes> readOrMakeKey(const std::string& path) {
     return std::nullopt;
 }
 
-std::string hex(const void* data, size_t size) {
+void appendHex(std::string& out, const void* data, size_t size) {
     static const char* digits = "0123456789abcdef";
     const auto* p = static_cast<const uint8_t*>(data);
-    std::string s;
+    size_t at = out.size();
+    out.resize(at + 2 * size);
     for (size_t i = 0; i < size; ++i) {
-        s.push_back(digits[p[i] >> 4]);
-        s.push_back(digits[p[i] & 15]);
+        out[at++] = digits[p[i] >> 4];
+        out[at++] = digits[p[i] & 15];
     }
-    return s;
 }
 
 std::optional<std::string> unhex(std::string_view text) {
@@ -103,10 +112,18 @@ std::optional<std::string> unhex(std::string_view text) {
     return out;
 }
 
-Bytes macOf(const Bytes& key, const std::string& extensionClass, const std::string& path) {
-    std::string message = extensionClass + ";" + path;
-    Bytes mac(crypto_auth_BYTES);
-    crypto_auth(mac.data(), reinterpret_cast<const unsigned char*>(message.data()), message.size(), key.data());
+// The MAC of "<class>;<path>" under the key.
+std::array<unsigned char, crypto_auth_BYTES> macOf(const TokenKey& key, std::string_view extensionClass,
+                                                   std::string_view path) {
+    crypto_auth_hmacsha512256_state state = key.keyed;
+    auto update = [&](std::string_view part) {
+        crypto_auth_hmacsha512256_update(&state, reinterpret_cast<const unsigned char*>(part.data()), part.size());
+    };
+    update(extensionClass);
+    update(";");
+    update(path);
+    std::array<unsigned char, crypto_auth_BYTES> mac{};
+    crypto_auth_hmacsha512256_final(&state, mac.data());
     return mac;
 }
 
@@ -158,11 +175,16 @@ Result<std::string> issueFileReadExtension(const char* extensionClass, const std
         struct stat st {};
         if (::stat(path.c_str(), &st) != 0) return Error::posix(errno);
     }
-    auto key = secretKey();
+    const TokenKey* key = secretKey();
     if (!key) return Error::posix(EACCES);
-    Bytes mac = macOf(*key, extensionClass, target);
-    return std::string(extensionClass) + ";" + hex(target.data(), target.size()) + ";" +
-           hex(mac.data(), mac.size());
+    auto mac = macOf(*key, extensionClass, target);
+    std::string token;
+    token.reserve(std::strlen(extensionClass) + 2 * target.size() + 2 * mac.size() + 2);
+    token.append(extensionClass).push_back(';');
+    appendHex(token, target.data(), target.size());
+    token.push_back(';');
+    appendHex(token, mac.data(), mac.size());
+    return token;
 }
 
 std::optional<Token> parseToken(std::string_view text) {
@@ -180,11 +202,11 @@ std::optional<Token> parseToken(std::string_view text) {
 
 bool verifyToken(const Token& token) {
     if (token.extensionClass != kReadOnlyClass) return false;
-    auto key = secretKey();
-    if (!key) return false;
-    std::string message = token.extensionClass + ";" + token.path;
-    return crypto_auth_verify(token.mac.data(), reinterpret_cast<const unsigned char*>(message.data()),
-                              message.size(), key->data()) == 0;
+    const TokenKey* key = secretKey();
+    if (!key || token.mac.size() != crypto_auth_BYTES) return false;
+    auto mac = macOf(*key, token.extensionClass, token.path);
+    static_assert(crypto_auth_BYTES == crypto_verify_32_BYTES);
+    return crypto_verify_32(token.mac.data(), mac.data()) == 0;
 }
 
 int64_t consumeExtension(const std::string& token) {
