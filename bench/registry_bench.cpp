@@ -80,7 +80,8 @@ int runRegistry(int argc, char** argv) {
     opened = vantry::Registry::open(vantry::Registry::defaultPath());
     if (!opened) return 1;
     auto& registry = **opened;
-    double databaseMB = megabytes(vantry::Registry::defaultPath()) + megabytes(vantry::Registry::defaultPath() + "-wal");
+    std::string database = vantry::Registry::defaultPath();
+    double databaseMB = megabytes(database) + megabytes(database + "-wal");
 
     auto all = registry.installedPlugIns();
     registry.dropCaches();
@@ -118,7 +119,8 @@ int runRegistry(int argc, char** argv) {
     double pathP50 = axbench::percentile(byPath, 50);
     double queryP50 = axbench::percentile(query10, 50);
     std::printf("registered %zu plug-ins in %zu applications: %.2f s\n", all.size(), apps.size(), registerSeconds);
-    std::printf("database on disk: %.1f MB (the write-ahead log, while the writer was open: %.1f MB)\n", databaseMB, walMB);
+    std::printf("database on disk: %.1f MB (the write-ahead log, while the writer was open: %.1f MB)\n", databaseMB,
+                walMB);
     std::printf("lookup by UUID (uncached): p50 %.1f us; by path: p50 %.1f us\n", uuidP50, pathP50);
     std::printf("query for one extension point (10 answers, uncached): p50 %.1f us\n", queryP50);
     std::printf("RESULT registry n=%zu busy=%d register_s=%.2f db_mb=%.1f wal_mb=%.1f uuid_us=%.1f path_us=%.1f "

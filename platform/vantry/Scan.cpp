@@ -149,7 +149,7 @@ Status checkBundle(const std::string& given) {
     return {};
 }
 
-Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool recordContainer) {
+Result<ScannedPlugIn> scanPlugIn(const std::string& path) {
     auto read = readPlugInInfo(path);
     if (!read) return read.error();
     const Value& info = *read;
@@ -165,11 +165,11 @@ Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool recordContainer) 
     s.entitlements = codesign::entitlementsOfBundle(path, info);
     s.system = layout::isBeneath(path, layout::systemRoot());
     if (!(s.plugin["KSExtensionProtocol"] == Value("#Data"))) {
-        // Only named here: the service manager makes the container when it first launches the
-        // plug-in, so registering thousands of plug-ins creates no directory.
+        // The identifier must name a container. Each reader names its own from it, and the service
+        // manager makes it at the plug-in's first launch: registering thousands of plug-ins makes
+        // no directory.
         auto container = containers::dataContainerPath(containers::kPlugInDataClass, s.identifier);
         if (!container) return refusal("no data container for " + path + ": " + container.error().description());
-        if (recordContainer) s.container = *container;
     }
     LocalizedNames names = localizedNames(path, info);
     s.name = names.display;
@@ -194,7 +194,6 @@ PlugInRecordPtr makeRecord(const ScannedPlugIn& s, const ApplicationRecordPtr& a
     r->registered_ = Date::now();
     r->system_ = s.system;
     r->application_ = app;
-    r->container_ = s.container;
     r->localizedName_ = s.name;
     r->localizedShortName_ = s.shortName;
     return r;

@@ -235,7 +235,8 @@ ApplicationRecordPtr Store::appFromRow(const std::string& appPath) {
 }
 
 PlugInRecordPtr Store::recordFromRow(const Statement& row) {
-    auto uuid = UUID::parse(row.text(0));
+    std::string uuidText = row.text(0);
+    auto uuid = UUID::parse(uuidText);
     if (!uuid) return nullptr;
     auto it = byUUID_.find(*uuid);
     if (it != byUUID_.end()) return it->second;
@@ -243,7 +244,7 @@ PlugInRecordPtr Store::recordFromRow(const Statement& row) {
     if (!v) return nullptr;
     std::string appPath = row.text(2), path = row.text(3), identifier = row.text(4);
     ApplicationRecordPtr app = appPath.empty() ? nullptr : appFromRow(appPath);
-    auto r = PlugInRecord::read(*v, app, {row.text(0), path, identifier});
+    auto r = PlugInRecord::read(*v, app, {uuidText, path, identifier});
     if (!r) return nullptr;
     nameReadersContainer(*r);
     byUUID_[*uuid] = r;
@@ -359,8 +360,10 @@ Status Store::journal(JournalKind kind, const std::vector<PlugInRecordPtr>& reco
     // An uninstalled plug-in's row is gone with this transaction: its entry keeps the record. An
     // installed one's row holds it; its entry names it by UUID (newJournalEntries).
     Array list;
-    for (const auto& r : records)
-        list.push_back(kind == JournalKind::Uninstall ? r->storedForm(PlugInRecord::StoredIn::Journal) : Value(r->uuid().string()));
+    for (const auto& r : records) {
+        list.push_back(kind == JournalKind::Uninstall ? r->storedForm(PlugInRecord::StoredIn::Journal)
+                                                      : Value(r->uuid().string()));
+    }
     auto encoded = encodeRecord(Value(std::move(list)));
     if (!encoded) return refusal("plug-in metadata that cannot be journalled");
     Statement ins(db_, "INSERT INTO journal (kind, records, at) VALUES (?, ?, ?)");
@@ -448,7 +451,7 @@ Result<ScannedBundle> Store::scanBundle(const std::string& given, bool placehold
     ScannedBundle bundle;
     bundle.path = *path;
     if ((*info)["KSExtension"].isDictionary()) {
-        auto scanned = scanPlugIn(*path, !options_.shared);
+        auto scanned = scanPlugIn(*path);
         if (!scanned) return scanned.error();
         bundle.plugIns.push_back(std::move(*scanned));
         return bundle;
@@ -459,7 +462,7 @@ Result<ScannedBundle> Store::scanBundle(const std::string& given, bool placehold
     auto plugInPaths = plugInPathsOf(*path);
     if (!plugInPaths) return plugInPaths.error();
     for (const auto& p : *plugInPaths) {
-        auto s = scanPlugIn(p, !options_.shared);
+        auto s = scanPlugIn(p);
         if (!s) return s.error();
         bundle.plugIns.push_back(std::move(*s));
     }

@@ -120,7 +120,7 @@ struct ScannedPlugIn {
     std::string fingerprint;  // changes whenever anything the record holds changes
     Value info, plugin, entitlements;
     bool system = false;
-    std::optional<std::string> container, name, shortName;
+    std::optional<std::string> name, shortName;
 };
 
 struct LocalizedNames {
@@ -132,11 +132,9 @@ Result<Value> readPlugInInfo(const std::string& path);
 // The bundle's Info.plist as a dictionary, or a refusal that says what is wrong and where: missing,
 // unreadable (a FIFO, a link, too large), malformed (with the parser's place), or no dictionary.
 Result<Value> readInfoDictionary(const std::string& bundlePath);
-// Reads one plug-in bundle at a canonical path. Refused when it cannot be read or has no identifier. With
-// `recordContainer` the path of the registering user's data container is recorded (it is made at
-// the plug-in's first launch); without, the identifier is only checked to name one (each reader of
-// a shared registry has its own).
-Result<ScannedPlugIn> scanPlugIn(const std::string& path, bool recordContainer = true);
+// Reads one plug-in bundle at a canonical path. Refused when it cannot be read, has no identifier,
+// or (unless a data plug-in) an identifier that names no data container.
+Result<ScannedPlugIn> scanPlugIn(const std::string& path);
 // The plug-in bundles under an application's PlugIns/, canonical and in order; refused on a link
 // loop or an unreadable entry.
 Result<std::vector<std::string>> plugInPathsOf(const std::string& appPath);
