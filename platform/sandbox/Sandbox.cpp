@@ -36,12 +36,9 @@ std::string keyPath() { return layout::userDataDir() + "/sandbox/token.key"; }
 std::optional<Bytes> readOrMakeKey(const std::string& path);
 
 // The key of the current platform root, read once per process (a daemon issues a read token for
-// nearly every plug-in of a discovery reply), with the MAC's state after the key: each token's MAC
-// then hashes only its own message.
-struct TokenKey {
-    Bytes key;
-    crypto_auth_hmacsha512256_state keyed;
-};
+// nearly every plug-in of a discovery reply) and kept as the MAC's state after the key: each
+// token's MAC then hashes only its own message.
+using TokenKey = crypto_auth_hmacsha512256_state;
 
 const TokenKey* secretKey() {
     static Mutex mutex;
@@ -53,9 +50,10 @@ const TokenKey* secretKey() {
     if (it != known->end()) return &it->second;
     auto key = readOrMakeKey(path);
     if (!key) return nullptr;
-    TokenKey made{*key, {}};
-    crypto_auth_hmacsha512256_init(&made.keyed, made.key.data(), made.key.size());
-    return &known->emplace(path, std::move(made)).first->second;
+    TokenKey keyed;
+    crypto_auth_hmacsha512256_init(&keyed, key->data(), key->size());
+    sodium_memzero(key->data(), key->size());
+    return &known->emplace(path, keyed).first->second;
 }
 
 // The user's secret key, made on first use. Two processes making it at once agree: the file is
@@ -115,7 +113,7 @@ std::optional<std::string> unhex(std::string_view text) {
 // The MAC of "<class>;<path>" under the key.
 std::array<unsigned char, crypto_auth_BYTES> macOf(const TokenKey& key, std::string_view extensionClass,
                                                    std::string_view path) {
-    crypto_auth_hmacsha512256_state state = key.keyed;
+    crypto_auth_hmacsha512256_state state = key;
     auto update = [&](std::string_view part) {
         crypto_auth_hmacsha512256_update(&state, reinterpret_cast<const unsigned char*>(part.data()), part.size());
     };
