@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "bench/Bench.h"
+#include "bench/SyncCounter.h"
 #include "platform/plist/Plist.h"
 #include "platform/vantry/Vantry.h"
 
@@ -35,24 +36,28 @@ int runRegistry(int argc, char** argv) {
     for (int a = 0; a * kPerApp < plugins; ++a) {
         std::string app = root + "/Apps/App" + std::to_string(a) + ".app";
         std::filesystem::create_directories(app + "/PlugIns");
-        (void)plist::writeXMLFile(app + "/Info.plist", dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)},
-                                                             {"KFBundleExecutable", "app"}}));
+        (void)plist::writeXMLFile(
+            app + "/Info.plist",
+            dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)}, {"KFBundleExecutable", "app"}}));
         for (int p = 0; p < kPerApp && a * kPerApp + p < plugins; ++p) {
             int n = a * kPerApp + p;
             std::string dir = app + "/PlugIns/P" + std::to_string(p) + ".appex";
             std::filesystem::create_directories(dir);
-            Value attrs = dict({{"KSExtensionPointName", "point" + std::to_string(n % points)},
-                                {"KSExtensionVersion", "1.0"}});
+            Value attrs =
+                dict({{"KSExtensionPointName", "point" + std::to_string(n % points)}, {"KSExtensionVersion", "1.0"}});
             (void)plist::writeXMLFile(dir + "/Info.plist",
-                                dict({{"KFBundleIdentifier", "com.bench.plugin" + std::to_string(n)},
-                                      {"KFBundleExecutable", "plugin"},
-                                      {"KFBundleVersion", "1"},
-                                      {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
-                                                            {"KSExtensionAttributes", attrs}})}}));
+                                      dict({{"KFBundleIdentifier", "com.bench.plugin" + std::to_string(n)},
+                                            {"KFBundleExecutable", "plugin"},
+                                            {"KFBundleVersion", "1"},
+                                            {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
+                                                                  {"KSExtensionAttributes", attrs}})}}));
         }
         apps.push_back(app);
     }
 
+    // Every sync of the registration, the writer's closing checkpoint included, per transaction
+    // (one registerBundle is one).
+    bool counting = axbench::countSqliteSyncs();
     auto opened = vantry::Registry::open(vantry::Registry::defaultPath());
     if (!opened) {
         std::fprintf(stderr, "axbench registry: %s\n", opened.error().description().c_str());
@@ -60,6 +65,7 @@ int runRegistry(int argc, char** argv) {
     }
     axbench::pinTo(0);
     axbench::BusyCore load(busy);
+    auto syncsBefore = axbench::sqliteSyncs();
     auto start = std::chrono::steady_clock::now();
     for (const auto& app : apps) {
         if (corvane::Status registered = (*opened)->registerBundle(app); !registered.ok()) {
@@ -77,6 +83,12 @@ int runRegistry(int argc, char** argv) {
     // writer is gone (its last connection puts the log into the database and removes it).
     double walMB = megabytes(vantry::Registry::defaultPath() + "-wal");
     opened->reset();
+    auto syncsAfter = axbench::sqliteSyncs();
+    auto perTransaction = [&](uint64_t after, uint64_t before) {
+        return counting ? static_cast<double>(after - before) / static_cast<double>(apps.size()) : -1.0;
+    };
+    double syncsPerTransaction = perTransaction(syncsAfter.total(), syncsBefore.total());
+    double logSyncsPerTransaction = perTransaction(syncsAfter.log, syncsBefore.log);
     opened = vantry::Registry::open(vantry::Registry::defaultPath());
     if (!opened) return 1;
     auto& registry = **opened;
@@ -121,11 +133,16 @@ int runRegistry(int argc, char** argv) {
     std::printf("registered %zu plug-ins in %zu applications: %.2f s\n", all.size(), apps.size(), registerSeconds);
     std::printf("database on disk: %.1f MB (the write-ahead log, while the writer was open: %.1f MB)\n", databaseMB,
                 walMB);
+    std::printf(
+        "syncs per transaction (%zu transactions, the writer's closing checkpoint included): %.2f, of "
+        "which of the write-ahead log %.2f\n",
+        apps.size(), syncsPerTransaction, logSyncsPerTransaction);
     std::printf("lookup by UUID (uncached): p50 %.1f us; by path: p50 %.1f us\n", uuidP50, pathP50);
     std::printf("query for one extension point (10 answers, uncached): p50 %.1f us\n", queryP50);
-    std::printf("RESULT registry n=%zu busy=%d register_s=%.2f db_mb=%.1f wal_mb=%.1f uuid_us=%.1f path_us=%.1f "
-                "query10_us=%.1f\n",
-                all.size(), busy ? 1 : 0, registerSeconds, databaseMB, walMB, uuidP50, pathP50, queryP50);
+    std::printf(
+        "RESULT registry n=%zu busy=%d register_s=%.2f db_mb=%.1f wal_mb=%.1f uuid_us=%.1f path_us=%.1f "
+        "query10_us=%.1f fsyncs_per_txn=%.2f\n",
+        all.size(), busy ? 1 : 0, registerSeconds, databaseMB, walMB, uuidP50, pathP50, queryP50, syncsPerTransaction);
     return 0;
 }
 
