@@ -77,6 +77,14 @@ Result<std::shared_ptr<Store>> Store::open(const std::string& path, StoreOptions
     const char* journal = options.shared ? "PRAGMA journal_mode=DELETE" : "PRAGMA journal_mode=WAL";
     if (Status err = store->exec(journal); !err.ok()) return err.error();
     if (Status err = store->exec("PRAGMA foreign_keys=ON"); !err.ok()) return err.error();
+    if (!options.shared) {
+        // Each commit syncs the write-ahead log once; each checkpoint syncs it and the database
+        // again, and the log's restart once more. Checkpointing at 16 MiB of log rather than 4 lets
+        // an application of thousands of plug-ins register with one checkpoint or none, and the
+        // log is cut back to 4 MiB when it restarts, so an idle registry keeps no more on disk.
+        if (Status err = store->exec("PRAGMA wal_autocheckpoint=4096"); !err.ok()) return err.error();
+        if (Status err = store->exec("PRAGMA journal_size_limit=4194304"); !err.ok()) return err.error();
+    }
     if (Status err = store->migrate(); !err.ok()) return err.error();
     // Every user reads the shared registry, whatever the writer's umask.
     if (options.shared && ::chmod(path.c_str(), 0644) != 0) return Error::posix(errno, path);
