@@ -3,17 +3,17 @@
 // declare they replace another identifier mark the forms of that identifier and are marked back.
 //
 // A chosen form that a later registration displaces leaves the answer but not the walk's memory:
-// every form is owned by a shared entry, and the list, the per-identifier index and the override
-// table each hold entries, never positions in a container. So a replacement declared by a form that
-// was displaced afterwards still names it (its UUID), and the mark it would get is written on an
-// entry that no answer shows.
+// every entry stays in one list that only grows, and the per-identifier chains and the override
+// table name entries by their place in it. So a replacement declared by a form that was displaced
+// afterwards still names it (its UUID), and the mark it would get is written on an entry that no
+// answer shows.
 #pragma once
 
 #include <cstdint>
 #include <map>
-#include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -28,12 +28,12 @@ public:
     struct Entry {
         const AXDPlugIn* plugIn;  // owned by the walk's candidates, which outlive the results
         AXDPlugIn::EncodedFormPtr form;
-        std::string identifier;
         std::optional<std::string> overrider;   // the replacing plug-in's UUID text
         std::optional<std::string> overriding;  // the identifier this plug-in replaces
         bool displaced = false;
+        uint32_t nextChosen = kNone;  // the next chosen entry of the same identifier
+        std::string_view identifier() const { return plugIn->walkFacts().identifier; }
     };
-    using EntryPtr = std::shared_ptr<Entry>;
     // Why a plug-in was left out or kept, by plug-in; filled only when the walk explains.
     using Outcomes = std::map<const AXDPlugIn*, std::string>;
 
@@ -49,13 +49,17 @@ public:
     void append(const AXDPlugIn& plugIn, AXDPlugIn::EncodedFormPtr form);
     // The chosen forms in answer order, with the replacement marks set; `overrides` gets (overrider
     // UUID, overridden UUID) for each form marked, for the log.
-    std::vector<EntryPtr> finish(std::vector<std::pair<std::string, std::string>>& overrides);
+    // The entries live as long as the results.
+    std::vector<Entry*> finish(std::vector<std::pair<std::string, std::string>>& overrides);
 
 private:
+    static constexpr uint32_t kNone = UINT32_MAX;
     const uint64_t flags_;
-    std::vector<EntryPtr> order_;  // every appended entry; displaced ones are skipped at the end
-    std::unordered_map<std::string, std::vector<EntryPtr>> byIdentifier_;  // chosen, in answer order
-    std::unordered_map<std::string, EntryPtr> overrides_;  // replaced identifier -> replacing form
+    // Every appended entry; displaced ones are skipped at the end. The keys below are views of
+    // the plug-ins' own walk facts, which outlive the results as the plug-ins do.
+    std::vector<Entry> order_;
+    std::unordered_map<std::string_view, uint32_t> firstChosen_;  // identifier -> chain, answer order
+    std::unordered_map<std::string_view, uint32_t> overrides_;    // replaced identifier -> replacing entry
 };
 
 }  // namespace annexa

@@ -39,7 +39,26 @@ std::shared_ptr<AXDPlugIn> AXDPlugIn::fromRegistryRecord(const corvane::vantry::
                   usable.error().description());
         return nullptr;
     }
+    p->learnWalkFacts();
     return p;
+}
+
+void AXDPlugIn::learnWalkFacts() {
+    walkFacts_.identifier = identifier().value_or("");
+    Value version = this->version();
+    if (const std::string* text = version.asString()) walkFacts_.version = *text;
+    // A name, or a list of names among which anything else is passed over.
+    Value replaces = valueForEntitlement(keys::kReplaceEntitlement);
+    if (const std::string* one = replaces.asString()) {
+        walkFacts_.replaces.push_back(*one);
+        walkFacts_.replacesByName = true;
+    } else if (const Array* many = replaces.asArray()) {
+        for (const Value& e : *many)
+            if (const std::string* name = e.asString()) walkFacts_.replaces.push_back(*name);
+    }
+    walkFacts_.dedicated = isDedicated();
+    walkFacts_.inApplication = containingUrl().has_value();
+    walkFacts_.hostEntitlement = pluginKey(keys::kHostEntitlement);
 }
 
 Value AXDPlugIn::infoKey(std::string_view key) const {
@@ -128,10 +147,8 @@ Value AXDPlugIn::valueForEntitlement(const std::string& key) const { return enti
 
 bool AXDPlugIn::hasEntitlement(const std::string& key) const { return entitlementGranted(valueForEntitlement(key)); }
 
-std::string AXDPlugIn::annotationKey() const {
-    Value replaced = valueForEntitlement(keys::kReplaceEntitlement);
-    if (const std::string* s = replaced.asString()) return *s;
-    return identifier().value_or("");
+const std::string& AXDPlugIn::annotationKey() const {
+    return walkFacts_.replacesByName ? walkFacts_.replaces.front() : walkFacts_.identifier;
 }
 
 void AXDPlugIn::augmentForm(Dictionary& form) const {

@@ -9,6 +9,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <vector>
 
 #include "Annexa/AXPlugInCore.h"
 #include "platform/vantry/Vantry.h"
@@ -43,7 +44,7 @@ public:
     bool hasEntitlement(const std::string& key) const;
     // The key of the plug-in's annotations: the identifier named by its replace-plugin entitlement
     // when that is a string, else its own identifier.
-    std::string annotationKey() const;
+    const std::string& annotationKey() const;
     // Adds "extensions": read tokens for the plug-in's shared resources (the bundle itself for an
     // application extension).
     void augmentForm(Dictionary& form) const;
@@ -109,7 +110,24 @@ public:
     corvane::vantry::PlugInRecordPtr vtproxy() const;
     void setVtproxy(corvane::vantry::PlugInRecordPtr record);
 
+    // What a match walk reads of every candidate, learnt once when the plug-in is made from its
+    // record and not changed after (a changed registration makes a new plug-in). Kept together in
+    // the plug-in itself: a walk over thousands of plug-ins then reads one object for each, where
+    // the lookups behind these (a lock, the record, its dictionaries) cost a cache miss apiece.
+    struct WalkFacts {
+        std::string identifier;             // "" when there is none
+        std::string version;                // the version attribute when it is a string, else ""
+        std::vector<std::string> replaces;  // the names of its replace-plugin entitlement
+        bool replacesByName = false;        // that entitlement is one name (no list)
+        bool dedicated = false;             // its plug-in dictionary's "Dedicated" reads as true
+        bool inApplication = false;         // it has a containing application
+        Value hostEntitlement;              // the entitlement it asks of hosts; null for none
+    };
+    const WalkFacts& walkFacts() const { return walkFacts_; }
+
 private:
+    void learnWalkFacts();
+    WalkFacts walkFacts_;
     mutable corvane::Mutex mutex_;
     corvane::vantry::PlugInRecordPtr vtproxy_ GUARDED_BY(mutex_);
     // Names set on the plug-in itself, made on the first set: most plug-ins have none, and the

@@ -16,7 +16,7 @@ std::optional<std::string> AXDPlugIn::allowForHost(const std::function<Value(con
         if (!restriction.isDictionary()) return std::string("invalid host restriction entitlement");
         if (!match(restriction)) return std::string("the host's plug-in entitlement does not allow this plug-in");
     }
-    Value required = pluginKey(keys::kHostEntitlement);
+    const Value& required = walkFacts().hostEntitlement;
     if (!required.isNull()) {
         // A name that is no string cannot be held: the host is refused. The text shows the name's
         // own characters (a value of another type in its notation).

@@ -30,7 +30,7 @@ namespace {
 // put together from this request's own bytes and the forms where their plug-ins keep them, and the
 // reply goes to the socket so. Null when a form holds a value that a message cannot carry, as the
 // reply conversion would give.
-Value encodeMatches(const std::vector<AXDMatchResults::EntryPtr>& list, const std::vector<Value>& annotations) {
+Value encodeMatches(const std::vector<AXDMatchResults::Entry*>& list, const std::vector<Value>& annotations) {
     namespace wire = corvane::rpx::wire;
     auto own = std::make_shared<std::string>();
     own->reserve(16 + list.size() * 64);
@@ -222,10 +222,10 @@ std::optional<std::string> Transaction::matchRefusal(
     using namespace discovery;
     if (!(flags & kAll)) {
         if (!p.onSystemVolume()) {
-            if (!p.containingUrl()) return std::string("not on the system volume and not inside an application");
+            if (!p.walkFacts().inApplication) return std::string("not on the system volume and not inside an application");
             if (flags & kSystemOnly) return std::string("not on the system volume");
         }
-        if (p.isDedicated()) {
+        if (p.walkFacts().dedicated) {
             auto bundle = explainedHost_ ? explainedHost_->bundle : client_->bundle();
             auto plugIns = bundle ? bundle->plugInsPath() : std::nullopt;
             if (!plugIns || p.path().rfind(*plugIns, 0) != 0) return std::string("dedicated to another application");
@@ -280,7 +280,7 @@ std::shared_ptr<const MatchAnswer> Transaction::walkForMatch(const Value& rules,
         results.append(*p, *encoded);
         if (outcome) outcomes[p.get()] = "returned";
     }
-    std::vector<AXDMatchResults::EntryPtr> chosen = results.finish(answer->overrides);
+    std::vector<AXDMatchResults::Entry*> chosen = results.finish(answer->overrides);
     answer->returned = static_cast<unsigned>(chosen.size());
     // The annotations of the forms that stay, all in one visit to the database.
     std::vector<const AXDPlugIn*> chosenPlugIns;
