@@ -124,6 +124,7 @@ void AXDPlugIn::setLocalizedContainingName(const std::optional<std::string>& v) 
 
 void AXDPlugIn::dropEncodedForm() {
     encodedForm_.reset();
+    exportError_.reset();
     ++formsDropped_;
 }
 
@@ -191,7 +192,8 @@ Dictionary AXDPlugIn::issueResourceExtensions(const Value& resources) const {
 corvane::Result<AXDPlugIn::EncodedFormPtr> AXDPlugIn::encodedForm() const {
     {
         corvane::MutexLock lock(mutex_);
-        if (encodedForm_) return *encodedForm_;
+        if (encodedForm_) return encodedForm_;
+        if (exportError_) return *exportError_;
     }
     // Made outside the lock (the export reads the names under it); two threads may both make it,
     // and the results are the same.
@@ -216,7 +218,11 @@ corvane::Result<AXDPlugIn::EncodedFormPtr> AXDPlugIn::encodedForm() const {
         return EncodedFormPtr(std::move(encoded));
     }();
     corvane::MutexLock lock(mutex_);
-    encodedForm_ = std::make_shared<const corvane::Result<EncodedFormPtr>>(made);
+    if (made) {
+        encodedForm_ = *made;
+    } else {
+        exportError_ = std::make_shared<const corvane::Error>(made.error());
+    }
     return made;
 }
 

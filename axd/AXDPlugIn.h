@@ -139,8 +139,11 @@ private:
     void dropEncodedForm() REQUIRES(mutex_);
     static inline std::atomic<uint64_t> formsDropped_{0};
     std::unique_ptr<SetNames> setNames_ GUARDED_BY(mutex_);
-    // Held through a pointer: an Error inline would make each of thousands of plug-ins 80 bytes larger.
-    mutable std::shared_ptr<const corvane::Result<EncodedFormPtr>> encodedForm_ GUARDED_BY(mutex_);
+    // The kept form, or why the export failed. The form is held inline, so that a walk finds it
+    // in the plug-in itself; the error through a pointer: an Error inline would make each of
+    // thousands of plug-ins 80 bytes larger.
+    mutable EncodedFormPtr encodedForm_ GUARDED_BY(mutex_);
+    mutable std::shared_ptr<const corvane::Error> exportError_ GUARDED_BY(mutex_);
 };
 
 using AXDPlugInPtr = std::shared_ptr<AXDPlugIn>;

@@ -388,9 +388,10 @@ void Transaction::matchPlugIns() {
     bool keepable = !explain && !rulesEntry.encoding();
     KeptAnswers::Key key{client_, rules, flags, version()};
     auto answer = keepable ? keptAnswers().find(key, inputs) : nullptr;
+    bool walked = false;
     if (!answer) {
         answer = walkForMatch(rules, flags, explain, inputs, server().heldPlugIns());
-        giveBackMemoryAfter(answer->raw);
+        walked = true;
         if (keepable) keptAnswers().keep(std::move(key), inputs, answer);
     } else {
         AXD_TRACE(discover__raw, answer->raw);
@@ -405,6 +406,8 @@ void Transaction::matchPlugIns() {
     if (explain) reply()["explanations"] = answer->explanations;
     log::debug(logOps(), "reply marshalled");
     done();
+    // What the walk used is given back once the reply is on its way, not before.
+    if (walked) giveBackMemoryAfter(answer->raw);
 }
 
 }  // namespace annexa
