@@ -36,14 +36,20 @@ AXDPlugInPtr AXDatabase::plugInForProxy(const PlugInRecordPtr& record) {
 std::vector<AXDPlugInPtr> AXDatabase::plugInsForProxies(const std::vector<PlugInRecordPtr>& records) {
     databaseQueue_->assertNotCurrent();
     std::vector<AXDPlugInPtr> result;
-    result.reserve(records.size());
     databaseQueue_->sync([&] {
         databaseQueue_->assertCurrent();
-        for (const auto& record : records) {
-            auto it = cache_.find(record->uuid());
-            result.push_back(it != cache_.end() ? it->second : createPlugInForProxy(record));
-        }
+        result = plugInsForProxiesLocked(records);
     });
+    return result;
+}
+
+std::vector<AXDPlugInPtr> AXDatabase::plugInsForProxiesLocked(const std::vector<PlugInRecordPtr>& records) {
+    std::vector<AXDPlugInPtr> result;
+    result.reserve(records.size());
+    for (const auto& record : records) {
+        auto it = cache_.find(record->uuid());
+        result.push_back(it != cache_.end() ? it->second : createPlugInForProxy(record));
+    }
     return result;
 }
 
@@ -55,6 +61,7 @@ AXDPlugInPtr AXDatabase::createPlugInForProxy(const PlugInRecordPtr& record) {
     if (plugIn->hasEntitlement(keys::kAutoElectEntitlement)) autoElect(*plugIn);
     purgeCachesToLimit(static_cast<int32_t>(cacheLimit()));
     cache_[*plugIn->uuid()] = plugIn;
+    keptInstalled_.reset();
     return plugIn;
 }
 
@@ -63,6 +70,7 @@ void AXDatabase::purgeCachesToLimit(int32_t limit) {
     if (cache_.size() <= static_cast<uint32_t>(limit)) return;
     log::info(logOps(), "purging cache for %d > %d", static_cast<int>(cache_.size()), limit);
     cache_.clear();
+    keptInstalled_.reset();
     workspace_->dropCaches();
 }
 
@@ -182,14 +190,56 @@ std::optional<std::set<std::string>> AXDatabase::electionFilter(const Value& ent
     return allowed;
 }
 
+namespace {
+
+// Whether a record gives no candidate; the log says why each time it is passed over.
+bool skipRecord(const PlugInRecordPtr& r) {
+    if (r->bundlePath().empty()) {
+        log::info(logOps(), "skipping vt proxy %@ with nil bundleURL", r->description());
+        return true;
+    }
+    if (const auto& app = r->containingApplication(); app && app->isPlaceholder()) {
+        log::info(logOps(), "skipping vt proxy %@ because its app is a placeholder", r->description());
+        return true;
+    }
+    return false;
+}
+
+void logInstalled(const std::vector<PlugInRecordPtr>& records) {
+    if (logVt().enabled(log::Level::Debug))
+        log::debug(logVt(), "%d installedPlugins: %@", static_cast<int>(records.size()), recordsText(records));
+}
+
+}  // namespace
+
+std::optional<std::vector<AXDPlugInPtr>> AXDatabase::keptInstalledPlugIns(uint64_t contentVersion) {
+    return databaseQueue_->syncResult([&]() -> std::optional<std::vector<AXDPlugInPtr>> {
+        databaseQueue_->assertCurrent();
+        if (!keptInstalled_ || keptInstalled_->contentVersion != contentVersion) return std::nullopt;
+        logInstalled(keptInstalled_->records);
+        for (const auto& r : keptInstalled_->skipped) (void)skipRecord(r);
+        // A record that built nothing says so again; one that builds now drops the kept answer.
+        (void)plugInsForProxiesLocked(keptInstalled_->unbuilt);
+        if (!keptInstalled_) return std::nullopt;
+        return keptInstalled_->plugIns;
+    });
+}
+
 std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
     databaseQueue_->assertNotCurrent();
     std::vector<corvane::vantry::PlugInRecordPtr> records;
     const Dictionary* tests = query.asDictionary();
-    if (!tests || tests->empty()) {
+    bool everything = !tests || tests->empty();
+    // Read before the records: should the registry change after it, the version moves on and
+    // the answer kept under this one is not given again.
+    uint64_t contentVersion = everything ? workspace_->contentVersion() : 0;
+    if (everything) {
+        if (auto kept = keptInstalledPlugIns(contentVersion)) {
+            log::debug(logOps(), "VT reported %u plug-ins (kept)", static_cast<unsigned>(kept->size()));
+            return std::move(*kept);
+        }
         records = workspace_->installedPlugIns();
-        if (logVt().enabled(log::Level::Debug))
-            log::debug(logVt(), "%d installedPlugins: %@", static_cast<int>(records.size()), recordsText(records));
+        logInstalled(records);
     } else {
         auto allowed = electionFilter(query["KSUserElection"]);
         auto filter = [&](const std::string& identifier, const Value& entitlements) {
@@ -209,28 +259,39 @@ std::vector<AXDPlugInPtr> AXDatabase::findPlugIns(const Value& query) {
             log::debug(logVt(), "%d plugin(s) matching %@ = %@", static_cast<int>(records.size()), query,
                        recordsText(records));
     }
-    size_t before = cacheCount();
+    KeptInstalled made;
+    made.contentVersion = contentVersion;
+    if (everything) made.records = records;
     std::vector<corvane::vantry::PlugInRecordPtr> usable;
     usable.reserve(records.size());
     std::unordered_set<UUID, corvane::UUIDHash> seen;
     seen.reserve(records.size());
     for (const auto& r : records) {
-        if (r->bundlePath().empty()) {
-            log::info(logOps(), "skipping vt proxy %@ with nil bundleURL", r->description());
-            continue;
-        }
-        if (const auto& app = r->containingApplication(); app && app->isPlaceholder()) {
-            log::info(logOps(), "skipping vt proxy %@ because its app is a placeholder", r->description());
+        if (skipRecord(r)) {
+            made.skipped.push_back(r);
             continue;
         }
         if (seen.insert(r->uuid()).second) usable.push_back(r);
     }
-    std::vector<AXDPlugInPtr> result;
-    for (auto& p : plugInsForProxies(usable))
-        if (p) result.push_back(std::move(p));
-    log::debug(logOps(), "VT reported %u plug-ins (cache %u/%u)", static_cast<unsigned>(result.size()),
+    size_t before = 0;
+    databaseQueue_->sync([&] {
+        databaseQueue_->assertCurrent();
+        before = cache_.size();
+        std::vector<AXDPlugInPtr> built = plugInsForProxiesLocked(usable);
+        made.plugIns.reserve(built.size());
+        for (size_t i = 0; i < built.size(); ++i) {
+            if (built[i]) {
+                made.plugIns.push_back(std::move(built[i]));
+            } else {
+                made.unbuilt.push_back(usable[i]);
+            }
+        }
+        // Kept in the same visit as the mapping: any later change of the cache drops it.
+        if (everything) keptInstalled_ = made;
+    });
+    log::debug(logOps(), "VT reported %u plug-ins (cache %u/%u)", static_cast<unsigned>(made.plugIns.size()),
                static_cast<unsigned>(before), static_cast<unsigned>(cacheCount()));
-    return result;
+    return std::move(made.plugIns);
 }
 
 uint32_t AXDatabase::cacheLimitFromText(const char* text) {
@@ -316,6 +377,7 @@ void AXDatabase::pluginsWillUninstall(const std::vector<PlugInRecordPtr>& record
                         r->identifier(), r->bundleVersion(), r->uuid().string(), r->bundlePath());
             cache_.erase(r->uuid());
         }
+        keptInstalled_.reset();
     });
     for (const auto& r : records) {
         watchers_.publish(corvane::dict({{"event", "uninstalled"}, {"plugin", AXDWatchers::summary(*r)}}));

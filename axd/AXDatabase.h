@@ -118,6 +118,23 @@ private:
     std::unique_ptr<AXDAnnotationStore> annotations_ GUARDED_BY(*databaseQueue_);
     std::vector<Value> unsavedEvents_ GUARDED_BY(*databaseQueue_);  // annotation events, until saved
     std::unordered_map<UUID, AXDPlugInPtr, corvane::UUIDHash> cache_ GUARDED_BY(*databaseQueue_);
+    // The last answer of every installed plug-in, given again while the registry's contents stay
+    // and the cache is not changed (which drops it): mapping ten thousand records to their
+    // plug-ins again costs a cache miss or two for each. What the mapping logs is logged again,
+    // and records that built no plug-in are tried again.
+    struct KeptInstalled {
+        uint64_t contentVersion = 0;
+        std::vector<corvane::vantry::PlugInRecordPtr> records;  // the registry's, as listed
+        std::vector<AXDPlugInPtr> plugIns;
+        std::vector<corvane::vantry::PlugInRecordPtr> skipped;  // passed over
+        std::vector<corvane::vantry::PlugInRecordPtr> unbuilt;  // built no plug-in
+    };
+    std::optional<KeptInstalled> keptInstalled_ GUARDED_BY(*databaseQueue_);
+    // The kept answer for `contentVersion`, or nothing when it is not current.
+    std::optional<std::vector<AXDPlugInPtr>> keptInstalledPlugIns(uint64_t contentVersion);
+    // The plug-in of each record (null where none can be built), from the cache or built.
+    std::vector<AXDPlugInPtr> plugInsForProxiesLocked(const std::vector<corvane::vantry::PlugInRecordPtr>& records)
+        REQUIRES(*databaseQueue_);
     // Last, so that it ends first: no event reaches a database being destroyed.
     corvane::vantry::Subscription subscription_;
 };

@@ -1,6 +1,9 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
+#include <filesystem>
+#include <functional>
 #include <condition_variable>
 #include <mutex>
 #include <thread>
@@ -227,6 +230,94 @@ TEST(AXDatabase, UninstallDropsTheCacheAndTellsTheDelegateOnceWithEveryRecord) {
     ASSERT_TRUE(again);
     EXPECT_NE(*again->uuid(), *plain->uuid());
     EXPECT_EQ(db.annotationForPlugIn(*again), dict({{"extension", dict({{"from", "replacer"}})}}));
+}
+
+// The answer of every installed plug-in is kept between walks. Each change below must show in
+// the next answer, and an answer given again is the same plug-ins and logs what the first logged.
+TEST(AXDatabase, EveryInstalledPlugInIsAnsweredAgainOnlyWhileNothingChanged) {
+    Fixture f;
+    ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
+    // Registered, but no plug-in: a stand-alone plug-in outside the system volume.
+    std::string loose = axtest::makeBundle(
+        f.root.path(), "Loose.appex", axtest::plugInInfo("com.example.loose", dict({{"KSExtensionProtocol", "P"}})),
+        "/bin/true");
+    ASSERT_EQ(Fixture::vantry({"register", loose}), 0);
+    // Registered, but passed over: the plug-in of an application still being installed.
+    std::string pending = axtest::makeBundle(f.root.path(), "Pending.app", axtest::appInfo("com.example.pending"), "/bin/true");
+    axtest::makeBundle(pending + "/PlugIns", "Pending.appex",
+                       axtest::plugInInfo("com.example.pending.p", dict({{"KSExtensionProtocol", "P"}})), "/bin/true");
+    ASSERT_TRUE(f.registry()->registerBundle(pending, true).ok());
+    AXDatabase db(nullptr, f.registry());
+    db.setCacheLimit(1000000);
+    auto paths = [](const std::vector<AXDPlugInPtr>& list) {
+        std::vector<std::string> out;
+        for (const auto& p : list) out.push_back(p->path());
+        return out;
+    };
+    log::CaptureSink capture;
+    auto first = db.findPlugIns(Value());
+    EXPECT_EQ(paths(first), (std::vector<std::string>{f.auto_, f.plain, f.replacer}));
+    const std::string logged[] = {"ignoring mis-configured plug-in at " + loose, "because its app is a placeholder"};
+    for (const auto& line : logged) EXPECT_EQ(capture.count(line), 1u) << line;
+    EXPECT_EQ(db.findPlugIns(Value()), first);  // the same objects
+    for (const auto& line : logged) EXPECT_EQ(capture.count(line), 2u) << line;
+
+    std::string fourth = f.app + "/PlugIns/Fourth.appex";
+    std::string other = f.root / "Other.app";
+    std::string otherPlugIn = other + "/PlugIns/Other.appex";
+    struct Change {
+        const char* what;
+        std::function<void()> make;
+        std::vector<std::string> expected;
+    };
+    const Change changes[] = {
+        {"another application registered",  // no record of the first changes
+         [&] {
+             axtest::makeBundle(f.root.path(), "Other.app", axtest::appInfo("com.example.other"), "/bin/true");
+             axtest::makeBundle(other + "/PlugIns", "Other.appex",
+                                axtest::plugInInfo("com.example.other.p", dict({{"KSExtensionProtocol", "P"}})),
+                                "/bin/true");
+             ASSERT_EQ(Fixture::vantry({"register", other}), 0);
+         },
+         {f.auto_, f.plain, f.replacer, otherPlugIn}},
+        {"a plug-in registered",
+         [&] {
+             axtest::makeBundle(f.app + "/PlugIns", "Fourth.appex",
+                                axtest::plugInInfo("com.example.fourth", dict({{"KSExtensionProtocol", "P"}})),
+                                "/bin/true");
+             ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
+         },
+         {f.auto_, fourth, f.plain, f.replacer, otherPlugIn}},
+        {"the cache purged",
+         [&] {
+             db.databaseQueue().sync([&] {
+                 db.databaseQueue().assertCurrent();
+                 db.purgeCachesToLimit(0);
+             });
+         },
+         {f.auto_, fourth, f.plain, f.replacer, otherPlugIn}},
+        {"a plug-in unregistered",
+         [&] {
+             std::filesystem::remove_all(fourth);
+             ASSERT_EQ(Fixture::vantry({"register", f.app}), 0);
+         },
+         {f.auto_, f.plain, f.replacer, otherPlugIn}},
+        {"the application unregistered", [&] { ASSERT_EQ(Fixture::vantry({"unregister", f.app}), 0); },
+         {otherPlugIn}},
+    };
+    auto before = first;
+    for (const auto& change : changes) {
+        change.make();
+        auto now = db.findPlugIns(Value());
+        EXPECT_EQ(paths(now), change.expected) << change.what;
+        EXPECT_EQ(db.findPlugIns(Value()), now) << change.what;
+        // After a purge the plug-ins are built anew: none of the objects given before comes back.
+        if (std::string(change.what).find("purged") != std::string::npos) {
+            for (const auto& p : now)
+                EXPECT_EQ(std::find(before.begin(), before.end(), p), before.end()) << p->path();
+        }
+        before = now;
+    }
 }
 
 // Calls a queue-bound method from the wrong thread on purpose; the static
