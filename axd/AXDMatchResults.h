@@ -54,12 +54,26 @@ public:
 
 private:
     static constexpr uint32_t kNone = UINT32_MAX;
+    // The chosen entries of one identifier, in answer order: `head` begins the chain through
+    // Entry::nextChosen (kNone when every entry was displaced), and `named` is an entry of the
+    // identifier, which says what the slot's key is.
+    struct Chain {
+        uint32_t hash = 0, named = kNone, head = kNone;
+    };
+    // The head of an identifier's chain. When it has none: null, or with `naming` (an entry of
+    // the identifier) a new empty chain.
+    uint32_t* chainOf(std::string_view identifier, uint32_t naming = kNone);
+    void growChains();
+
     const uint64_t flags_;
     // Every appended entry; displaced ones are skipped at the end. The keys below are views of
     // the plug-ins' own walk facts, which outlive the results as the plug-ins do.
     std::vector<Entry> order_;
-    std::unordered_map<std::string_view, uint32_t> firstChosen_;  // identifier -> chain, answer order
-    std::unordered_map<std::string_view, uint32_t> overrides_;    // replaced identifier -> replacing entry
+    // Identifier -> chain, by open addressing in a table at most half full: a walk of thousands
+    // of plug-ins makes no allocation per identifier.
+    std::vector<Chain> chains_;
+    size_t chainCount_ = 0;
+    std::unordered_map<std::string_view, uint32_t> overrides_;  // replaced identifier -> replacing entry
 };
 
 }  // namespace annexa

@@ -11,7 +11,8 @@ std::optional<std::string> AXDPlugIn::allowForClient(const AXDRpxClient& client)
 }
 
 std::optional<std::string> AXDPlugIn::allowForHost(const std::function<Value(const std::string&)>& entitlement) const {
-    Value restriction = entitlement(keys::kAllowedPlugInsEntitlement);
+    static const std::string kRestriction(keys::kAllowedPlugInsEntitlement);  // made once, not per plug-in
+    Value restriction = entitlement(kRestriction);
     if (!restriction.isNull()) {
         if (!restriction.isDictionary()) return std::string("invalid host restriction entitlement");
         if (!match(restriction)) return std::string("the host's plug-in entitlement does not allow this plug-in");

@@ -230,7 +230,7 @@ std::optional<std::string> Transaction::matchRefusal(
             auto plugIns = bundle ? bundle->plugInsPath() : std::nullopt;
             if (!plugIns || p.path().rfind(*plugIns, 0) != 0) return std::string("dedicated to another application");
         }
-        if (holds && holds->count(*p.uuid())) return std::string("held");
+        if (holds && !holds->empty() && holds->count(*p.uuid())) return std::string("held");
     }
     if (const Dictionary* tests = rules.asDictionary()) {
         for (const auto& [key, pattern] : *tests)

@@ -222,3 +222,25 @@ TEST(AXDMatchResults, AReplacementDeclaredByADisplacedFormStillNamesIt) {
     EXPECT_EQ(outcomes[candidates[0].get()], "collapsed in favour of " + x2.uuid);
     EXPECT_EQ(logged, (std::vector<std::pair<std::string, std::string>>{{x1.uuid, y.uuid}}));
 }
+
+// Results told to expect fewer candidates than come grow their table as they fill: forty
+// registrations of twenty identifiers, told none, collapse as forty expected ones do.
+TEST(AXDMatchResults, MoreCandidatesThanExpectedCollapseTheSame) {
+    std::vector<AXDPlugInPtr> candidates;
+    std::vector<std::string> newer;
+    for (int i = 0; i < 40; ++i) {
+        Drawn d{corvane::UUID::random().string(), "com.example.p" + std::to_string(i % 20), i < 20 ? "1" : "2", false,
+                100, {}};
+        candidates.push_back(plugInOf(d));
+        if (i >= 20) newer.push_back(d.uuid);
+    }
+    for (size_t expected : {size_t{0}, candidates.size()}) {
+        AXDMatchResults results(0, expected);
+        for (const auto& c : candidates)
+            if (results.admit(*c, nullptr)) results.append(*c, nullptr);
+        std::vector<std::pair<std::string, std::string>> logged;
+        std::vector<std::string> got;
+        for (const auto* entry : results.finish(logged)) got.push_back(entry->plugIn->uuid()->string());
+        EXPECT_EQ(got, newer) << "expected " << expected;
+    }
+}
