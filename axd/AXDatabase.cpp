@@ -218,8 +218,10 @@ std::optional<std::vector<AXDPlugInPtr>> AXDatabase::keptInstalledPlugIns(uint64
         if (!keptInstalled_ || keptInstalled_->contentVersion != contentVersion) return std::nullopt;
         logInstalled(keptInstalled_->records);
         for (const auto& r : keptInstalled_->skipped) (void)skipRecord(r);
-        // A record that built nothing says so again; one that builds now drops the kept answer.
-        (void)plugInsForProxiesLocked(keptInstalled_->unbuilt);
+        // A record that built nothing says so again; one that builds now drops the kept answer
+        // (and the list with it: the loop goes over a copy).
+        std::vector<PlugInRecordPtr> unbuilt = keptInstalled_->unbuilt;
+        (void)plugInsForProxiesLocked(unbuilt);
         if (!keptInstalled_) return std::nullopt;
         return keptInstalled_->plugIns;
     });
