@@ -4,6 +4,7 @@
 
 #include <sqlite3.h>
 
+#include <algorithm>
 #include <atomic>
 #include <mutex>
 
@@ -83,30 +84,36 @@ int fileUnfetch(sqlite3_file* f, sqlite3_int64 at, void* p) {
     return methodsOf(f).xUnfetch(inner(f), at, p);
 }
 
-// Version 1 for files whose own methods are version 1 (no shared memory, no mapping), else 3.
-const sqlite3_io_methods kMethodsV1 = {
-    1,          fileClose,         fileRead,    fileWrite,      fileTruncate,        fileSync, fileSize, fileLock,
-    fileUnlock, fileCheckReserved, fileControl, fileSectorSize, fileCharacteristics, nullptr,  nullptr,  nullptr,
-    nullptr,    nullptr,           nullptr};
-const sqlite3_io_methods kMethodsV3 = {3,
-                                       fileClose,
-                                       fileRead,
-                                       fileWrite,
-                                       fileTruncate,
-                                       fileSync,
-                                       fileSize,
-                                       fileLock,
-                                       fileUnlock,
-                                       fileCheckReserved,
-                                       fileControl,
-                                       fileSectorSize,
-                                       fileCharacteristics,
-                                       fileShmMap,
-                                       fileShmLock,
-                                       fileShmBarrier,
-                                       fileShmUnmap,
-                                       fileFetch,
-                                       fileUnfetch};
+// The counting methods of one version: those the file's own methods have, and no more (a method
+// the version below lacks must be absent, not forwarded to nothing).
+constexpr sqlite3_io_methods countingMethods(int version) {
+    sqlite3_io_methods m{};
+    m.iVersion = version;
+    m.xClose = fileClose;
+    m.xRead = fileRead;
+    m.xWrite = fileWrite;
+    m.xTruncate = fileTruncate;
+    m.xSync = fileSync;
+    m.xFileSize = fileSize;
+    m.xLock = fileLock;
+    m.xUnlock = fileUnlock;
+    m.xCheckReservedLock = fileCheckReserved;
+    m.xFileControl = fileControl;
+    m.xSectorSize = fileSectorSize;
+    m.xDeviceCharacteristics = fileCharacteristics;
+    if (version >= 2) {
+        m.xShmMap = fileShmMap;
+        m.xShmLock = fileShmLock;
+        m.xShmBarrier = fileShmBarrier;
+        m.xShmUnmap = fileShmUnmap;
+    }
+    if (version >= 3) {
+        m.xFetch = fileFetch;
+        m.xUnfetch = fileUnfetch;
+    }
+    return m;
+}
+const sqlite3_io_methods kMethods[] = {countingMethods(1), countingMethods(2), countingMethods(3)};
 
 int vfsOpen(sqlite3_vfs*, sqlite3_filename name, sqlite3_file* f, int flags, int* outFlags) {
     auto* counting = reinterpret_cast<CountingFile*>(f);
@@ -115,8 +122,7 @@ int vfsOpen(sqlite3_vfs*, sqlite3_filename name, sqlite3_file* f, int flags, int
                                                       : &otherSyncs;
     f->pMethods = nullptr;
     int rc = below->xOpen(below, name, inner(f), flags, outFlags);
-    if (const sqlite3_io_methods* own = inner(f)->pMethods)
-        f->pMethods = own->iVersion >= 3 ? &kMethodsV3 : &kMethodsV1;
+    if (const sqlite3_io_methods* own = inner(f)->pMethods) f->pMethods = &kMethods[std::clamp(own->iVersion, 1, 3) - 1];
     return rc;
 }
 int vfsDelete(sqlite3_vfs*, const char* name, int syncDir) {

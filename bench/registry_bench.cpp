@@ -36,21 +36,20 @@ int runRegistry(int argc, char** argv) {
     for (int a = 0; a * kPerApp < plugins; ++a) {
         std::string app = root + "/Apps/App" + std::to_string(a) + ".app";
         std::filesystem::create_directories(app + "/PlugIns");
-        (void)plist::writeXMLFile(
-            app + "/Info.plist",
-            dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)}, {"KFBundleExecutable", "app"}}));
+        (void)plist::writeXMLFile(app + "/Info.plist", dict({{"KFBundleIdentifier", "com.bench.app" + std::to_string(a)},
+                                                             {"KFBundleExecutable", "app"}}));
         for (int p = 0; p < kPerApp && a * kPerApp + p < plugins; ++p) {
             int n = a * kPerApp + p;
             std::string dir = app + "/PlugIns/P" + std::to_string(p) + ".appex";
             std::filesystem::create_directories(dir);
-            Value attrs =
-                dict({{"KSExtensionPointName", "point" + std::to_string(n % points)}, {"KSExtensionVersion", "1.0"}});
+            Value attrs = dict({{"KSExtensionPointName", "point" + std::to_string(n % points)},
+                                {"KSExtensionVersion", "1.0"}});
             (void)plist::writeXMLFile(dir + "/Info.plist",
-                                      dict({{"KFBundleIdentifier", "com.bench.plugin" + std::to_string(n)},
-                                            {"KFBundleExecutable", "plugin"},
-                                            {"KFBundleVersion", "1"},
-                                            {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
-                                                                  {"KSExtensionAttributes", attrs}})}}));
+                                dict({{"KFBundleIdentifier", "com.bench.plugin" + std::to_string(n)},
+                                      {"KFBundleExecutable", "plugin"},
+                                      {"KFBundleVersion", "1"},
+                                      {"KSExtension", dict({{"KSExtensionPointIdentifier", "com.bench.point"},
+                                                            {"KSExtensionAttributes", attrs}})}}));
         }
         apps.push_back(app);
     }
@@ -139,10 +138,10 @@ int runRegistry(int argc, char** argv) {
         apps.size(), syncsPerTransaction, logSyncsPerTransaction);
     std::printf("lookup by UUID (uncached): p50 %.1f us; by path: p50 %.1f us\n", uuidP50, pathP50);
     std::printf("query for one extension point (10 answers, uncached): p50 %.1f us\n", queryP50);
-    std::printf(
-        "RESULT registry n=%zu busy=%d register_s=%.2f db_mb=%.1f wal_mb=%.1f uuid_us=%.1f path_us=%.1f "
-        "query10_us=%.1f fsyncs_per_txn=%.2f\n",
-        all.size(), busy ? 1 : 0, registerSeconds, databaseMB, walMB, uuidP50, pathP50, queryP50, syncsPerTransaction);
+    std::printf("RESULT registry n=%zu busy=%d register_s=%.2f db_mb=%.1f wal_mb=%.1f uuid_us=%.1f path_us=%.1f "
+                "query10_us=%.1f fsyncs_per_txn=%.2f\n",
+                all.size(), busy ? 1 : 0, registerSeconds, databaseMB, walMB, uuidP50, pathP50, queryP50,
+                syncsPerTransaction);
     return 0;
 }
 
